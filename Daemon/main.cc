@@ -1,0 +1,2 @@
+// Placeholder entry until the process entry lands.
+int main() { return 1; }

@@ -1,0 +1,130 @@
+#include "Platform/Format.h"
+
+#include <cstdio>
+
+namespace tarn {
+
+namespace {
+
+enum class Length { Int, Long, Short, Char };
+
+std::string formatInteger(const std::string& spec, char conv, const FormatArg& a, Length len) {
+    // Reproduce C's truncation for the length modifier, then print at 64 bits.
+    bool isSigned = conv == 'd' || conv == 'i';
+    uint64_t raw = a.kind == FormatArg::Kind::Signed     ? static_cast<uint64_t>(a.i)
+                   : a.kind == FormatArg::Kind::Unsigned ? a.u
+                   : a.kind == FormatArg::Kind::Double   ? static_cast<uint64_t>(a.d)
+                   : a.kind == FormatArg::Kind::Pointer  ? reinterpret_cast<uintptr_t>(a.p)
+                                                         : 0;
+    if (a.kind == FormatArg::Kind::String) {
+        // A string where a number was asked for: print the text rather than guess.
+        return a.s;
+    }
+    char buf[80];
+    std::string f = spec + "ll" + conv;
+    if (isSigned) {
+        int64_t v = static_cast<int64_t>(raw);
+        if (len == Length::Int) v = static_cast<int32_t>(raw);
+        if (len == Length::Short) v = static_cast<int16_t>(raw);
+        if (len == Length::Char) v = static_cast<int8_t>(raw);
+        std::snprintf(buf, sizeof buf, f.c_str(), static_cast<long long>(v));
+    } else {
+        uint64_t v = raw;
+        if (len == Length::Int) v = static_cast<uint32_t>(raw);
+        if (len == Length::Short) v = static_cast<uint16_t>(raw);
+        if (len == Length::Char) v = static_cast<uint8_t>(raw);
+        std::snprintf(buf, sizeof buf, f.c_str(), static_cast<unsigned long long>(v));
+    }
+    return buf;
+}
+
+}  // namespace
+
+std::string formatArgs(std::string_view fmt, const FormatArg* args, size_t count) {
+    std::string out;
+    out.reserve(fmt.size() + 32);
+    size_t next = 0;
+    for (size_t i = 0; i < fmt.size(); ++i) {
+        char c = fmt[i];
+        if (c != '%') {
+            out += c;
+            continue;
+        }
+        if (i + 1 < fmt.size() && fmt[i + 1] == '%') {
+            out += '%';
+            ++i;
+            continue;
+        }
+        // %[flags][width][.precision][length]conversion
+        size_t j = i + 1;
+        std::string spec = "%";
+        while (j < fmt.size() && std::string_view("-+ #0'").find(fmt[j]) != std::string_view::npos)
+            spec += fmt[j++];
+        while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) spec += fmt[j++];
+        if (j < fmt.size() && fmt[j] == '.') {
+            spec += fmt[j++];
+            while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j])))
+                spec += fmt[j++];
+        }
+        Length len = Length::Int;
+        while (j < fmt.size() && std::string_view("hlqjztL").find(fmt[j]) != std::string_view::npos) {
+            char m = fmt[j++];
+            if (m == 'h') len = len == Length::Short ? Length::Char : Length::Short;
+            else len = Length::Long;
+        }
+        if (j >= fmt.size()) {
+            out.append(fmt.substr(i));
+            break;
+        }
+        char conv = fmt[j];
+        i = j;
+        if (next >= count) {
+            out += "(missing)";
+            continue;
+        }
+        const FormatArg& a = args[next++];
+        char buf[512];
+        switch (conv) {
+            case '@': out += a.s; break;
+            case 's': {
+                // Width and precision apply as printf would apply them.
+                if (spec == "%") {
+                    out += a.s;
+                } else {
+                    std::snprintf(buf, sizeof buf, (spec + "s").c_str(), a.s.c_str());
+                    out += buf;
+                }
+                break;
+            }
+            case 'd': case 'i': case 'u': case 'x': case 'X': case 'o': case 'c':
+                if (conv == 'c') {
+                    out += static_cast<char>(a.kind == FormatArg::Kind::Signed ? a.i : a.u);
+                } else {
+                    out += formatInteger(spec, conv, a, len);
+                }
+                break;
+            case 'f': case 'F': case 'g': case 'G': case 'e': case 'E': {
+                double v = a.kind == FormatArg::Kind::Double     ? a.d
+                           : a.kind == FormatArg::Kind::Signed   ? static_cast<double>(a.i)
+                           : a.kind == FormatArg::Kind::Unsigned ? static_cast<double>(a.u)
+                                                                 : 0.0;
+                std::snprintf(buf, sizeof buf, (spec + conv).c_str(), v);
+                out += buf;
+                break;
+            }
+            case 'p': {
+                std::snprintf(buf, sizeof buf, "%p", a.p);
+                out += buf;
+                break;
+            }
+            default:
+                // Unknown conversion: keep the text so the line still says something.
+                out.append(fmt.substr(i - (spec.size() - 1) - 1, spec.size() + 1));
+                --next;
+                break;
+        }
+    }
+    return out;
+}
+
+}  // namespace tarn

@@ -1,0 +1,52 @@
+// The platform log: structured lines by subsystem and category, and signpost
+// intervals with their durations. Goes to journald when the host runs it,
+// otherwise to stderr, and additionally to a file set with
+// PlatformLogSetFile() (the daemon's --platform-log option).
+//
+// Category "daemon" logs under subsystem "com.ostrea.tarnkeeperd", every other
+// category under "com.ostrea.keeper". Thread-safe.
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "Platform/Format.h"
+
+namespace tarn {
+
+enum class PlatformLogType { Debug, Info, Default, Error, Fault };
+
+void PlatformLogSetFile(const std::string& path);
+// Silences stderr/journald output (tests and tools); the file, if any, still gets lines.
+void PlatformLogSetQuiet(bool quiet);
+void PlatformLogWrite(const char* category, PlatformLogType type, const std::string& message);
+
+template <class... Args>
+void PlatformLog(const char* category, PlatformLogType type, std::string_view fmt,
+                 const Args&... args) {
+    PlatformLogWrite(category, type, Format(fmt, args...));
+}
+
+// A named interval. Logs "begin NAME" when made and "end NAME (duration_us=N)"
+// with its attributes when ended (or destroyed without being ended).
+class SignpostInterval {
+public:
+    SignpostInterval(const char* category, std::string name,
+                     std::vector<std::pair<std::string, std::string>> attributes = {});
+    ~SignpostInterval();
+    SignpostInterval(const SignpostInterval&) = delete;
+    SignpostInterval& operator=(const SignpostInterval&) = delete;
+
+    void end(std::vector<std::pair<std::string, std::string>> attributes = {});
+
+private:
+    const char* category_;
+    std::string name_;
+    std::chrono::steady_clock::time_point start_;
+    bool ended_ = false;
+};
+
+}  // namespace tarn

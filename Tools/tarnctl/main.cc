@@ -1,0 +1,2 @@
+// Placeholder entry until the command-line client lands.
+int main() { return 1; }
