@@ -1,0 +1,237 @@
+// TarnFileManager: the one facade through which the daemon touches the file
+// system. It runs as root on trees that clients can write to, so it is the
+// security boundary of the daemon:
+//   - trees are walked with descriptor-relative calls that never follow a link
+//     (a link planted inside a tree is handled as a link, never entered);
+//   - owner, mode and ACL changes during walks act on the entry itself
+//     (AT_SYMLINK_NOFOLLOW / O_NOFOLLOW), relative to the directory already open;
+//   - files written through writeData() are fsynced before their rename and
+//     their directory after it.
+//
+// The shared instance (defaultManager) holds no state; every operation is
+// synchronous and may run on any thread. Callers serialise work on one
+// container with the identifier locks. URLs are FileURL host paths with the
+// root prefix applied; an empty FileURL stands for "no URL" (nil).
+//
+// Errors: operations that take `TarnErrorRef* error` write it only on
+// failure; the pointer may be null. File-layer errors are POSIX error values
+// (code = errno) except the ACL builders (TarnErrorACLFailed). No operation
+// throws.
+//
+// Every mutating operation has a failpoint (Platform/Failpoints.h) that tests
+// use to inject errors or crashes.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "Daemon/TarnError.h"
+#include "Platform/FileSystem.h"
+#include "Platform/Path.h"
+
+namespace tarn {
+
+// Name of the container metadata file; the ownership and ACL passes leave any
+// path containing it alone.
+inline constexpr const char* kTarnMetadataFileName = ".com.ostrea.tarn_keeper.metadata.plist";
+
+// A data-protection class as the file system keeps it: 0 none, 1 to 4 the
+// platform classes. A distinct type only so that the creation overloads
+// taking a class cannot be confused with those taking an owner; it converts
+// to int32_t implicitly. -1 leaves the class alone.
+enum TarnDataProtectionClass : int32_t {
+    kTarnDataProtectionClassUnchanged = -1,
+    kTarnDataProtectionClassNone = 0,
+    kTarnDataProtectionClassA = 1,  // complete protection: unreadable while locked
+    kTarnDataProtectionClassB = 2,
+    kTarnDataProtectionClassC = 3,
+    kTarnDataProtectionClassD = 4,
+};
+
+// Options of writeData(), numerically those of the platform's write call.
+enum : uint64_t {
+    kTarnWriteAtomic = 0x1,
+    kTarnWriteNoFileProtection = 0x10000000,
+};
+
+// One entry of _traverseDirectory(): see FsWalkEntry in Platform/FileSystem.h.
+// parentFd/name address the entry without following links; use them (through
+// the FileSystem calls taking a directory descriptor) for anything that
+// changes the entry.
+using TarnTraversalEntry = FsWalkEntry;
+// Returns true to go on; false (optionally filling the error) stops the walk.
+using TarnTraversalBlock = std::function<bool(const TarnTraversalEntry& entry, TarnErrorRef* error)>;
+// Given the current class, answers whether to change it.
+using TarnDataProtectionPredicate = std::function<bool(int32_t currentClass)>;
+
+// The ACL of the system-users group as the daemon describes it: entries with
+// the platform's permission bits and entry flags. The Linux layer maps it onto
+// POSIX access and default entries when it is applied (TarnFileManager.cc).
+struct TarnACLEntry {
+    gid_t qualifier = 0;
+    uint32_t permissions = 0;
+    uint32_t flags = 0;
+};
+struct TarnACL {
+    size_t capacity = 0;
+    std::vector<TarnACLEntry> entries;
+};
+using TarnACLRef = std::unique_ptr<TarnACL>;
+
+// ACL permission bits and entry flags used by the system-container ACLs.
+enum : uint32_t {
+    kTarnACLReadData = 0x2,
+    kTarnACLWriteData = 0x4,
+    kTarnACLExecute = 0x8,
+    kTarnACLDelete = 0x10,
+    kTarnACLAppendData = 0x20,
+    kTarnACLDeleteChild = 0x40,
+    kTarnACLReadExtAttributes = 0x200,
+    kTarnACLWriteExtAttributes = 0x400,
+    kTarnACLChangeOwner = 0x2000,
+
+    kTarnACLPermsDirectory = 0x3FFE,
+    kTarnACLPermsFile = 0x3FBE,
+    kTarnACLPermsTopLevelSelf = 0x0624,
+
+    kTarnACLFlagInherited = 0x10,
+    kTarnACLFlagFileInherit = 0x20,
+    kTarnACLFlagDirectoryInherit = 0x40,
+    kTarnACLFlagOnlyInherit = 0x100,
+};
+
+class TarnFileManager {
+public:
+    static TarnFileManager& defaultManager();
+
+    // ---- Real paths and the child test ----
+
+    // The real URL of `url` when, after links and "..", it lies inside
+    // `ifChildOfURL` (the base itself counts); otherwise nullopt with the
+    // reason logged. A missing tail is allowed (it is appended unresolved).
+    std::optional<FileURL> realPathForURL(const FileURL& url, const FileURL& ifChildOfURL);
+    // Textual depth walk: false when the path ever climbs above the starting
+    // depth. `andEndingDepth` (optional) receives the final depth on success.
+    bool _validateSymlink(const std::optional<std::string>& path, int32_t withStartingDepth,
+                          int32_t* andEndingDepth);
+    std::optional<FileURL> _realPathForURL(const FileURL& url, bool allowNonExistentPathComponents);
+    std::optional<FileURL> _realPathWhatExistsInPath(const std::string& path);
+    // The home directory of `uid` under the root prefix, never empty; falls
+    // back to /private/var/mobile.
+    static FileURL homeDirectoryURLForPOSIXUID(uid_t uid);
+
+    // ---- Directories ----
+
+    // Owner 0 leaves the owner alone (it is used as user and group id);
+    // class -1 leaves the class alone. An existing directory is not an error
+    // and still gets class and owner.
+    bool createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
+                              TarnErrorRef* error);
+    bool createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
+                              TarnDataProtectionClass dataProtectionClass, TarnErrorRef* error);
+    bool createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
+                              uid_t owner, TarnErrorRef* error);
+    bool createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
+                              uid_t owner, TarnDataProtectionClass dataProtectionClass,
+                              TarnErrorRef* error);
+
+    // A new owner-only directory named prefix + 6 random characters ("temp."
+    // by default) inside `url`.
+    std::optional<FileURL> createTemporaryDirectoryInDirectoryURL(const FileURL& url,
+                                                                  TarnErrorRef* error);
+    std::optional<FileURL> createTemporaryDirectoryInDirectoryURL(const FileURL& url,
+                                                                  const std::string& withNamePrefix,
+                                                                  TarnErrorRef* error);
+
+    // ---- Move, copy, remove ----
+
+    // rename(); across volumes a copy followed by removal of the source.
+    bool moveItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
+    // A missing source succeeds and moves nothing.
+    bool moveItemIfExistsAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
+    // Recursive copy: data, mode, owner, times, xattrs, ACLs; links as links.
+    bool copyItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
+    bool copyItemIfExistsAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
+    bool _moveItemAtURL(const FileURL& url, const FileURL& toURL, bool failIfSrcMissing,
+                        TarnErrorRef* error);
+    bool _copyItemAtURL(const FileURL& url, const FileURL& toURL, bool failIfSrcMissing,
+                        TarnErrorRef* error);
+
+    // Recursive removal, children first, never following links; immutable
+    // items are cleared and unlinked; a missing path succeeds. The first
+    // error met decides the result (the rest of the tree is still tried).
+    bool removeItemAtURL(const FileURL& url, TarnErrorRef* error);
+
+    // ---- Files the daemon writes for itself ----
+
+    // Writes `data` to `toURL` with mode 0644 (or `mode`). With
+    // kTarnWriteAtomic: a temporary file in the same directory, fsynced,
+    // renamed into place, then the directory fsynced, so that a crash leaves
+    // the old or the new contents, never a torn file. Without file protection
+    // the file gets class 0 (readable while locked); otherwise it is left to
+    // inherit.
+    bool writeData(const std::string& data, const FileURL& toURL, uint64_t options,
+                   TarnErrorRef* error);
+    bool writeData(const std::string& data, const FileURL& toURL, uint64_t options, mode_t mode,
+                   TarnErrorRef* error);
+    // Reads a whole regular file (not through a link), at most `maxBytes`.
+    std::optional<std::string> readDataAtURL(const FileURL& url, size_t maxBytes,
+                                             TarnErrorRef* error);
+
+    // ---- Listing and traversal ----
+
+    // Names not starting with "." in directory order, as URLs below `url`.
+    // A missing directory fails with code ENOENT.
+    std::optional<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& url,
+                                                                      TarnErrorRef* error);
+    // Pre-order walk with post-order directory visits, physical, one file
+    // system. Entries with unreadable metadata stop the walk with their errno.
+    bool _traverseDirectory(const FileURL& url, TarnErrorRef* error,
+                            const TarnTraversalBlock& withBlock);
+    // Logs every item of the tree at error level (orphaned data).
+    void printDirectoryStructureAtURL(const FileURL& url);
+
+    // lstat-based; neither follows a final link. On an unexpected error both
+    // answer false.
+    bool itemExistsAtURL(const FileURL& url);
+    bool itemDoesNotExistAtURL(const FileURL& url);
+
+    // ---- Data protection ----
+
+    bool dataProtectionClassOfItemAtURL(const FileURL& url, int32_t* dataProtectionClass,
+                                        TarnErrorRef* error);
+    // Fails with EPERM while the device is locked when the current or the new
+    // class is 1. A predicate answering false ends with success and no change.
+    bool setDataProtectionClassOfItemAtURL(const FileURL& url, int32_t toClass,
+                                           const TarnDataProtectionPredicate& ifPredicate,
+                                           TarnErrorRef* error);
+
+    // ---- Ownership, ACLs, disk usage ----
+
+    // Owner/group of every item to uid/gid, mode 0755 for directories and
+    // executables, 0644 otherwise. Per-item failures are logged only.
+    bool standardizeOwnershipAtURL(const FileURL& url, uid_t toUID, gid_t GID, TarnErrorRef* error);
+    bool setTopLevelSystemContainerACLAtURL(const FileURL& url, TarnErrorRef* error);
+    bool standardizeACLsAtURL(const FileURL& url, bool isSystemContainer, TarnErrorRef* error);
+    bool standardizeACLsForSystemContainerAtURL(const FileURL& url, TarnErrorRef* error);
+    bool standardizeAllSystemContainerACLsAtURL(const FileURL& url, TarnErrorRef* error);
+    // Bytes allocated to the tree; 0 when no size can be had.
+    uint64_t fastDiskUsageForURL(const FileURL& url);
+    uint64_t diskUsageForURL(const FileURL& url);
+
+    // ACL builders (callers own the result). Failures are TarnErrorACLFailed.
+    bool _CreateSystemUserACEInACL(TarnACL* acl, uint32_t withPermissions, uint32_t andFlags,
+                                   TarnErrorRef* withError);
+    TarnACLRef _CopySystemContainerACLWithNumACEs(size_t numACEs, bool isDir, bool inheritOnly,
+                                                  TarnErrorRef* withError);
+    TarnACLRef _CopyTopLevelSystemContainerACLWithError(TarnErrorRef* error);
+
+private:
+    TarnFileManager() = default;
+};
+
+}  // namespace tarn
