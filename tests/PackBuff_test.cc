@@ -245,20 +245,6 @@ TEST(PackBuffUnpack, KeyWithStringValue) {
     EXPECT_EQ(error, 0);
 }
 
-TEST(PackBuffUnpack, UnalignedCallerBytes) {
-    PackBuff source(sb_packbuff_new(0));
-    ASSERT_EQ(sb_packbuff_pack_uint32(source.get(), 1, 0xDEADBEEF), 0);
-    ASSERT_EQ(sb_packbuff_pack_string(source.get(), 2, "odd", 3), 0);
-    std::vector<uint8_t> storage(sb_packbuff_get_size(source.get()) + 1);
-    std::memcpy(storage.data() + 1, sb_packbuff_get_bytes(source.get()), storage.size() - 1);
-    PackBuff buffer(sb_packbuff_init_with_buffer(storage.data() + 1, storage.size() - 1, true,
-                                                 SB_PACKBUFF_DEALLOC_NONE));
-    int error = 0;
-    EXPECT_EQ(sb_packbuff_unpack_uint32(buffer.get(), &error), 0xDEADBEEFu);
-    EXPECT_STREQ(sb_packbuff_unpack_string(buffer.get(), nullptr, &error), "odd");
-    EXPECT_EQ(error, 0);
-}
-
 TEST(PackBuffWrap, RejectsWhatCannotBeAnArea) {
     uint8_t storage[8] = {};
     EXPECT_EQ(sb_packbuff_init_with_buffer(nullptr, 8, true, 0), nullptr);
