@@ -1,0 +1,115 @@
+// TarnMetadata: the record of one container, and the reader and writer of its
+// hidden metadata file ".com.ostrea.tarn_keeper.metadata.plist". The file is
+// the record of truth: the container cache is rebuilt by reading these files.
+//
+// A metadata object is made mutable (TarnMutableMetadataRef), given its
+// transient/existed/url/... by its creator, and then shared between threads
+// as TarnMetadataRef (const). To change a shared one, copy() it first.
+//
+// Writing goes to "temp_metadata-<UUID>.plist" in the staging directory of
+// the container's user and class (same volume as the container), fsynced,
+// and is then renamed over the final file: a reader never sees a partial file.
+// Reading rejects anything malformed as a whole (code 29; unreadable: 12).
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "Daemon/TarnContainerClass.h"
+#include "Daemon/TarnContainerIdentity.h"
+#include "Daemon/TarnError.h"
+#include "Daemon/TarnUserIdentity.h"
+#include "Platform/Path.h"
+#include "Platform/PropertyList.h"
+
+namespace tarn {
+
+class TarnMetadata;
+using TarnMetadataRef = std::shared_ptr<const TarnMetadata>;
+using TarnMutableMetadataRef = std::shared_ptr<TarnMetadata>;
+
+// Keys of the metadata file.
+inline constexpr const char* kTarnMetadataIdentifierKey = "TarnMetadataIdentifier";
+inline constexpr const char* kTarnMetadataContentClassKey = "TarnMetadataContentClass";
+inline constexpr const char* kTarnMetadataUUIDKey = "TarnMetadataUUID";
+inline constexpr const char* kTarnMetadataVersionKey = "TarnMetadataVersion";
+inline constexpr const char* kTarnMetadataUserIdentityKey = "TarnMetadataUserIdentity";
+inline constexpr const char* kTarnMetadataInfoKey = "TarnMetadataInfo";
+inline constexpr const char* kTarnMetadataUserManagedAssetsDirNameKey =
+    "TarnMetadataUserManagedAssetsDirName";
+inline constexpr const char* kTarnMetadataPersonaKey = "TarnMetadataPersona";
+// Known keys of the info dictionary.
+inline constexpr const char* kTarnInfoContentProtectionClassKey =
+    "com.ostrea.Pallet.ContentProtectionClass";
+inline constexpr const char* kTarnInfoCachedCodeSigningInfoKey =
+    "com.ostrea.Pallet.CachedCodeSigningInfo";
+inline constexpr const char* kTarnInfoGroupContainerIDsKey = "com.ostrea.Pallet.GroupContainerIDs";
+
+class TarnMetadata {
+public:
+    // Copies user identity, UUID, class and identifier from `containerIdentity`.
+    TarnMetadata(const TarnConcreteContainerIdentityRef& containerIdentity,
+                 std::optional<PlistValue> info, FileURL url,
+                 std::optional<std::string> userManagedAssetsDirName);
+    static TarnMutableMetadataRef initWithContainerIdentity(
+        const TarnConcreteContainerIdentityRef& containerIdentity, std::optional<PlistValue> info,
+        FileURL url, std::optional<std::string> userManagedAssetsDirName);
+
+    // A mutable copy of a shared record.
+    TarnMutableMetadataRef copy() const { return std::make_shared<TarnMetadata>(*this); }
+
+    // A new concrete identity from the fields; nullptr when that fails.
+    TarnConcreteContainerIdentityRef containerIdentity() const;
+
+    // Writes to url() + the metadata file name.
+    bool writeMetadataToDiskWithError(TarnErrorRef* error) const;
+    bool writeMetadataToFileURL(const FileURL& fileURL, TarnErrorRef* error) const;
+    // The dictionary that would be written.
+    PlistValue dictionaryRepresentation() const;
+
+    // Reads the metadata of the container directory `url`.
+    static TarnMutableMetadataRef readAndValidateMetadataAtUrl(const FileURL& url,
+                                                        const TarnUserIdentityRef& forUserIdentity,
+                                                        bool checkClassPath, TarnErrorRef* error);
+    static TarnMutableMetadataRef readAndValidateMetadataAtFileUrl(
+        const FileURL& fileURL, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
+        TarnErrorRef* error);
+
+    bool transient() const { return transient_; }
+    bool existed() const { return existed_; }
+    TarnContainerClass containerClass() const { return containerClass_; }
+    const TarnUserIdentityRef& userIdentity() const { return userIdentity_; }
+    const std::string& identifier() const { return identifier_; }
+    const Uuid& uuid() const { return uuid_; }
+    const FileURL& url() const { return url_; }
+    const std::optional<std::string>& userManagedAssetsDirName() const {
+        return userManagedAssetsDirName_;
+    }
+    // A dictionary, or nullopt.
+    const std::optional<PlistValue>& info() const { return info_; }
+
+    void setTransient(bool transient) { transient_ = transient; }
+    void setExisted(bool existed) { existed_ = existed; }
+    void setUuid(const Uuid& uuid) { uuid_ = uuid; }
+    void setUrl(FileURL url) { url_ = std::move(url); }
+    void setUserManagedAssetsDirName(std::optional<std::string> name) {
+        userManagedAssetsDirName_ = std::move(name);
+    }
+    void setInfo(std::optional<PlistValue> info) { info_ = std::move(info); }
+
+    std::string description() const;
+
+private:
+    bool transient_ = false;
+    bool existed_ = false;
+    const TarnContainerClass containerClass_;
+    const TarnUserIdentityRef userIdentity_;
+    const std::string identifier_;
+    Uuid uuid_;
+    FileURL url_;
+    std::optional<std::string> userManagedAssetsDirName_;
+    std::optional<PlistValue> info_;
+};
+
+}  // namespace tarn
