@@ -1,0 +1,57 @@
+#include "Daemon/TarnCommandQueue.h"
+
+#include "Daemon/TarnError.h"
+#include "Platform/PlatformLog.h"
+
+namespace tarn {
+
+TarnCommandQueue::TarnCommandQueue()
+    : queue_(DispatchQueue::createSerial("com.ostrea.tarnkeeperd.TarnCommandQueue")) {}
+
+void TarnCommandQueue::insertCommand(std::shared_ptr<TarnCommand> command) {
+    PlatformLog("unspecified", PlatformLogType::Info, "Added command <%p; %llu> to queue",
+                static_cast<const void*>(command.get()), command->command());
+    MutexLock lock(mu_);
+    commands_.push_back(std::move(command));
+}
+
+bool TarnCommandQueue::executeNextCommandWithError(uint64_t* error) {
+    std::shared_ptr<TarnCommand> next;
+    {
+        MutexLock lock(mu_);
+        if (commands_.empty()) {
+            TarnSetError(error, TarnErrorQueueEmpty);
+            return false;
+        }
+        next = commands_.front();
+        commands_.pop_front();
+    }
+    bool ok = false;
+    uint64_t code = TarnSuccess;
+    queue_->sync([&] {
+        const void* p = next.get();
+        PlatformLog("unspecified", PlatformLogType::Info, "Executing command <%p; %llu>...", p,
+                    next->command());
+        ok = next->fromQueue(this, &code);
+        PlatformLog("unspecified", PlatformLogType::Info,
+                    "Completed command <%p; %llu>: success = %d, error = %llu", p, next->command(),
+                    ok, code);
+    });
+    if (!ok) TarnSetError(error, code);
+    return ok;
+}
+
+bool TarnCommandQueue::executeAllUntilExhaustedOrError(uint64_t* error) {
+    uint64_t code = TarnSuccess;
+    while (executeNextCommandWithError(&code)) code = TarnSuccess;
+    if (code == TarnErrorQueueEmpty) return true;
+    TarnSetError(error, code);
+    return false;
+}
+
+size_t TarnCommandQueue::TEST_count() {
+    MutexLock lock(mu_);
+    return commands_.size();
+}
+
+}  // namespace tarn

@@ -1,0 +1,49 @@
+// Deferred side effects of one request. Handlers queue commands; the request
+// processor runs them through completeWithError() after the handler and
+// before the reply. Commands run one at a time, in insertion order, on the
+// queue's own serial queue "com.ostrea.tarnkeeperd.TarnCommandQueue",
+// synchronously for the caller. A command queued by a running command runs
+// after it.
+#pragma once
+
+#include <cstdint>
+#include <deque>
+#include <memory>
+
+#include "Platform/Dispatch.h"
+#include "Platform/ThreadAnnotations.h"
+
+namespace tarn {
+
+class TarnCommandQueue;
+
+// One deferred command. `command()` is the kind number of the class.
+class TarnCommand {
+public:
+    virtual ~TarnCommand() = default;
+    virtual uint64_t command() const = 0;
+    // Runs the command on `queue`'s serial queue; returns true on success,
+    // otherwise writes a code to *error.
+    virtual bool fromQueue(TarnCommandQueue* queue, uint64_t* error) = 0;
+};
+
+class TarnCommandQueue {
+public:
+    TarnCommandQueue();
+
+    void insertCommand(std::shared_ptr<TarnCommand> command);
+    // Runs the first command. True when one ran and succeeded; *error gets 77
+    // when there was none, the command's code (1 if it set none) on failure.
+    bool executeNextCommandWithError(uint64_t* error);
+    // Runs commands until the queue is empty (true, *error untouched) or one
+    // fails (false, its code in *error; later commands stay queued).
+    bool executeAllUntilExhaustedOrError(uint64_t* error);
+    size_t TEST_count();
+
+private:
+    DispatchQueueRef queue_;  // constant after construction
+    Mutex mu_;
+    std::deque<std::shared_ptr<TarnCommand>> commands_ GUARDED_BY(mu_);
+};
+
+}  // namespace tarn

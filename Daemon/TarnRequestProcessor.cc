@@ -1,0 +1,199 @@
+#include "Daemon/TarnRequestProcessor.h"
+
+#include <pthread.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <mutex>
+#include <typeinfo>
+
+#include "Daemon/TarnClientConnection.h"
+#include "Daemon/TarnClientIdentity.h"
+#include "Daemon/TarnCommandTable.h"
+#include "Daemon/TarnError.h"
+#include "Daemon/TarnLog.h"
+#include "Platform/CodeSignRegistry.h"
+#include "Platform/Conduit.h"
+#include "Platform/PersonaRoster.h"
+#include "Platform/HostConfiguration.h"
+#include "Platform/PlatformLog.h"
+
+namespace tarn {
+
+namespace {
+
+constexpr const char* kTag = "TarnProcessConduitEvent";
+
+// The reply of the request being handled on this thread, for handlers that
+// answer from a completion.
+class ConduitDeferredReply final : public TarnDeferredReply {
+public:
+    explicit ConduitDeferredReply(conduit::MessageRef reply) : reply_(std::move(reply)) {}
+    PlistValue& body() override { return reply_->body(); }
+    void send(uint64_t code) override {
+        reply_->body().set("ReplyError", PlistValue(code));
+        if (auto remote = reply_->remoteConnection()) remote->send(reply_);
+    }
+
+private:
+    conduit::MessageRef reply_;
+};
+
+thread_local conduit::MessageRef* tCurrentReply = nullptr;
+
+struct EntitlementGate {
+    bool entitled = false;
+    bool unrestricted = false;
+    bool allowOtherIdLookup = false;
+    std::optional<PlistValue> lookup;
+    std::optional<PlistValue> wipeList;
+};
+
+EntitlementGate checkEntitlements(const TarnClientIdentityRef& identity,
+                                  const TarnCommandTableRow& row) {
+    const char* tag = "checkEntitlementsAndInitClientObject";
+    EntitlementGate g;
+    if (!identity) return g;
+    const std::string key = row.entitlement;
+    if (identity->boolValueOfEntitlement(kTarnEntitlementAllowed)) {
+        g.allowOtherIdLookup = true;
+        g.unrestricted = key != kTarnEntitlementTestability;
+    } else {
+        g.allowOtherIdLookup = identity->boolValueOfEntitlement(kTarnEntitlementOtherIdLookup);
+        if (row.lookupAllowed) {
+            if (auto* l = identity->entitlements().find(kTarnEntitlementLookup); l && l->isDict())
+                g.lookup = *l;
+        }
+    }
+    if (key == kTarnEntitlementWipeContainer) {
+        auto* w = identity->entitlements().find(key);
+        if (w && w->isArray()) {
+            g.wipeList = *w;
+            g.entitled = true;
+        } else {
+            TarnLog(kLogError, tag, "No entitled containers to wipe");
+            g.entitled = g.unrestricted;
+        }
+    } else {
+        g.entitled = g.unrestricted || identity->boolValueOfEntitlement(key);
+    }
+    return g;
+}
+
+}  // namespace
+
+std::shared_ptr<TarnDeferredReply> TarnTakeDeferredReply() {
+    if (!tCurrentReply || !*tCurrentReply) return nullptr;
+    return std::make_shared<ConduitDeferredReply>(*tCurrentReply);
+}
+
+void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
+                             const conduit::Event& event) {
+    if (event.kind != conduit::Event::Kind::Message || !event.message) return;
+    uint64_t error = TarnSuccess;
+    const PlistValue& request = event.message->body();
+    uint64_t command = 0;
+    if (const PlistValue* c = request.find("Command")) command = c->asUInt64().value_or(0);
+
+    conduit::MessageRef reply = event.message->createReply();
+    if (!reply) {
+        TarnLog(kLogError, kTag, "Dictionary does not have reply context");
+        peer->cancel();
+        return;
+    }
+
+    SignpostInterval signpost("conduit", "ConduitEventProcessing",
+                              {{"command", std::to_string(command)}});
+    std::shared_ptr<TarnClientConnection> connection;
+    const TarnCommandTableRow* row = nullptr;
+    if (command >= kTarnCommandCount) {
+        TarnLog(kLogError, kTag, "Invalid command index: %lld", command);
+        error = TarnErrorInvalidCommand;
+    } else if (gTarnCommandTable[command].command != command) {
+        TarnLog(kLogError, kTag, "Invalid command at index %llu", command);
+        error = TarnErrorInvalidCommand;
+    } else if (!gTarnCommandTable[command].handler) {
+        TarnLog(kLogError, kTag, "Invalid command handler: %lld", command);
+        error = TarnErrorInvalidCommand;
+    } else {
+        row = &gTarnCommandTable[command];
+        auto commandQueue = std::make_shared<TarnCommandQueue>();
+        // The peer's persona is current for the whole request.
+        auto codeSignInfo = TarnClientIdentity::codeSignInfoForConnection(peer);
+        PersonaRoster::setCurrentPersonaUniqueString(
+            codeSignInfo ? codeSignInfo->personaUniqueString : std::nullopt);
+        TarnClientIdentityRef identity =
+            TarnClientIdentity::clientIdentityWithConduitConnection(peer, codeSignInfo);
+        EntitlementGate gate = checkEntitlements(identity, *row);
+        if (identity && (gate.entitled || row->anyClient || gate.lookup)) {
+            // Registration of the caller's entitlements joins here with the
+            // code-signing mapping's processing of caller-registered entitlements.
+        }
+        if (row->anyClient || gate.lookup || gate.entitled) {
+            connection = TarnClientConnection::initWithClientIdentity(
+                identity, gate.entitled, gate.allowOtherIdLookup, gate.unrestricted, gate.lookup,
+                gate.wipeList, commandQueue);
+        } else {
+            TarnLog(kLogError, "checkEntitlementsAndInitClientObject",
+                    "connection attempt from pid %d (%@) is not entitled",
+                    identity ? identity->posixPID() : peer->pid(),
+                    identity ? identity->bundleIdentifier() : std::string("(null)"));
+            error = TarnErrorNotEntitled;
+        }
+        if (connection) {
+            tCurrentReply = &reply;
+            try {
+                row->handler(request, reply->body(), connection.get(), &error);
+                connection->completeWithError(&error);
+            } catch (const std::exception& e) {
+                error = TarnHandleCaughtException(kTag, &e);
+            } catch (...) {
+                error = TarnHandleCaughtException(kTag, nullptr);
+            }
+            tCurrentReply = nullptr;
+        }
+        PersonaRoster::setCurrentPersonaUniqueString(std::nullopt);
+    }
+
+    std::string client = connection ? connection->clientBundleIdentifier() : "<unknown>";
+    if (client.empty()) client = "<unknown>";
+    signpost.end({{"command", std::to_string(command)}, {"clientIdentifier", client}});
+    PlatformLog("conduit", PlatformLogType::Default, "command=%llu, client=%@, error=%llu", command,
+                client, error);
+    if (!(error == TarnSuccess && row && row->replyOnReturn == 0)) {
+        reply->body().set("ReplyError", PlistValue(error));
+        peer->send(reply);
+    }
+}
+
+uint64_t TarnHandleCaughtException(const char* function, const std::exception* exception) {
+    if (HostConfiguration::shared().internalBuild) TarnFatalExceptionReport(exception);
+    std::string name = exception ? typeid(*exception).name() : "unknown exception";
+    std::string reason = exception ? exception->what() : "";
+    auto err = TarnErrorMake(function, __LINE__, TarnErrorException, nullptr, true,
+                             Format("Got exception: %@ : %@", name, reason));
+    return err->code();
+}
+
+namespace {
+std::mutex gCrashMu;
+char gCrashMessage[4096];  // the crash message slot, read by a crash reporter or a debugger
+}  // namespace
+
+void TarnFatalExceptionReport(const std::exception* exception) {
+    std::string text = "** INTERNAL ERROR: Uncaught Exception **\nException: ";
+    char threadName[64] = {0};
+    if (pthread_getname_np(pthread_self(), threadName, sizeof threadName) == 0 && threadName[0])
+        text += std::string("<") + threadName + "> ";
+    if (exception) {
+        text += std::string(typeid(*exception).name()) + ": ";
+        text += exception->what();
+    }
+    text += "\nStack:\n";
+    gCrashMu.lock();  // never released: the process ends here
+    std::strncpy(gCrashMessage, text.c_str(), sizeof gCrashMessage - 1);
+    PlatformLogWrite("daemon", PlatformLogType::Fault, text);
+    std::abort();
+}
+
+}  // namespace tarn
