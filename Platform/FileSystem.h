@@ -87,6 +87,9 @@ int FsOpenDirectory(const std::string& path, FsFd* fd);
 // fails with ELOOP and a FIFO does not block. `dirFd` -1 means `name` is a path.
 int FsOpenItem(int dirFd, const std::string& name, FsFd* fd);
 int FsFsyncDirectoryOf(const std::string& path);
+// Opens the directory holding `path` (following links above it: the caller
+// named it) and gives the last component, for the *At calls below.
+int FsOpenParent(const std::string& path, FsFd* parent, std::string* name);
 
 enum class FsEntryType : uint8_t { Unknown, Directory, File, Symlink, Other };
 struct FsDirEntry {
@@ -100,6 +103,7 @@ int FsListDirectory(const std::string& path, std::vector<FsDirEntry>* out);
 // ---- Ownership and modes, never following a final link ----
 
 int FsChown(const std::string& path, uid_t uid, gid_t gid);  // follows (chown(2))
+int FsChownFd(int fd, uid_t uid, gid_t gid);
 int FsChownAt(int dirFd, const std::string& name, uid_t uid, gid_t gid);
 // Links have no mode on Linux: EOPNOTSUPP for a link.
 int FsChmodAt(int dirFd, const std::string& name, mode_t mode);

@@ -1,0 +1,894 @@
+#include "Daemon/TarnFileManager.h"
+
+#include <cerrno>
+#include <cstring>
+
+#include "Platform/Accounts.h"
+#include "Platform/Failpoints.h"
+#include "Platform/HostConfiguration.h"
+#include "Platform/LockState.h"
+#include "Platform/PlatformLog.h"
+#include "Platform/RootPrefix.h"
+
+namespace tarn {
+
+namespace {
+
+constexpr const char* kLogCategory = "fs";
+constexpr const char* kSystemUsersGroup = "systemusers";
+// The platform's nobody user and group (-2) is the overflow id on Linux.
+constexpr uid_t kNobodyID = 65534;
+constexpr int32_t kCompleteProtectionClass = 1;
+
+std::string errText(int err) { return FsErrorText(err); }
+
+void setError(TarnErrorRef* slot, TarnErrorRef e) {
+    if (slot) *slot = std::move(e);
+}
+
+// Components as the platform lists them: "/" first for an absolute path.
+std::vector<std::string> componentsWithRoot(const std::string& path) {
+    std::vector<std::string> out;
+    if (!path.empty() && path[0] == '/') out.emplace_back("/");
+    for (auto& c : PathComponents(path)) out.push_back(std::move(c));
+    return out;
+}
+
+std::string joinComponents(const std::vector<std::string>& comps, size_t from, size_t to) {
+    std::string out;
+    for (size_t i = from; i < to; ++i) {
+        if (comps[i] == "/") {
+            out = "/";
+            continue;
+        }
+        if (!out.empty() && out.back() != '/') out += '/';
+        out += comps[i];
+    }
+    return out;
+}
+
+// "/private/var/x" -> "/var/x"; the root prefix is taken off first so that
+// the rule sees device paths.
+std::string stripPrivate(const std::string& url) {
+    std::string p = StripRootPrefix(url);
+    if (p.starts_with("/private/")) p.erase(0, 8);
+    return p;
+}
+
+// A real host path as the device sees it. A path that left the root prefix
+// cannot be inside any container: it gets a first component no device path has.
+std::vector<std::string> deviceComponents(const std::string& real) {
+    if (RootIsSystemRoot()) return componentsWithRoot(real);
+    const std::string& root = RootPrefix();
+    bool inside = real == root || (real.starts_with(root) && real[root.size()] == '/');
+    if (inside) return componentsWithRoot(StripRootPrefix(real));
+    auto comps = componentsWithRoot(real);
+    comps.insert(comps.begin() + (comps.empty() ? 0 : 1), std::string("\x01outside-root", 13));
+    return comps;
+}
+
+bool containsMetadataName(const std::string& path) {
+    return path.find(kTarnMetadataFileName) != std::string::npos;
+}
+
+// Setting a class while locked fails where the platform's does: when the
+// item is or becomes class 1 (complete protection), whose keys are gone.
+int setProtectionClassChecked(int fd, int32_t newClass) {
+    if (LockStateDeviceIsLocked()) {
+        int32_t current = 0;
+        if (int err = FsGetProtectionClass(fd, &current)) return err;
+        if (current == kCompleteProtectionClass || newClass == kCompleteProtectionClass) return EPERM;
+    }
+    return FsSetProtectionClass(fd, newClass);
+}
+
+std::string describeURLs(const std::vector<FileURL>& urls) {
+    std::string out = "(";
+    for (size_t i = 0; i < urls.size(); ++i) {
+        if (i) out += ", ";
+        out += urls[i];
+    }
+    return out + ")";
+}
+
+// ---- Mapping of the system-users ACLs onto POSIX ACLs ----
+//
+// The daemon describes its ACLs with the platform's entry-list model: one
+// allow entry for the "systemusers" group with fine-grained permissions and
+// inheritance flags. POSIX ACLs have rwx per entry and a separate default
+// ACL on directories that new items inherit. The mapping:
+//   - read-data gives r; write-data or append gives w; execute gives x, on a
+//     file only when the file has an execute bit in its mode;
+//   - on a directory w implies x: adding items needs search as well;
+//   - an entry without inheritance flags (or only "inherited") becomes an
+//     access entry; directory/file-inherit makes it an access and a default
+//     entry; only-inherit makes it a default entry alone.
+// So the top-level directory gets access "-wx" for the group (add items,
+// nothing else) and default "rwx" (full access below), other directories get
+// access and default "rwx", and files "rw-" plus x for executables. Every ACL
+// gets a mask equal to the union of its group class, so the named entry is
+// not cut back by the mode; since chmod rewrites the mask, the mode is set
+// before the ACL.
+int rwxOf(uint32_t perms, bool isDirectory, bool executable) {
+    int out = 0;
+    if (perms & kTarnACLReadData) out |= 4;
+    if (perms & (kTarnACLWriteData | kTarnACLAppendData)) out |= 2;
+    if ((perms & kTarnACLExecute) && (isDirectory || executable)) out |= 1;
+    if (isDirectory && (out & 2)) out |= 1;
+    return out;
+}
+
+FsGroupACL posixACLFor(const TarnACL& acl, const FsStat& st) {
+    FsGroupACL out;
+    bool dir = st.isDirectory();
+    bool exec = (st.mode & 0111) != 0;
+    for (const auto& e : acl.entries) {
+        out.gid = e.qualifier;
+        int rwx = rwxOf(e.permissions, dir, exec);
+        bool inherits = (e.flags & (kTarnACLFlagFileInherit | kTarnACLFlagDirectoryInherit)) != 0;
+        bool onlyInherit = (e.flags & kTarnACLFlagOnlyInherit) != 0;
+        if (!onlyInherit) out.accessPerms = std::max(out.accessPerms, 0) | rwx;
+        if (dir && (inherits || onlyInherit)) {
+            // What is inherited is the full entry, whatever the executable
+            // bit of the directory says.
+            out.defaultPerms = std::max(out.defaultPerms, 0) | rwxOf(e.permissions, true, true);
+        }
+    }
+    return out;
+}
+
+int applyACL(int parentFd, const std::string& name, const TarnACL& acl, const FsStat& st) {
+    return FsSetGroupACLAt(parentFd, name, posixACLFor(acl, st));
+}
+
+void logSkippedOwner(const char* tag, const std::string& path) {
+    TarnLog(kLogNotice, tag, "Not privileged: leaving the owner of %s alone", path);
+}
+
+}  // namespace
+
+TarnFileManager& TarnFileManager::defaultManager() {
+    static TarnFileManager* manager = new TarnFileManager();
+    return *manager;
+}
+
+// ---- Real paths and the child test ----
+
+bool TarnFileManager::_validateSymlink(const std::optional<std::string>& path, int32_t withStartingDepth,
+                                       int32_t* andEndingDepth) {
+    if (!path) return false;
+    int64_t depth = withStartingDepth;
+    for (const auto& c : componentsWithRoot(*path)) {
+        if (c == "..") {
+            --depth;
+        } else if (c.empty() || c == "." || c == "/") {
+            // no change
+        } else {
+            ++depth;
+        }
+        if (depth < withStartingDepth) return false;
+    }
+    if (andEndingDepth) *andEndingDepth = static_cast<int32_t>(depth);
+    return true;
+}
+
+std::optional<FileURL> TarnFileManager::_realPathForURL(const FileURL& url,
+                                                        bool allowNonExistentPathComponents) {
+    std::string real, partial;
+    int err = FsRealPath(url, &real, &partial);
+    if (err == 0) return real;
+    if (err == ENOENT && allowNonExistentPathComponents) return _realPathWhatExistsInPath(url);
+    TarnLog(kLogError, __func__, "Failed to realpath %s : %s at %s", url, errText(err), partial);
+    return std::nullopt;
+}
+
+std::optional<FileURL> TarnFileManager::_realPathWhatExistsInPath(const std::string& path) {
+    auto comps = componentsWithRoot(path);
+    size_t n = comps.size();
+    if (n <= 1) return std::nullopt;
+    for (size_t k = n; k >= 2; --k) {
+        std::string prefix = joinComponents(comps, 0, k);
+        if (!itemExistsAtURL(prefix)) continue;
+        auto real = _realPathForURL(prefix, false);
+        if (!real) continue;
+        std::string rest = joinComponents(comps, k, n);
+        TarnLog(kLogDebug, __func__, "Realpathed %@ ; appending non-existing components %@", *real, rest);
+        return PathJoin(*real, rest);
+    }
+    return std::nullopt;
+}
+
+std::optional<FileURL> TarnFileManager::realPathForURL(const FileURL& url, const FileURL& ifChildOfURL) {
+    const char* tag = __func__;
+    const FileURL& baseURL = ifChildOfURL;
+    if (url.empty() || baseURL.empty()) {
+        TarnLog(kLogError, tag, "The base path %@ and/or suspicious path %@ were nil", baseURL, url);
+        return std::nullopt;
+    }
+    // The textual checks see device paths with "/private" taken off; the
+    // system calls use the URLs as given, which name the same items.
+    std::string base = stripPrivate(baseURL);
+    std::string suspicious = stripPrivate(url);
+    if (!suspicious.starts_with(base)) {
+        TarnLog(kLogError, tag, "supiscious path %@ does not contain base path %@ as a prefix", suspicious, base);
+        return std::nullopt;
+    }
+    if (PathHasDotDotComponent(suspicious)) {
+        TarnLog(kLogError, tag, "The suspicious path %@ contains '..' paths, which are invalid", suspicious);
+        return std::nullopt;
+    }
+
+    std::string target;
+    int err = FsReadLink(url, &target);
+    if (err != 0 && err != EINVAL && err != ENOENT) {
+        TarnLog(kLogError, tag, "Readlink failed: %s", errText(err));
+        return std::nullopt;
+    }
+    if (err == 0) {
+        if (!target.empty() && target[0] == '/') {
+            TarnLog(kLogError, tag, "Rejecting %@ -> %s, as absolute symlinks are not allowed", suspicious, target);
+            return std::nullopt;
+        }
+        int32_t baseDepth = 0;
+        if (!_validateSymlink(base, 0, &baseDepth)) {
+            TarnLog(kLogError, tag, "Failed to retrieve depth of %@", base);
+            return std::nullopt;
+        }
+        std::string below = suspicious.substr(base.size());
+        std::string joined = PathJoin(PathParent(below), target);
+        if (!_validateSymlink(joined, baseDepth, nullptr)) {
+            TarnLog(kLogError, tag, "Rejecting %@ -> %@, as it is points outside or to the base %@", suspicious,
+                    joined, base);
+            return std::nullopt;
+        }
+    }
+
+    auto baseReal = _realPathForURL(baseURL, false);
+    if (!baseReal) {
+        TarnLog(kLogError, tag, "Failed to retrieve realpath for base path %@ ", base);
+        return std::nullopt;
+    }
+    auto suspiciousReal = _realPathForURL(url, true);
+    if (!suspiciousReal) {
+        TarnLog(kLogError, tag, "Failed to retrieve realpath for suspicious path %@", suspicious);
+        return std::nullopt;
+    }
+
+    // The comparison also runs for a link that passed the depth walk: links
+    // further along its target are resolved by realpath and could leave the
+    // base, and the real path is what the caller will act on.
+    auto B = deviceComponents(*baseReal);
+    auto S = deviceComponents(*suspiciousReal);
+    if (B.size() < 2 || S.size() < 2) {
+        TarnLog(kLogError, tag,
+                "Rejecting %@ with base %@ because real component counts don't make sense (reals %@ ; %@)",
+                suspicious, base, *suspiciousReal, *baseReal);
+        return std::nullopt;
+    }
+    size_t i = B[1] == "private" ? 2 : 1;
+    size_t j = S[1] == "private" ? 2 : 1;
+    if (B.size() - i > S.size() - j) {
+        TarnLog(kLogError, tag,
+                "Rejecting %@ with base %@ because base component count is greater than child component count "
+                "(reals %@ ; %@)",
+                suspicious, base, *suspiciousReal, *baseReal);
+        return std::nullopt;
+    }
+    for (; i < B.size(); ++i, ++j) {
+        if (B[i] != S[j]) {
+            TarnLog(kLogError, tag, "Rejecting %@ with base %@ (reals %@ ; %@) because components diverge at %@ != %@",
+                    suspicious, base, *suspiciousReal, *baseReal, B[i], S[j]);
+            return std::nullopt;
+        }
+    }
+    return suspiciousReal;
+}
+
+FileURL TarnFileManager::homeDirectoryURLForPOSIXUID(uid_t uid) {
+    auto user = AccountUserByUID(uid);
+    if (!user) {
+        TarnLog(kLogError, __func__, "Failed to getpwuid for uid: %u", uid);
+    } else if (!user->home.empty()) {
+        std::string home = RootPath(PathStandardize(user->home));
+        std::string real;
+        // A home that does not exist yet is still the home.
+        if (FsRealPath(home, &real) == 0) return real;
+        return home;
+    }
+    TarnLog(kLogError, __func__, "Failed to get home dir using getpwuid for uid: %u", uid);
+    return RootPath("/private/var/mobile");
+}
+
+// ---- Directories ----
+
+bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
+                                           TarnErrorRef* error) {
+    return createDirectoryAtURL(url, withIntermediateDirectories, mode, 0, kTarnDataProtectionClassUnchanged,
+                                error);
+}
+
+bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
+                                           TarnDataProtectionClass dataProtectionClass, TarnErrorRef* error) {
+    return createDirectoryAtURL(url, withIntermediateDirectories, mode, 0, dataProtectionClass, error);
+}
+
+bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
+                                           uid_t owner, TarnErrorRef* error) {
+    return createDirectoryAtURL(url, withIntermediateDirectories, mode, owner, kTarnDataProtectionClassUnchanged,
+                                error);
+}
+
+bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
+                                           uid_t owner, TarnDataProtectionClass dataProtectionClass,
+                                           TarnErrorRef* error) {
+    if (auto fp = TARN_FAILPOINT("fm.createDirectory")) {
+        setError(error, TARN_POSIX_ERROR(*fp, "mkdir of %s failed: %s", url, errText(*fp)));
+        return false;
+    }
+    if (withIntermediateDirectories) {
+        int err = FsMakePath(url, mode);
+        if (err != 0 && err != EEXIST) {
+            setError(error, TARN_POSIX_ERROR(err, "mkpath of %s failed: %s", url, errText(err)));
+            return false;
+        }
+    } else {
+        int err = FsMkdir(url, mode);
+        if (err != 0 && err != EEXIST) {
+            setError(error, TARN_POSIX_ERROR(err, "mkdir of %s failed: %s", url, errText(err)));
+            return false;
+        }
+    }
+    if (dataProtectionClass == kTarnDataProtectionClassUnchanged && owner == 0) return true;
+
+    // Class and owner go through the directory's own descriptor, opened
+    // without following: a link planted at the path is refused, not chowned.
+    FsFd dir;
+    if (int err = FsOpenDirectory(url, &dir)) {
+        setError(error, TARN_POSIX_ERROR(err, "opendir of %s failed: %s", url, errText(err)));
+        return false;
+    }
+    if (dataProtectionClass != kTarnDataProtectionClassUnchanged) {
+        if (int err = setProtectionClassChecked(dir.get(), dataProtectionClass)) {
+            setError(error, TARN_POSIX_ERROR(err, "Failed to setclass(%d) on directory %s: %s",
+                                             static_cast<int32_t>(dataProtectionClass), url, errText(err)));
+            return false;
+        }
+    }
+    if (owner != 0) {
+        if (!ProcessIsPrivileged()) {
+            logSkippedOwner(__func__, url);
+        } else if (int err = FsChownFd(dir.get(), owner, owner)) {
+            setError(error, TARN_POSIX_ERROR(err, "Failed to chown(%d,%d) %s: %s", owner, owner, url, errText(err)));
+            return false;
+        }
+    }
+    return true;
+}
+
+std::optional<FileURL> TarnFileManager::createTemporaryDirectoryInDirectoryURL(const FileURL& url,
+                                                                               TarnErrorRef* error) {
+    return createTemporaryDirectoryInDirectoryURL(url, "temp.", error);
+}
+
+std::optional<FileURL> TarnFileManager::createTemporaryDirectoryInDirectoryURL(const FileURL& url,
+                                                                               const std::string& withNamePrefix,
+                                                                               TarnErrorRef* error) {
+    std::string path = PathJoin(url, Format("%@XXXXXX", withNamePrefix));
+    if (auto fp = TARN_FAILPOINT("fm.createTemporaryDirectory")) {
+        setError(error, TARN_POSIX_ERROR(*fp, "Failed to create temp dir at path %s : %s", path, errText(*fp)));
+        return std::nullopt;
+    }
+    std::string made = path;
+    if (int err = FsMkdtemp(&made)) {
+        setError(error, TARN_POSIX_ERROR(err, "Failed to create temp dir at path %s : %s", path, errText(err)));
+        return std::nullopt;
+    }
+    return made;
+}
+
+// ---- Move, copy, remove ----
+
+bool TarnFileManager::moveItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error) {
+    return _moveItemAtURL(url, toURL, true, error);
+}
+
+bool TarnFileManager::moveItemIfExistsAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error) {
+    return _moveItemAtURL(url, toURL, false, error);
+}
+
+bool TarnFileManager::copyItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error) {
+    return _copyItemAtURL(url, toURL, true, error);
+}
+
+bool TarnFileManager::copyItemIfExistsAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error) {
+    return _copyItemAtURL(url, toURL, false, error);
+}
+
+bool TarnFileManager::_moveItemAtURL(const FileURL& url, const FileURL& toURL, bool failIfSrcMissing,
+                                     TarnErrorRef* error) {
+    if (!failIfSrcMissing) {
+        int err = FsLstat(url, nullptr);
+        if (err == ENOENT) return true;
+        if (err) {
+            setError(error, TARN_POSIX_ERROR(err, "stat of %@ failed: %s", url, errText(err)));
+            return false;
+        }
+    }
+    int err = 0;
+    if (auto fp = TARN_FAILPOINT("fm.move"))
+        err = *fp;
+    else
+        err = FsRename(url, toURL);
+    if (err == 0) return true;
+    if (err != EXDEV) {
+        setError(error, TARN_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", url, toURL, errText(err)));
+        return false;
+    }
+    if (!_copyItemAtURL(url, toURL, true, error)) return false;
+    if (auto fp = TARN_FAILPOINT("fm.move.afterCopy")) {
+        setError(error, TARN_POSIX_ERROR(*fp, "rename of %@ to %@ failed: %s", url, toURL, errText(*fp)));
+        return false;
+    }
+    TarnErrorRef removeError;
+    if (!removeItemAtURL(url, &removeError))
+        TarnLog(kLogError, __func__, "Failed to remove move source after copy at %@ : %@", url, removeError);
+    return true;
+}
+
+bool TarnFileManager::_copyItemAtURL(const FileURL& url, const FileURL& toURL, bool failIfSrcMissing,
+                                     TarnErrorRef* error) {
+    int err = FsLstat(url, nullptr);
+    if (err == ENOENT && !failIfSrcMissing) return true;
+    if (err) {
+        setError(error, TARN_POSIX_ERROR(err, "stat of %@ failed: %s", url, errText(err)));
+        return false;
+    }
+    if (auto fp = TARN_FAILPOINT("fm.copy"))
+        err = *fp;
+    else
+        err = FsCopyTree(url, toURL);
+    if (err) {
+        setError(error, TARN_POSIX_ERROR(err, "copy of %@ to %@ failed: %s", url, toURL, errText(err)));
+        return false;
+    }
+    return true;
+}
+
+bool TarnFileManager::removeItemAtURL(const FileURL& url, TarnErrorRef* error) {
+    if (url.empty()) {
+        setError(error, TARN_POSIX_ERROR(EFAULT, "nil url passed to -removeItemAtURL:error:"));
+        return false;
+    }
+    if (auto fp = TARN_FAILPOINT("fm.remove")) {
+        setError(error, TARN_POSIX_ERROR(*fp, "remove of %@ failed: %s", url, errText(*fp)));
+        return false;
+    }
+    int firstError = 0;
+    auto callback = [&firstError](const FsWalkEntry& entry, int err) {
+        const char* tag = "_remove_error_callback";
+        if (err == 0) {
+            TarnLog(kLogError, tag, "remove hit error for %s but we failed to get the error number", entry.path);
+            err = ENOENT;
+        }
+        if (err != ENOENT) TarnLog(kLogError, tag, "remove hit error for %s : %s", entry.path, errText(err));
+        if (err == EPERM && entry.parentFd >= 0) {
+            bool immutable = false;
+            if (int e = FsGetImmutableAt(entry.parentFd, entry.name, &immutable)) {
+                TarnLog(kLogError, tag, "Failed to stat %s before unsetting the immutable flag: %s", entry.path,
+                        errText(e));
+            } else if (immutable) {
+                if (int e = FsSetImmutableAt(entry.parentFd, entry.name, false))
+                    TarnLog(kLogError, tag, "Failed to clear flags of %s: %s", entry.path, errText(e));
+                TarnLog(kLogNotice, tag, "Unset immutable flag on %s", entry.path);
+                bool directory = entry.type == FsWalkType::Directory;
+                int e = FsUnlinkAt(entry.parentFd, entry.name, directory);
+                if (e == 0) return true;
+                TarnLog(kLogError, tag, "unlink of %s failed: %s", entry.path, errText(e));
+            }
+        }
+        if (firstError == 0) firstError = err;
+        return err == ENOENT;
+    };
+    int err = FsRemoveTree(url, callback);
+    if (err != 0 && err != ENOENT) {
+        setError(error, TARN_POSIX_ERROR(err, "remove of %@ failed: %s", url, errText(err)));
+        return false;
+    }
+    if (firstError != 0 && firstError != ENOENT) {
+        setError(error, TARN_POSIX_ERROR(firstError, "remove of %@ failed: %s", url, errText(firstError)));
+        return false;
+    }
+    return true;
+}
+
+// ---- Files the daemon writes for itself ----
+
+bool TarnFileManager::writeData(const std::string& data, const FileURL& toURL, uint64_t options,
+                                TarnErrorRef* error) {
+    return writeData(data, toURL, options, 0644, error);
+}
+
+bool TarnFileManager::writeData(const std::string& data, const FileURL& toURL, uint64_t options, mode_t mode,
+                                TarnErrorRef* error) {
+    int err = 0;
+    if (auto fp = TARN_FAILPOINT("fm.writeData"))
+        err = *fp;
+    else
+        // Without file protection the file simply carries no class, which
+        // reads as class 0; with it, nothing is inherited on Linux either.
+        err = FsWriteFile(toURL, data, mode, (options & kTarnWriteAtomic) != 0, -1);
+    if (err) {
+        setError(error, TARN_POSIX_ERROR(err, "write of %@ failed: %s", toURL, errText(err)));
+        return false;
+    }
+    return true;
+}
+
+std::optional<std::string> TarnFileManager::readDataAtURL(const FileURL& url, size_t maxBytes,
+                                                          TarnErrorRef* error) {
+    std::string out;
+    if (int err = FsReadFile(url, maxBytes, &out)) {
+        setError(error, TARN_POSIX_ERROR(err, "read of %@ failed: %s", url, errText(err)));
+        return std::nullopt;
+    }
+    return out;
+}
+
+// ---- Listing and traversal ----
+
+std::optional<std::vector<FileURL>> TarnFileManager::urlsForItemsInDirectoryAtURL(const FileURL& url,
+                                                                                  TarnErrorRef* error) {
+    std::vector<FsDirEntry> entries;
+    if (int err = FsListDirectory(url, &entries)) {
+        if (err != ENOENT) TarnLog(kLogError, __func__, "opendir of %s failed: %s", url, errText(err));
+        setError(error, TARN_POSIX_ERROR(err, "_IterateDirectory for %@ returned %s", url, errText(err)));
+        return std::nullopt;
+    }
+    std::vector<FileURL> out;
+    out.reserve(entries.size());
+    for (const auto& e : entries) {
+        if (e.name.empty() || e.name[0] == '.') continue;
+        out.push_back(PathJoin(url, e.name));
+    }
+    return out;
+}
+
+bool TarnFileManager::_traverseDirectory(const FileURL& url, TarnErrorRef* error,
+                                         const TarnTraversalBlock& withBlock) {
+    SignpostInterval interval(kLogCategory, "TraversingDirectory");
+    uint64_t handed = 0;
+    TarnErrorRef walkError;
+    int err = FsWalk(url, [&](const FsWalkEntry& entry) {
+        if (entry.type == FsWalkType::Error) {
+            walkError = TARN_POSIX_ERROR(entry.error, "Error for path %s: %s", url, errText(entry.error));
+            return false;
+        }
+        ++handed;
+        TarnErrorRef blockError;
+        if (!withBlock(entry, &blockError)) {
+            walkError = blockError;
+            if (!walkError) walkError = TARN_POSIX_ERROR(ECANCELED, "traversal of %s stopped", url);
+            return false;
+        }
+        return true;
+    });
+    interval.end({{"count", std::to_string(handed)}});
+    if (walkError) {
+        setError(error, walkError);
+        return false;
+    }
+    if (err) {
+        setError(error, TARN_POSIX_ERROR(err, "fts_open failed for %s with error %s", url, errText(err)));
+        return false;
+    }
+    return true;
+}
+
+void TarnFileManager::printDirectoryStructureAtURL(const FileURL& url) {
+    const char* tag = __func__;
+    int err = FsWalk(url, [&](const FsWalkEntry& entry) {
+        if (entry.type == FsWalkType::Error)
+            TarnLog(kLogError, tag, "FTS returned error for %s : %s", entry.path, errText(entry.error));
+        else if (entry.type != FsWalkType::DirectoryPost)
+            TarnLog(kLogError, tag, "\tOrphaned File: %s", entry.path);
+        return true;
+    });
+    if (err) TarnLog(kLogError, tag, "fts_open failed for %@ : %s", url, errText(err));
+}
+
+bool TarnFileManager::itemExistsAtURL(const FileURL& url) {
+    int err = FsLstat(url, nullptr);
+    if (err == 0) return true;
+    if (err != ENOENT) TarnLog(kLogError, __func__, "Failed to determine if %@ exists: %s", url, errText(err));
+    return false;
+}
+
+bool TarnFileManager::itemDoesNotExistAtURL(const FileURL& url) {
+    int err = FsLstat(url, nullptr);
+    if (err == ENOENT) return true;
+    if (err != 0) TarnLog(kLogError, __func__, "Failed to determine if %@ exists: %s", url, errText(err));
+    return false;
+}
+
+// ---- Data protection ----
+
+bool TarnFileManager::dataProtectionClassOfItemAtURL(const FileURL& url, int32_t* dataProtectionClass,
+                                                     TarnErrorRef* error) {
+    FsFd fd;
+    if (int err = FsOpenItem(-1, url, &fd)) {
+        setError(error, TARN_POSIX_ERROR(err, "Failed to open %s : %s", url, errText(err)));
+        return false;
+    }
+    int32_t cls = 0;
+    if (int err = FsGetProtectionClass(fd.get(), &cls)) {
+        setError(error, TARN_POSIX_ERROR(err, "Failed to getclass of file %s: %s", url, errText(err)));
+        return false;
+    }
+    if (dataProtectionClass) *dataProtectionClass = cls;
+    return true;
+}
+
+bool TarnFileManager::setDataProtectionClassOfItemAtURL(const FileURL& url, int32_t toClass,
+                                                        const TarnDataProtectionPredicate& ifPredicate,
+                                                        TarnErrorRef* error) {
+    FsFd fd;
+    if (int err = FsOpenItem(-1, url, &fd)) {
+        setError(error, TARN_POSIX_ERROR(err, "Failed to open %s : %s", url, errText(err)));
+        return false;
+    }
+    if (ifPredicate) {
+        int32_t current = 0;
+        if (int err = FsGetProtectionClass(fd.get(), &current)) {
+            setError(error, TARN_POSIX_ERROR(err, "Failed to getclass of file %s: %s", url, errText(err)));
+            return false;
+        }
+        if (!ifPredicate(current)) return true;
+    }
+    int err = 0;
+    if (auto fp = TARN_FAILPOINT("fm.setDataProtectionClass"))
+        err = *fp;
+    else
+        err = setProtectionClassChecked(fd.get(), toClass);
+    if (err) {
+        setError(error, TARN_POSIX_ERROR(err, "Failed to setclass(%d) on file %s: %s", toClass, url, errText(err)));
+        return false;
+    }
+    return true;
+}
+
+// ---- Ownership ----
+
+bool TarnFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t toUID, gid_t GID, TarnErrorRef* error) {
+    const char* tag = __func__;
+    if (auto fp = TARN_FAILPOINT("fm.standardizeOwnership")) {
+        setError(error, TARN_POSIX_ERROR(*fp, "Could not stat %s: %s", url, errText(*fp)));
+        return false;
+    }
+    bool privileged = ProcessIsPrivileged();
+    bool skipNoted = false;
+    // Owner first: chown clears set-id bits, and the mode set next is final.
+    auto standardize = [&](int parentFd, const std::string& name, const std::string& path, const FsStat& st,
+                           bool compareGroup) {
+        bool differs = st.uid != toUID || (compareGroup && st.gid != GID);
+        if (differs) {
+            if (!privileged) {
+                if (!skipNoted) logSkippedOwner(tag, path);
+                skipNoted = true;
+            } else if (int err = FsChownAt(parentFd, name, toUID, GID)) {
+                TarnLog(kLogError, tag, "Could not chown %s: %s", path, errText(err));
+            }
+        }
+        if (st.isSymlink()) return;  // links have no mode of their own here
+        mode_t mode = (st.isDirectory() || (st.mode & 0111)) ? 0755 : 0644;
+        if (int err = FsChmodAt(parentFd, name, mode))
+            TarnLog(kLogError, tag, "Could not chmod %s: %s", path, errText(err));
+    };
+    bool ok = _traverseDirectory(url, error, [&](const TarnTraversalEntry& e, TarnErrorRef*) {
+        if (e.type == FsWalkType::DirectoryPost || containsMetadataName(e.path)) return true;
+        standardize(e.parentFd, e.name, e.path, e.st, true);
+        return true;
+    });
+    // The root once more, as it stands now.
+    FsFd parent;
+    std::string name;
+    FsStat st;
+    int err = FsOpenParent(url, &parent, &name);
+    if (err == 0) err = FsStatAt(parent.get(), name, &st);
+    if (err) {
+        setError(error, TARN_POSIX_ERROR(err, "Could not stat %s: %s", url, errText(err)));
+        return false;
+    }
+    if (!containsMetadataName(url)) standardize(parent.get(), name, url, st, false);
+    return ok;
+}
+
+// ---- ACLs ----
+
+bool TarnFileManager::_CreateSystemUserACEInACL(TarnACL* acl, uint32_t withPermissions, uint32_t andFlags,
+                                                TarnErrorRef* withError) {
+    if (!acl) {
+        setError(withError, TARN_ERROR(TarnErrorACLFailed, nullptr, "acl_create_entry() failed: %s",
+                                       errText(EINVAL)));
+        return false;
+    }
+    auto group = AccountGroupByName(kSystemUsersGroup);
+    if (!group) {
+        setError(withError, TARN_ERROR(TarnErrorACLFailed, nullptr, "group lookup for systemusers failed: %s",
+                                       errText(ENOENT)));
+        return false;
+    }
+    TarnACLEntry entry;
+    entry.qualifier = group->gid;
+    entry.permissions = withPermissions;
+    entry.flags = andFlags;
+    acl->entries.push_back(entry);
+    return true;
+}
+
+TarnACLRef TarnFileManager::_CopySystemContainerACLWithNumACEs(size_t numACEs, bool isDir, bool inheritOnly,
+                                                               TarnErrorRef* withError) {
+    auto acl = std::make_unique<TarnACL>();
+    acl->capacity = numACEs;
+    acl->entries.reserve(numACEs);
+    uint32_t perms = isDir ? kTarnACLPermsDirectory : kTarnACLPermsFile;
+    uint32_t flags = isDir ? (inheritOnly ? kTarnACLFlagOnlyInherit | kTarnACLFlagDirectoryInherit |
+                                                kTarnACLFlagFileInherit
+                                          : kTarnACLFlagDirectoryInherit | kTarnACLFlagFileInherit)
+                           : kTarnACLFlagInherited;
+    if (!_CreateSystemUserACEInACL(acl.get(), perms, flags, withError)) return nullptr;
+    return acl;
+}
+
+TarnACLRef TarnFileManager::_CopyTopLevelSystemContainerACLWithError(TarnErrorRef* error) {
+    auto acl = _CopySystemContainerACLWithNumACEs(2, true, true, error);
+    if (!acl) return nullptr;
+    if (!_CreateSystemUserACEInACL(acl.get(), kTarnACLPermsTopLevelSelf, 0, error)) return nullptr;
+    return acl;
+}
+
+bool TarnFileManager::setTopLevelSystemContainerACLAtURL(const FileURL& url, TarnErrorRef* error) {
+    auto acl = _CopyTopLevelSystemContainerACLWithError(error);
+    if (!acl) return false;
+    int err = 0;
+    if (auto fp = TARN_FAILPOINT("fm.setTopLevelACL")) err = *fp;
+    FsFd parent;
+    std::string name;
+    FsStat st;
+    if (!err) err = FsOpenParent(url, &parent, &name);
+    if (!err) err = FsStatAt(parent.get(), name, &st);
+    if (!err) err = applyACL(parent.get(), name, *acl, st);
+    if (err) {
+        setError(error, TARN_ERROR(TarnErrorACLFailed, nullptr, "Failed to set ACL on %@: %s", url, errText(err)));
+        return false;
+    }
+    return true;
+}
+
+bool TarnFileManager::standardizeACLsAtURL(const FileURL& url, bool isSystemContainer, TarnErrorRef* error) {
+    const char* tag = __func__;
+    auto topLevel = _CopyTopLevelSystemContainerACLWithError(error);
+    if (!topLevel) return false;
+    auto dirACL = _CopySystemContainerACLWithNumACEs(1, true, false, error);
+    if (!dirACL) return false;
+    auto fileACL = _CopySystemContainerACLWithNumACEs(1, false, false, error);
+    if (!fileACL) return false;
+    if (auto fp = TARN_FAILPOINT("fm.standardizeACLs")) {
+        setError(error, TARN_POSIX_ERROR(*fp, "Error for path %s: %s", url, errText(*fp)));
+        return false;
+    }
+    bool privileged = ProcessIsPrivileged();
+    bool skipNoted = false;
+    return _traverseDirectory(url, error, [&](const TarnTraversalEntry& e, TarnErrorRef*) {
+        if (e.type == FsWalkType::DirectoryPost || containsMetadataName(e.path)) return true;
+        bool isDir = e.type == FsWalkType::Directory;
+        if (e.level == 0 && isSystemContainer && isDir) {
+            if (int err = applyACL(e.parentFd, e.name, *topLevel, e.st))
+                TarnLog(kLogError, tag, "Failed to set top level ACL on dir %s: %s", e.path, errText(err));
+            return true;
+        }
+        if (e.type != FsWalkType::Symlink) {
+            // Mode before ACL: chmod rewrites the ACL mask.
+            if (int err = FsChmodAt(e.parentFd, e.name, 0))
+                TarnLog(kLogError, tag, "Could not chmod %s: %s", e.path, errText(err));
+            FsStat now = e.st;
+            now.mode &= ~07777u;
+            // The file ACL's x follows the item's executable bit as it was.
+            now.mode |= e.st.mode & 0111;
+            if (int err = applyACL(e.parentFd, e.name, isDir ? *dirACL : *fileACL, now))
+                TarnLog(kLogError, tag, "Failed to set ACL on dir %s: %s", e.path, errText(err));
+        }
+        if (!privileged) {
+            if (!skipNoted) logSkippedOwner(tag, e.path);
+            skipNoted = true;
+        } else if (int err = FsChownAt(e.parentFd, e.name, kNobodyID, kNobodyID)) {
+            TarnLog(kLogError, tag, "Could not chown %s: %s", e.path, errText(err));
+        }
+        return true;
+    });
+}
+
+bool TarnFileManager::standardizeACLsForSystemContainerAtURL(const FileURL& url, TarnErrorRef* error) {
+    return standardizeACLsAtURL(url, true, error);
+}
+
+bool TarnFileManager::standardizeAllSystemContainerACLsAtURL(const FileURL& url, TarnErrorRef* error) {
+    TarnErrorRef listError;
+    auto items = urlsForItemsInDirectoryAtURL(url, &listError);
+    if (!items) {
+        if (listError && listError->posixCode() == ENOENT) return true;
+        TarnLog(kLogError, __func__, "Failed to get items at URL%@ : %@", url, listError);
+        setError(error, listError);
+        return false;
+    }
+    if (items->empty()) return true;
+    TarnLog(kLogNotice, __func__, "Potential containers requiring ACL migration: %@", describeURLs(*items));
+    bool ok = true;
+    for (const auto& item : *items) {
+        TarnErrorRef itemError;
+        if (!standardizeACLsForSystemContainerAtURL(item, &itemError)) {
+            TarnLog(kLogError, __func__, "Failed to set system container ACL at %@: %@", item, itemError);
+            setError(error, itemError);
+            ok = false;
+        }
+    }
+    return ok;
+}
+
+// ---- Disk usage ----
+
+uint64_t TarnFileManager::fastDiskUsageForURL(const FileURL& url) {
+    if (!HostConfiguration::shared().featureEnabled("fast_container_sizing")) return diskUsageForURL(url);
+    SignpostInterval interval(kLogCategory, "CalculatingDiskUsage");
+    int64_t total = 0;
+    uint64_t descendants = 0;
+    int err = FsDirectoryStatisticsFast(url, &total, &descendants);
+    bool fallback = false;
+    if (err == ENOTSUP) {
+        if (int e = FsEnableDirectoryStatistics(url)) {
+            PlatformLog(kLogCategory, PlatformLogType::Error, "Failed to set maintain-dir-stats on %s: (err %d) %s",
+                        url, e, errText(e));
+            fallback = true;
+        } else {
+            PlatformLog(kLogCategory, PlatformLogType::Default, "Enabled fast directory sizing on [%s]", url);
+            err = FsDirectoryStatisticsFast(url, &total, &descendants);
+        }
+    }
+    if (!fallback && err) {
+        PlatformLog(kLogCategory, PlatformLogType::Error, "Failed to get dirstats on %s: (err %d) %s", url, err,
+                    errText(err));
+        fallback = true;
+    }
+    if (!fallback && total < 0) {
+        PlatformLog(kLogCategory, PlatformLogType::Error, "Invalid size (%lld) from dirstats on %s: (err %d) %s",
+                    total, url, 0, errText(0));
+        fallback = true;
+    }
+    if (fallback) {
+        interval.end();
+        return diskUsageForURL(url);
+    }
+    PlatformLog(kLogCategory, PlatformLogType::Default, "[%s]: descendants: %llu, total size: %llu", url,
+                descendants, static_cast<uint64_t>(total));
+    interval.end({{"descendants", std::to_string(descendants)}, {"size", std::to_string(total)}});
+    return static_cast<uint64_t>(total);
+}
+
+uint64_t TarnFileManager::diskUsageForURL(const FileURL& url) {
+    SignpostInterval interval(kLogCategory, "CalculatingDiskUsage");
+    if (url.empty()) {
+        PlatformLog(kLogCategory, PlatformLogType::Error, "Failed to get path to url %@", url);
+        return 0;
+    }
+    uint64_t bytes = 0, descendants = 0;
+    if (int err = FsDiskUsage(url, &bytes, &descendants)) {
+        PlatformLog(kLogCategory, PlatformLogType::Error, "Failed to get dirstats on %s using fallback: (err %d) %s",
+                    url, err, errText(err));
+        return 0;
+    }
+    PlatformLog(kLogCategory, PlatformLogType::Debug, "[%s]: descendants: %llu, total size: %llu, using fallback",
+                url, descendants, bytes);
+    interval.end({{"descendants", std::to_string(descendants)}, {"size", std::to_string(bytes)}});
+    return bytes;
+}
+
+}  // namespace tarn
