@@ -1,0 +1,190 @@
+#include "Daemon/TarnContainerIdentity.h"
+
+#include "Daemon/TarnError.h"
+#include "Daemon/TarnLog.h"
+#include "Daemon/TarnUserIdentityCache.h"
+#include "Platform/PlatformLog.h"
+
+namespace tarn {
+
+namespace {
+
+constexpr const char* kInitTag =
+    "-[TarnContainerIdentity initWithUserIdentity:identifier:containerClass:error:]";
+constexpr const char* kConcreteInitTag =
+    "-[TarnConcreteContainerIdentity initWithUUID:userIdentity:identifier:containerClass:error:]";
+
+std::optional<PlistValue> identifierValue(const std::optional<std::string>& identifier) {
+    if (!identifier) return std::nullopt;
+    return PlistValue(*identifier);
+}
+
+}  // namespace
+
+TarnContainerIdentity::TarnContainerIdentity(PrivateTag, TarnUserIdentityRef userIdentity,
+                                             std::string identifier,
+                                             TarnContainerClass containerClass)
+    : identifier_(std::move(identifier)),
+      containerClass_(containerClass),
+      userIdentity_(std::move(userIdentity)) {}
+
+bool TarnContainerIdentity::validate(const TarnUserIdentityRef& userIdentity,
+                                     const PlistValue* identifier,
+                                     TarnContainerClass containerClass, std::string* identifierOut,
+                                     uint64_t* error) {
+    if (!userIdentity) {
+        TarnLog(kLogError, kInitTag, "Invalid object: no user identity");
+        TarnSetError(error, TarnErrorInvalidArgument);
+        return false;
+    }
+    if (!identifier || identifier->isNull()) {
+        TarnLog(kLogError, kInitTag, "Invalid object: missing identifier");
+        TarnSetError(error, TarnErrorMissingIdentifier);
+        return false;
+    }
+    const std::string* text = identifier->asString();
+    if (!text) {
+        TarnLog(kLogError, kInitTag, "Invalid object: identifier = [%@]", *identifier);
+        TarnSetError(error, TarnErrorInvalidArgument);
+        return false;
+    }
+    if (!TarnContainerClassIsValid(containerClass)) {
+        TarnLog(kLogError, kInitTag, "Invalid object: container class = %llu", containerClass);
+        TarnSetError(error, TarnErrorInvalidArgument);
+        return false;
+    }
+    *identifierOut = *text;
+    return true;
+}
+
+TarnContainerIdentityRef TarnContainerIdentity::containerIdentityWithUserIdentity(
+    TarnUserIdentityRef userIdentity, const PlistValue* identifier,
+    TarnContainerClass containerClass, uint64_t* error) {
+    std::string text;
+    if (!validate(userIdentity, identifier, containerClass, &text, error)) return nullptr;
+    return std::make_shared<const TarnContainerIdentity>(PrivateTag{}, std::move(userIdentity),
+                                                         std::move(text), containerClass);
+}
+
+TarnContainerIdentityRef TarnContainerIdentity::containerIdentityWithUserIdentity(
+    TarnUserIdentityRef userIdentity, std::optional<std::string> identifier,
+    TarnContainerClass containerClass, uint64_t* error) {
+    auto value = identifierValue(identifier);
+    return containerIdentityWithUserIdentity(std::move(userIdentity), value ? &*value : nullptr,
+                                             containerClass, error);
+}
+
+TarnContainerIdentityRef TarnContainerIdentity::initWithUserIdentity(
+    TarnUserIdentityRef userIdentity, std::optional<std::string> identifier,
+    TarnContainerClass containerClass, uint64_t* error) {
+    return containerIdentityWithUserIdentity(std::move(userIdentity), std::move(identifier),
+                                             containerClass, error);
+}
+
+TarnContainerIdentityRef TarnContainerIdentity::containerIdentityWithIdentifier(
+    std::optional<std::string> identifier, TarnContainerClass containerClass, uint64_t* error) {
+    if (TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
+        PlatformLog("default", PlatformLogType::Fault,
+                    "Attempt to create a container identity without a user identity when one is "
+                    "required; identifier = [%@], class = %llu",
+                    identifier, containerClass);
+        TarnSetError(error, TarnErrorInvalidArgument);
+        return nullptr;
+    }
+    return containerIdentityWithUserIdentity(TarnUserIdentityCache::defaultUserIdentity(),
+                                             std::move(identifier), containerClass, error);
+}
+
+bool TarnContainerIdentity::isEqualToContainerIdentity(const TarnContainerIdentity& other) const {
+    return containerClass_ == other.containerClass_ && identifier_ == other.identifier_ &&
+           userIdentity_->isEqualToUserIdentity(*other.userIdentity_);
+}
+
+bool TarnContainerIdentity::isEqual(const TarnContainerIdentity& other) const {
+    return this == &other || isEqualToContainerIdentity(other);
+}
+
+size_t TarnContainerIdentity::hash() const {
+    return std::hash<std::string>()(identifier_) ^ userIdentity_->hash() ^
+           static_cast<size_t>(containerClass_);
+}
+
+std::string TarnContainerIdentity::description() const {
+    return Format("<%@: %p; userIdentity = %@, identifier = %@, class = %llu>",
+                  "TarnContainerIdentity", static_cast<const void*>(this),
+                  userIdentity_->shortDescription(), identifier_, containerClass_);
+}
+
+// ---- TarnConcreteContainerIdentity ----
+
+TarnConcreteContainerIdentity::TarnConcreteContainerIdentity(PrivateTag, Uuid uuid,
+                                                             TarnUserIdentityRef userIdentity,
+                                                             std::string identifier,
+                                                             TarnContainerClass containerClass)
+    : TarnContainerIdentity(PrivateTag{}, std::move(userIdentity), std::move(identifier),
+                            containerClass),
+      uuid_(uuid) {}
+
+TarnConcreteContainerIdentityRef TarnConcreteContainerIdentity::containerIdentityWithUUID(
+    const PlistValue* uuid, TarnUserIdentityRef userIdentity, const PlistValue* identifier,
+    TarnContainerClass containerClass, uint64_t* error) {
+    std::string text;
+    if (!validate(userIdentity, identifier, containerClass, &text, error)) return nullptr;
+    // Only a UUID value will do: a string in UUID form is a caller's mistake.
+    if (!uuid || !uuid->isUuid()) {
+        TarnLog(kLogError, kConcreteInitTag, "Invalid object: uuid = [%@]",
+                uuid ? uuid->description() : std::string("(null)"));
+        TarnSetError(error, TarnErrorInvalidArgument);
+        return nullptr;
+    }
+    return std::make_shared<const TarnConcreteContainerIdentity>(
+        PrivateTag{}, *uuid->asUuid(), std::move(userIdentity), std::move(text), containerClass);
+}
+
+TarnConcreteContainerIdentityRef TarnConcreteContainerIdentity::containerIdentityWithUUID(
+    std::optional<Uuid> uuid, TarnUserIdentityRef userIdentity,
+    std::optional<std::string> identifier, TarnContainerClass containerClass, uint64_t* error) {
+    auto idValue = identifierValue(identifier);
+    std::optional<PlistValue> uuidValue;
+    if (uuid) uuidValue = PlistValue(*uuid);
+    return containerIdentityWithUUID(uuidValue ? &*uuidValue : nullptr, std::move(userIdentity),
+                                     idValue ? &*idValue : nullptr, containerClass, error);
+}
+
+TarnConcreteContainerIdentityRef TarnConcreteContainerIdentity::initWithUUID(
+    std::optional<Uuid> uuid, TarnUserIdentityRef userIdentity,
+    std::optional<std::string> identifier, TarnContainerClass containerClass, uint64_t* error) {
+    return containerIdentityWithUUID(uuid, std::move(userIdentity), std::move(identifier),
+                                     containerClass, error);
+}
+
+bool TarnConcreteContainerIdentity::isEqualToConcreteContainerIdentity(
+    const TarnConcreteContainerIdentity& other) const {
+    return uuid_ == other.uuid_ && isEqualToContainerIdentity(other);
+}
+
+bool TarnConcreteContainerIdentity::isEqual(const TarnContainerIdentity& other) const {
+    if (this == &other) return true;
+    auto* concrete = dynamic_cast<const TarnConcreteContainerIdentity*>(&other);
+    return concrete && isEqualToConcreteContainerIdentity(*concrete);
+}
+
+size_t TarnConcreteContainerIdentity::hash() const {
+    size_t h = 0;
+    for (uint8_t b : uuid_.bytes) h = h * 131 + b;
+    return TarnContainerIdentity::hash() ^ h;
+}
+
+std::string TarnConcreteContainerIdentity::description() const {
+    return Format("<%@: %p; userIdentity = %@, identifier = %@, class = %llu, uuid = %@>",
+                  "TarnConcreteContainerIdentity", static_cast<const void*>(this),
+                  userIdentity()->shortDescription(), identifier(), containerClass(),
+                  uuid_.string());
+}
+
+TarnContainerIdentityRef TarnConcreteContainerIdentity::baseIdentity() const {
+    return std::make_shared<const TarnContainerIdentity>(PrivateTag{}, userIdentity(), identifier(),
+                                                         containerClass());
+}
+
+}  // namespace tarn

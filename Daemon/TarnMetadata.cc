@@ -1,0 +1,253 @@
+#include "Daemon/TarnMetadata.h"
+
+#include "Daemon/TarnFileManager.h"
+#include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnLog.h"
+#include "Daemon/TarnPropertyListFile.h"
+#include "Daemon/TarnUserIdentityCache.h"
+#include "Platform/PlatformLog.h"
+
+namespace tarn {
+
+namespace {
+
+std::string describe(const PlistValue* v) { return v ? v->description() : "(null)"; }
+
+}  // namespace
+
+TarnMetadata::TarnMetadata(const TarnConcreteContainerIdentityRef& containerIdentity,
+                           std::optional<PlistValue> info, FileURL url,
+                           std::optional<std::string> userManagedAssetsDirName)
+    : containerClass_(containerIdentity->containerClass()),
+      userIdentity_(containerIdentity->userIdentity()),
+      identifier_(containerIdentity->identifier()),
+      uuid_(containerIdentity->uuid()),
+      url_(std::move(url)),
+      userManagedAssetsDirName_(std::move(userManagedAssetsDirName)),
+      info_(std::move(info)) {}
+
+TarnMutableMetadataRef TarnMetadata::initWithContainerIdentity(
+    const TarnConcreteContainerIdentityRef& containerIdentity, std::optional<PlistValue> info,
+    FileURL url, std::optional<std::string> userManagedAssetsDirName) {
+    if (!containerIdentity) return nullptr;
+    return std::make_shared<TarnMetadata>(containerIdentity, std::move(info), std::move(url),
+                                          std::move(userManagedAssetsDirName));
+}
+
+TarnConcreteContainerIdentityRef TarnMetadata::containerIdentity() const {
+    return TarnConcreteContainerIdentity::containerIdentityWithUUID(uuid_, userIdentity_,
+                                                                    identifier_, containerClass_,
+                                                                    nullptr);
+}
+
+PlistValue TarnMetadata::dictionaryRepresentation() const {
+    PlistDict d;
+    if (info_) d[kTarnMetadataInfoKey] = *info_;
+    d[kTarnMetadataContentClassKey] = PlistValue(containerClass_);
+    if (TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass_) && userIdentity_) {
+        d[kTarnMetadataUserIdentityKey] = userIdentity_->plist();
+    }
+    d[kTarnMetadataIdentifierKey] = PlistValue(identifier_);
+    d[kTarnMetadataUUIDKey] = PlistValue(uuid_.string());
+    d[kTarnMetadataVersionKey] = PlistValue("2");
+    if (userManagedAssetsDirName_) {
+        d[kTarnMetadataUserManagedAssetsDirNameKey] = PlistValue(*userManagedAssetsDirName_);
+    }
+    return PlistValue(std::move(d));
+}
+
+bool TarnMetadata::writeMetadataToDiskWithError(TarnErrorRef* error) const {
+    return writeMetadataToFileURL(PathJoin(url_, kTarnMetadataFileName), error);
+}
+
+bool TarnMetadata::writeMetadataToFileURL(const FileURL& fileURL, TarnErrorRef* error) const {
+    const PlistValue dictionary = dictionaryRepresentation();
+    // Staged on the container's own volume so that the final move is one rename.
+    const FileURL temp = PathJoin(
+        TarnGlobalConfiguration::sharedInstance().stagingDirectoryURLForUserIdentity(userIdentity_,
+                                                                                     containerClass_),
+        Format("temp_metadata-%@.plist", uuid_.string()));
+    PlatformLog("metadata", PlatformLogType::Debug, "[%s] Writing metadata to [%@]: %@ => %@",
+                __func__, fileURL, *this, dictionary);
+
+    // Atomic as well as unprotected: the bytes are fsynced before any rename,
+    // so a power cut cannot leave an empty metadata file behind the final move.
+    TarnErrorRef underlying;
+    if (!Tarn_writeToURL(dictionary, temp, kTarnWriteAtomic | kTarnWriteNoFileProtection,
+                         &underlying)) {
+        auto e = TARN_ERROR(TarnErrorWriteFailed, underlying,
+                            "Failed to write metadata dictionary to URL %@ : %@:%ld", temp,
+                            underlying ? underlying->domain() : std::string("(null)"),
+                            underlying ? static_cast<long>(underlying->code()) : 0L);
+        if (error) *error = std::move(e);
+        return false;
+    }
+    if (!TarnFileManager::defaultManager().moveItemAtURL(temp, fileURL, &underlying)) {
+        auto e = TARN_ERROR(TarnErrorWriteFailed, underlying,
+                            "Failed to move metadata from staging: %@ to final: %@", temp, fileURL);
+        // The old file is still in place; the stray temporary one is only litter.
+        (void)TarnFileManager::defaultManager().removeItemAtURL(temp, nullptr);
+        if (error) *error = std::move(e);
+        return false;
+    }
+    return true;
+}
+
+TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtUrl(
+    const FileURL& url, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
+    TarnErrorRef* error) {
+    return readAndValidateMetadataAtFileUrl(PathJoin(url, kTarnMetadataFileName), forUserIdentity,
+                                            checkClassPath, error);
+}
+
+TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtFileUrl(
+    const FileURL& fileURL, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
+    TarnErrorRef* error) {
+    auto fail = [error](TarnErrorRef e) -> TarnMutableMetadataRef {
+        if (error) *error = std::move(e);
+        return nullptr;
+    };
+
+    auto dictionary = Tarn_dictionaryWithContentsOfURL(fileURL, 0, nullptr);
+    if (!dictionary) {
+        return fail(TARN_ERROR(TarnErrorReadFailed, nullptr, "Failed to read metadata at URL %@",
+                               fileURL));
+    }
+    PlistValue& dict = *dictionary;
+
+    const PlistValue* identifierValue = dict.find(kTarnMetadataIdentifierKey);
+    if (!identifierValue || !identifierValue->isString()) {
+        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata Identifier: %@ at %@",
+                               describe(identifierValue), fileURL));
+    }
+    const std::string identifier = *identifierValue->asString();
+
+    const PlistValue* uuidValue = dict.find(kTarnMetadataUUIDKey);
+    if (!uuidValue || !uuidValue->isString()) {
+        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                               "Invalid metadata UUID String: %@ at %@", describe(uuidValue), fileURL));
+    }
+    std::optional<Uuid> uuid = Uuid::parse(*uuidValue->asString());
+    if (!uuid) {
+        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata UUID: %@ at %@",
+                               *uuidValue->asString(), fileURL));
+    }
+
+    const PlistValue* classValue = dict.find(kTarnMetadataContentClassKey);
+    if (!classValue || !classValue->isNumber()) {
+        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata Class: %@ at %@",
+                               describe(classValue), fileURL));
+    }
+    auto classNumber = classValue->asInt64();
+    if (!classValue->isInteger() || !classNumber || !TarnContainerClassIsValid(*classNumber)) {
+        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                               "Invalid metadata Content Class: %ld at %@",
+                               static_cast<long>(classNumber.value_or(-1)), fileURL));
+    }
+    const TarnContainerClass containerClass = static_cast<TarnContainerClass>(*classNumber);
+
+    TarnUserIdentityCache& cache = TarnUserIdentitySharedCache::sharedInstance();
+    TarnUserIdentityRef owner;
+    if (!TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
+        owner = TarnUserIdentityCache::defaultUserIdentity();
+    } else {
+        if (!forUserIdentity) {
+            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                                   "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
+                                   describe(dict.find(kTarnMetadataUserIdentityKey)), "(null)",
+                                   identifier, fileURL, uint64_t{TarnSuccess}));
+        }
+        const uint32_t expectedUID = forUserIdentity->posixUIDForContainerClass(containerClass);
+        if (TarnContainerClassIsPerUser(containerClass)) {
+            const PlistValue* persona = dict.find(kTarnMetadataPersonaKey);
+            if (!persona) {
+                dict.set(kTarnMetadataPersonaKey, PlistValue(expectedUID));
+            } else if (persona->asUInt64() != std::optional<uint64_t>(expectedUID) ||
+                       !persona->isInteger()) {
+                return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                                       "Incorrect UserId: %@, expecting: %u for %@ at %@",
+                                       persona->description(), expectedUID, identifier, fileURL));
+            }
+        }
+        const PlistValue* stored = dict.find(kTarnMetadataUserIdentityKey);
+        if (!stored) {
+            // Written before identities were stored: the owner's uid is all we have.
+            const PlistValue* persona = dict.find(kTarnMetadataPersonaKey);
+            const uint32_t uid = persona ? static_cast<uint32_t>(persona->asUInt64().value_or(0))
+                                         : expectedUID;
+            owner = cache.userIdentityForPersonalPersonaWithUID(uid, uid);
+            if (!owner) {
+                return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                                       "Invalid metadata User Identity: %@ for %@ at %@: %llu",
+                                       "(null)", identifier, fileURL, uint64_t{TarnSuccess}));
+            }
+        } else {
+            uint64_t code = TarnSuccess;
+            owner = TarnUserIdentity::userIdentityWithPlist(*stored, cache, &code);
+            if (!owner) {
+                return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                                       "Invalid metadata User Identity: %@ for %@ at %@: %llu",
+                                       *stored, identifier, fileURL, code));
+            }
+            if (!owner->isEqualToUserIdentity(*forUserIdentity)) {
+                return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                                       "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
+                                       owner, forUserIdentity, identifier, fileURL, code));
+            }
+        }
+    }
+
+    std::optional<PlistValue> info;
+    if (const PlistValue* infoValue = dict.find(kTarnMetadataInfoKey)) {
+        if (!infoValue->isDict()) {
+            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata Info: %@ at %@",
+                                   *infoValue, fileURL));
+        }
+        info = *infoValue;
+    }
+
+    std::optional<std::string> userManagedAssetsDirName;
+    if (const PlistValue* name = dict.find(kTarnMetadataUserManagedAssetsDirNameKey)) {
+        if (!name->isString()) {
+            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                                   "Invalid metadata User Managed Dir Name String: %@ at %@", *name,
+                                   fileURL));
+        }
+        userManagedAssetsDirName = *name->asString();
+    }
+
+    const FileURL containerURL = PathParent(fileURL);
+    if (checkClassPath) {
+        const FileURL classDirectory = PathParent(containerURL);
+        const FileURL base = PathParent(PathParent(classDirectory));
+        const FileURL expected =
+            PathJoin(base, TarnContainerClassRelativeDirectory(containerClass));
+        if (classDirectory != expected) {
+            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                                   "Invalid metadata-URLs should match: %@ : %@", fileURL, expected));
+        }
+    }
+
+    uint64_t code = TarnSuccess;
+    auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
+        *uuid, owner, identifier, containerClass, &code);
+    if (!identity) {
+        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                               "Could not create user identity from %@: %llu", fileURL, code));
+    }
+    auto metadata = std::make_shared<TarnMetadata>(identity, std::move(info), containerURL,
+                                                   std::move(userManagedAssetsDirName));
+    PlatformLog("metadata", PlatformLogType::Debug, "[%s] Read metadata from [%@]: %@ <= %@",
+                __func__, fileURL, *metadata, dict);
+    return metadata;
+}
+
+std::string TarnMetadata::description() const {
+    return Format(
+        "<%@: %p; userIdentity = %@, uuid = %@, containerClass = %llu, identifier = %@, info = %@, "
+        "url = %@, userManagedAssetsDirName = %@>",
+        "TarnMetadata", static_cast<const void*>(this), userIdentity_, uuid_.string(),
+        containerClass_, identifier_, info_, url_, userManagedAssetsDirName_);
+}
+
+}  // namespace tarn

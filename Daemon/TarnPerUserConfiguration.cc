@@ -1,0 +1,101 @@
+#include "Daemon/TarnPerUserConfiguration.h"
+
+#include "Daemon/TarnFileManager.h"
+#include "Daemon/TarnLog.h"
+#include "Platform/PlatformLog.h"
+
+namespace tarn {
+
+namespace {
+constexpr mode_t kDirectoryMode = 0755;
+}  // namespace
+
+TarnPerUserConfiguration::TarnPerUserConfiguration(TarnUserIdentityRef userIdentity)
+    : userIdentity_(std::move(userIdentity)),
+      userHomeDirectory_(userIdentity_ ? userIdentity_->homeDirectoryURL() : FileURL()) {
+    if (userHomeDirectory_.empty()) {
+        PlatformLog("default", PlatformLogType::Fault, "Home directory cannot be nil: %@",
+                    userIdentity_);
+    }
+}
+
+std::shared_ptr<TarnPerUserConfiguration> TarnPerUserConfiguration::initWithUserIdentity(
+    TarnUserIdentityRef userIdentity) {
+    return std::make_shared<TarnPerUserConfiguration>(std::move(userIdentity));
+}
+
+FileURL TarnPerUserConfiguration::directoryGetter(std::optional<FileURL>* slot, const FileURL& url,
+                                                  const char* failureFormat) {
+    std::lock_guard<std::recursive_mutex> guard(lock_);
+    if (!*slot) *slot = url;
+    TarnErrorRef error;
+    const uid_t owner = userIdentity_ ? userIdentity_->posixUID() : 0;
+    if (!TarnFileManager::defaultManager().createDirectoryAtURL(**slot, true, kDirectoryMode, owner,
+                                                                &error)) {
+        TarnLog(kLogError, "-[TarnPerUserConfiguration directory]", failureFormat, **slot, error);
+    }
+    return **slot;
+}
+
+FileURL TarnPerUserConfiguration::userBaseDirectory() {
+    return directoryGetter(&userBaseDirectory_, PathJoin(userHomeDirectory_, "Containers"),
+                           "Failed to create user base dir at \"%@\": %@");
+}
+
+FileURL TarnPerUserConfiguration::transientDirectory() {
+    std::lock_guard<std::recursive_mutex> guard(lock_);
+    return directoryGetter(&transientDirectory_, PathJoin(userBaseDirectory(), "Temp"),
+                           "Failed to create transient dir at \"%@\": %@");
+}
+
+FileURL TarnPerUserConfiguration::stagingDirectory() {
+    std::lock_guard<std::recursive_mutex> guard(lock_);
+    return directoryGetter(&stagingDirectory_, PathJoin(userBaseDirectory(), "Staging"),
+                           "Failed to create staging dir at \"%@\": %@");
+}
+
+FileURL TarnPerUserConfiguration::libraryDirectory() {
+    return directoryGetter(&libraryDirectory_, PathJoin(userHomeDirectory_, "Library/TarnKeeper"),
+                           "Failed to create user library dir at \"%@\": %@");
+}
+
+FileURL TarnPerUserConfiguration::systemContainerBackupBaseDirectory() const {
+    return PathJoin(userHomeDirectory_, "Library/Backup/SystemContainers");
+}
+
+FileURL TarnPerUserConfiguration::systemContainerBackupDirectory() const {
+    return PathJoin(systemContainerBackupBaseDirectory(), "Data");
+}
+
+FileURL TarnPerUserConfiguration::systemGroupContainerBackupDirectory() const {
+    return PathJoin(systemContainerBackupBaseDirectory(), "Shared");
+}
+
+FileURL TarnPerUserConfiguration::oldLoggingPath() const {
+    return PathJoin(userHomeDirectory_, "Library/Logs/TarnKeeper");
+}
+
+std::optional<FileURL> TarnPerUserConfiguration::containerDirectoryURLForContentClass(
+    TarnContainerClass contentClass, bool transient) {
+    const char* tag = "-[TarnPerUserConfiguration containerDirectoryURLForContentClass:transient:]";
+    if (!TarnContainerClassIsPerUser(contentClass)) {
+        TarnLog(kLogError, tag, "Invalid class for a per user container directory: %llu",
+                contentClass);
+        return std::nullopt;
+    }
+    std::lock_guard<std::recursive_mutex> guard(lock_);
+    FileURL parent = transient ? transientDirectory() : userBaseDirectory();
+    FileURL url = PathJoin(parent, TarnContainerClassRelativeDirectory(contentClass));
+    TarnErrorRef error;
+    if (!TarnFileManager::defaultManager().createDirectoryAtURL(url, true, kDirectoryMode,
+                                                                userIdentity_->posixUID(), &error)) {
+        TarnLog(kLogError, tag, "Failed to create container dir at \"%@\": %@", url, error);
+    }
+    return url;
+}
+
+bool TarnPerUserConfiguration::existsUserBaseDirectory() const {
+    return TarnFileManager::defaultManager().itemExistsAtURL(userHomeDirectory_);
+}
+
+}  // namespace tarn
