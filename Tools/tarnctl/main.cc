@@ -1,2 +1,64 @@
-// Placeholder entry until the command-line client lands.
-int main() { return 1; }
+// tarnctl: the command-line client of tarnkeeperd.
+#include <CLI/CLI.hpp>
+
+#include "Platform/PlatformLog.h"
+#include "Tools/tarnctl/Subcommands.h"
+
+namespace tarnctl {
+namespace {
+
+// Every subcommand, in the order --help lists them. Add a line per new file.
+constexpr SubcommandSetup kSubcommands[] = {
+    SetupSendCommand,
+};
+
+constexpr const char* kFooter = R"(JSON mapping (both ways):
+  string                 <-> string
+  non-negative integer   <-> uint64
+  negative integer       <-> int64
+  true / false           <-> bool
+  array                  <-> array
+  object                 <-> dictionary
+  {"$uuid": "8-4-4-4-12"} <-> uuid
+  {"$int64": n}          <-> int64 that is not negative
+  {"$data": "base64"}    <-> data
+Fractions, exponents and null are refused.
+
+Exit codes:
+  0  a reply arrived (whatever its "ReplyError")
+  1  the request is not valid JSON or cannot be sent
+  2  command-line usage error
+  3  the daemon cannot be reached
+  4  no reply: timeout, connection closed, or a malformed reply
+
+Example:
+  tarnctl --root /tmp/scratch send '{"Command": 27}')";
+
+}  // namespace
+}  // namespace tarnctl
+
+int main(int argc, char** argv) {
+    using namespace tarnctl;
+    tarn::PlatformLogSetQuiet(true);  // errors reach the user on stderr, once
+    CLI::App app{"tarnctl: send requests to tarnkeeperd over Conduit and print the replies."};
+    app.footer(kFooter);
+    app.require_subcommand(1);
+    app.fallthrough();
+    Options options;
+    auto* root = app.add_option("--root", options.root,
+                                "Root prefix the daemon runs under; the socket is "
+                                "DIR/run/com.ostrea.tarnkeeperd.socket");
+    auto* socket = app.add_option("--socket", options.socket, "Path of the daemon's socket");
+    root->excludes(socket);
+    app.add_option("--timeout", options.timeoutSeconds, "Seconds to wait for a reply")
+        ->default_val(30)
+        ->check(CLI::PositiveNumber);
+    for (SubcommandSetup setup : kSubcommands) setup(app, options);
+    try {
+        app.parse(argc, argv);
+    } catch (const CLI::ParseError& e) {
+        const int code = app.exit(e);
+        return code == 0 ? kExitOk : kExitUsage;
+    }
+    return options.exitCode;
+}

@@ -1,0 +1,587 @@
+#include "Platform/Conduit.h"
+
+#include <fcntl.h>
+#include <sys/epoll.h>
+#include <sys/eventfd.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+#include <filesystem>
+#include <map>
+#include <thread>
+
+#include "Platform/ConduitSocket.h"
+#include "Platform/ConduitWire.h"
+#include "Platform/Format.h"
+#include "Platform/PlatformLog.h"
+#include "Platform/RootPrefix.h"
+
+namespace tarn::conduit {
+
+namespace {
+
+// Messages read ahead of a connection's queue; past this the I/O thread stops
+// reading that socket until the queue catches up, so a flooding peer only
+// fills its own socket buffer.
+constexpr size_t kMaxQueuedMessages = 16;
+// Requests that may wait for their reply at once on one connection.
+constexpr size_t kMaxUnansweredRequests = 1024;
+// How long a send may wait for a peer that does not read.
+constexpr std::chrono::milliseconds kSendTimeout{5000};
+
+constexpr uint64_t kWakeKey = 0;
+constexpr uint64_t kListenKey = 1;
+
+void put32(uint8_t* p, uint32_t v) {
+    for (int i = 0; i < 4; ++i) p[i] = static_cast<uint8_t>(v >> (8 * i));
+}
+uint32_t get32(const uint8_t* p) {
+    return uint32_t{p[0]} | (uint32_t{p[1]} << 8) | (uint32_t{p[2]} << 16) | (uint32_t{p[3]} << 24);
+}
+
+}  // namespace
+
+AuditToken MakeAuditToken(const AuditTokenFields& f) {
+    AuditToken t{};
+    put32(t.data(), f.euid);
+    put32(t.data() + 4, f.egid);
+    put32(t.data() + 8, static_cast<uint32_t>(f.pid));
+    put32(t.data() + 16, static_cast<uint32_t>(f.startTime));
+    put32(t.data() + 20, static_cast<uint32_t>(f.startTime >> 32));
+    return t;
+}
+
+AuditTokenFields ParseAuditToken(const AuditToken& t) {
+    AuditTokenFields f;
+    f.euid = get32(t.data());
+    f.egid = get32(t.data() + 4);
+    f.pid = static_cast<pid_t>(get32(t.data() + 8));
+    f.startTime = uint64_t{get32(t.data() + 16)} | (uint64_t{get32(t.data() + 20)} << 32);
+    return f;
+}
+
+std::string ServiceSocketPath(const std::string& serviceName) {
+    return RootPath("/run/" + serviceName + ".socket");
+}
+
+// ---------------------------------------------------------------------------
+// Message
+
+Message::Message(PrivateTag, std::weak_ptr<Connection> connection, uint64_t id, uint64_t replyTo,
+                 bool request, PlistValue body)
+    : connection_(std::move(connection)),
+      id_(id),
+      replyTo_(replyTo),
+      request_(request),
+      body_(std::move(body)) {}
+
+MessageRef Message::createDictionary() {
+    return std::make_shared<Message>(PrivateTag{}, std::weak_ptr<Connection>{}, 0, 0, false,
+                                     PlistValue(PlistDict{}));
+}
+
+bool Message::expectsReply() const { return request_ && !replyCreated_.load(); }
+
+MessageRef Message::createReply() const {
+    if (!request_ || replyCreated_.exchange(true)) return nullptr;
+    return std::make_shared<Message>(PrivateTag{}, connection_, 0, id_, false,
+                                     PlistValue(PlistDict{}));
+}
+
+// ---------------------------------------------------------------------------
+// The I/O thread of a listener: accepts, reads every resumed connection and
+// hands complete messages to the connections' queues.
+
+struct Listener::IoLoop {
+    int listenFd = -1;
+    int epollFd = -1;
+    int wakeFd = -1;
+    std::thread thread;
+    std::weak_ptr<Listener> owner;
+
+    Mutex mu;
+    std::map<uint64_t, ConnectionRef> connections GUARDED_BY(mu);
+    std::function<void(const ConnectionRef&)> handler GUARDED_BY(mu);
+    uint64_t nextSerial GUARDED_BY(mu) = 2;  // 0 and 1 are the wake and listen keys
+    bool started GUARDED_BY(mu) = false;
+    bool stopped GUARDED_BY(mu) = false;
+
+    ~IoLoop() {
+        sock::CloseFd(listenFd);
+        sock::CloseFd(epollFd);
+        sock::CloseFd(wakeFd);
+    }
+
+    void run();
+    void acceptAll();
+    void readConnection(const ConnectionRef& c);
+    ConnectionRef find(uint64_t serial) {
+        MutexLock l(mu);
+        auto it = connections.find(serial);
+        return it == connections.end() ? nullptr : it->second;
+    }
+    void arm(int fd, uint64_t key, bool add) {
+        struct epoll_event ev = {};
+        ev.events = EPOLLIN | EPOLLONESHOT;
+        ev.data.u64 = key;
+        // Fails only for a connection already removed; nothing is left to read then.
+        (void)::epoll_ctl(epollFd, add ? EPOLL_CTL_ADD : EPOLL_CTL_MOD, fd, &ev);
+    }
+};
+
+void Listener::IoLoop::run() {
+    struct epoll_event events[32];
+    for (;;) {
+        const int n = ::epoll_wait(epollFd, events, 32, -1);
+        if (n < 0) {
+            if (errno == EINTR) continue;
+            PlatformLog("conduit", PlatformLogType::Fault, "epoll_wait failed: %s",
+                        std::strerror(errno));
+            return;
+        }
+        for (int i = 0; i < n; ++i) {
+            const uint64_t key = events[i].data.u64;
+            if (key == kWakeKey) {
+                MutexLock l(mu);
+                if (stopped) return;
+            } else if (key == kListenKey) {
+                acceptAll();
+            } else if (ConnectionRef c = find(key)) {
+                readConnection(c);
+            }
+        }
+    }
+}
+
+void Listener::IoLoop::acceptAll() {
+    for (;;) {
+        const int fd = ::accept4(listenFd, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
+        if (fd < 0) {
+            if (errno == EINTR || errno == ECONNABORTED) continue;
+            if (errno != EAGAIN && errno != EWOULDBLOCK)
+                PlatformLog("conduit", PlatformLogType::Error, "accept failed: %s",
+                            std::strerror(errno));
+            break;
+        }
+        std::string why;
+        auto creds = sock::ReadPeerCredentials(fd, &why);
+        if (!creds) {
+            PlatformLog("conduit", PlatformLogType::Error, "Refusing connection: %s", why);
+            sock::CloseFd(fd);
+            continue;
+        }
+        Connection::Credentials cc{creds->euid, creds->egid, creds->pid, creds->startTime};
+        std::function<void(const ConnectionRef&)> h;
+        ConnectionRef c;
+        {
+            MutexLock l(mu);
+            c = std::make_shared<Connection>(Connection::PrivateTag{}, fd, creds->pidfd, cc,
+                                             nextSerial++);
+            connections.emplace(c->serial_, c);
+            h = handler;
+        }
+        {
+            MutexLock l(c->mu_);
+            c->listener_ = owner;
+        }
+        auto o = owner.lock();
+        if (!o || !h) {
+            // Nobody to take it: the peer sees its connection closed.
+            c->cancel();
+            continue;
+        }
+        o->queue_->async([h = std::move(h), c] { h(c); });
+    }
+    arm(listenFd, kListenKey, false);
+}
+
+void Listener::IoLoop::readConnection(const ConnectionRef& c) {
+    std::vector<uint8_t> record;
+    // A bounded batch per wake-up keeps one busy peer from starving the others.
+    for (int batch = 0; batch < 16; ++batch) {
+        std::string why;
+        switch (sock::ReceiveRecord(c->fd_, kMaxRecordBytes, &record, &why)) {
+            case sock::RecvResult::WouldBlock:
+                arm(c->fd_, c->serial_, false);
+                return;
+            case sock::RecvResult::Closed:
+                c->cancel();
+                return;
+            case sock::RecvResult::Error:
+                c->fail(why);
+                return;
+            case sock::RecvResult::Record:
+                break;
+        }
+        switch (c->assembler_.add(record.data(), record.size(), &why)) {
+            case RecordAssembler::Result::Malformed:
+                c->fail(why);
+                return;
+            case RecordAssembler::Result::NeedMore:
+                continue;
+            case RecordAssembler::Result::Complete:
+                break;
+        }
+        const RecordHeader h = c->assembler_.header();
+        bool pause;
+        {
+            MutexLock l(c->mu_);
+            if (c->cancelled_) return;
+            pause = ++c->queued_ >= kMaxQueuedMessages;
+            if (pause) c->paused_ = true;
+        }
+        c->queue_->async([c, body = c->assembler_.take(), h]() mutable {
+            c->deliver(std::move(body), h.flags, h.messageId, h.replyTo);
+        });
+        if (pause) return;  // re-armed by the queue once it has caught up
+    }
+    arm(c->fd_, c->serial_, false);
+}
+
+// ---------------------------------------------------------------------------
+// Connection
+
+Connection::Connection(PrivateTag, int fd, int pidfd, const Credentials& creds, uint64_t serial)
+    : fd_(fd),
+      pidfd_(pidfd),
+      creds_(creds),
+      auditToken_(MakeAuditToken({creds.euid, creds.egid, creds.pid, creds.startTime})),
+      serial_(serial),
+      queue_(DispatchQueue::createSerial(Format("com.ostrea.conduit.peer.%d", creds.pid))) {}
+
+Connection::~Connection() {
+    sock::CloseFd(fd_);
+    sock::CloseFd(pidfd_);
+}
+
+std::optional<std::string> Connection::executablePath() const {
+    auto path = sock::ProcessExecutable(creds_.pid);
+    // Alive after the read: the PID still named our peer while we read it. The
+    // start time guards against a pidfd of the wrong process, which cannot
+    // happen with SO_PEERPIDFD but costs nothing to check.
+    if (!path || !sock::PidfdAlive(pidfd_)) return std::nullopt;
+    auto start = sock::ProcessStartTime(creds_.pid);
+    if (!start || *start != creds_.startTime || !sock::PidfdAlive(pidfd_)) return std::nullopt;
+    std::error_code ec;
+    auto real = std::filesystem::canonical(*path, ec);
+    return ec ? *path : real.string();
+}
+
+void Connection::setEventHandler(std::function<void(const Event&)> handler) {
+    MutexLock l(mu_);
+    if (finished_ || cancelled_) return;
+    handler_ = std::move(handler);
+}
+
+void Connection::setQoSFloor(QoS qos) {
+    MutexLock l(mu_);
+    // The queue's target is fixed once work was submitted; before resume() none was.
+    if (!resumed_ && !cancelled_) queue_->setTarget(DispatchQueue::global(qos));
+}
+
+void Connection::resume() {
+    std::shared_ptr<Listener> listener;
+    {
+        MutexLock l(mu_);
+        if (resumed_ || cancelled_) return;
+        resumed_ = true;
+        listener = listener_.lock();
+    }
+    if (!listener) {
+        cancel();
+        return;
+    }
+    listener->io_->arm(fd_, serial_, true);
+}
+
+void Connection::cancel() {
+    bool deliverInvalid;
+    std::shared_ptr<Listener> listener;
+    std::function<void(const Event&)> dropped;
+    {
+        MutexLock l(mu_);
+        if (cancelled_) return;
+        cancelled_ = true;
+        deliverInvalid = resumed_;
+        listener = listener_.lock();
+        if (!deliverInvalid) {
+            finished_ = true;
+            dropped = std::move(handler_);
+            handler_ = nullptr;
+        }
+    }
+    // The peer sees end of stream at once; the descriptor itself stays open
+    // until the last reference goes, so its number cannot be reused under the
+    // I/O thread.
+    (void)::shutdown(fd_, SHUT_RDWR);  // fails only when the peer is already gone
+    if (listener) listener->forget(*this);
+    if (deliverInvalid) {
+        auto self = shared_from_this();
+        queue_->async([self] { self->finish(); });
+    }
+}
+
+void Connection::fail(const std::string& reason) {
+    PlatformLog("conduit", PlatformLogType::Error,
+                "Cancelling connection from pid %d (uid %u): %s", creds_.pid, creds_.euid, reason);
+    cancel();
+}
+
+void Connection::finish() {
+    std::function<void(const Event&)> h;
+    {
+        MutexLock l(mu_);
+        if (finished_) return;
+        finished_ = true;
+        h = std::move(handler_);
+        handler_ = nullptr;
+    }
+    if (h) h(Event{Event::Kind::ConnectionInvalid, nullptr});
+}
+
+void Connection::deliver(std::vector<uint8_t> body, uint16_t flags, uint64_t id,
+                         uint64_t replyTo) {
+    std::function<void(const Event&)> h;
+    std::string why;
+    auto value = DecodeBody(body.data(), body.size(), &why);
+    bool tooMany = false;
+    {
+        MutexLock l(mu_);
+        if (cancelled_) return;
+        if (value && (flags & kFlagRequest)) {
+            tooMany = awaitingReply_.size() >= kMaxUnansweredRequests;
+            if (!tooMany) awaitingReply_.push_back(id);
+        }
+        h = handler_;
+    }
+    if (!value) {
+        fail("malformed message: " + why);
+        return;
+    }
+    if (tooMany) {
+        fail("too many requests without a reply");
+        return;
+    }
+    auto message = std::make_shared<Message>(Message::PrivateTag{}, weak_from_this(), id, replyTo,
+                                              (flags & kFlagRequest) != 0, std::move(*value));
+    if (h) h(Event{Event::Kind::Message, message});
+    onDelivered();
+}
+
+void Connection::onDelivered() {
+    bool rearm = false;
+    std::shared_ptr<Listener> listener;
+    {
+        MutexLock l(mu_);
+        --queued_;
+        if (paused_ && !cancelled_ && queued_ <= kMaxQueuedMessages / 2) {
+            paused_ = false;
+            rearm = true;
+            listener = listener_.lock();
+        }
+    }
+    if (rearm && listener) listener->io_->arm(fd_, serial_, false);
+}
+
+bool Connection::send(const MessageRef& message) {
+    if (!message) return false;
+    std::vector<uint8_t> body;
+    std::string why;
+    if (!EncodeBody(message->body(), &body, &why)) {
+        PlatformLog("conduit", PlatformLogType::Error, "Cannot send message to pid %d: %s",
+                    creds_.pid, why);
+        return false;
+    }
+    RecordHeader h;
+    {
+        MutexLock l(mu_);
+        if (cancelled_) return false;
+        if (message->isReply()) {
+            if (message->connection_.lock().get() != this) return false;
+            auto it = std::find(awaitingReply_.begin(), awaitingReply_.end(), message->replyTo());
+            if (it == awaitingReply_.end()) return false;  // already answered
+            awaitingReply_.erase(it);
+            h.flags = kFlagReply;
+            h.replyTo = message->replyTo();
+        }
+    }
+    h.messageId = nextId_.fetch_add(1);
+    bool ok;
+    {
+        MutexLock l(sendMu_);
+        ok = sock::SendRecords(fd_, BuildRecords(h, body), kSendTimeout, &why);
+    }
+    if (!ok) {
+        PlatformLog("conduit", PlatformLogType::Error, "Send to pid %d failed: %s", creds_.pid,
+                    why);
+        cancel();
+    }
+    return ok;
+}
+
+// ---------------------------------------------------------------------------
+// Listener
+
+Listener::Listener(PrivateTag, int fd, std::string socketPath, bool ownsPath,
+                   DispatchQueueRef queue)
+    : socketPath_(std::move(socketPath)),
+      ownsPath_(ownsPath),
+      queue_(std::move(queue)),
+      io_(std::make_shared<IoLoop>()) {
+    io_->listenFd = fd;
+}
+
+Listener::~Listener() { cancel(); }
+
+namespace {
+
+std::shared_ptr<Listener> failCreate(std::string* why, std::string reason, int fd = -1) {
+    sock::CloseFd(fd);
+    if (why) *why = std::move(reason);
+    return nullptr;
+}
+
+}  // namespace
+
+std::shared_ptr<Listener> Listener::create(const std::string& serviceName, DispatchQueueRef queue,
+                                           std::string* why) {
+    const int n = ::sd_listen_fds(1);
+    if (n > 0) {
+        const int fd = SD_LISTEN_FDS_START;
+        if (::sd_is_socket_unix(fd, SOCK_SEQPACKET, 1, nullptr, 0) <= 0)
+            return failCreate(why, "socket handed over by systemd is not a listening "
+                                   "SOCK_SEQPACKET Unix socket");
+        (void)::fcntl(fd, F_SETFD, FD_CLOEXEC);  // best effort; children never need it
+        const int flags = ::fcntl(fd, F_GETFL);
+        if (flags < 0 || ::fcntl(fd, F_SETFL, flags | O_NONBLOCK) != 0)
+            return failCreate(why, Format("fcntl: %s", std::strerror(errno)));
+        struct sockaddr_un addr = {};
+        socklen_t len = sizeof addr;
+        std::string path;
+        if (::getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len) == 0 &&
+            len > offsetof(sockaddr_un, sun_path))
+            path.assign(addr.sun_path, strnlen(addr.sun_path, sizeof addr.sun_path));
+        auto l = std::make_shared<Listener>(PrivateTag{}, fd, path, false, std::move(queue));
+        l->io_->owner = l;
+        return l;
+    }
+    return createAtPath(ServiceSocketPath(serviceName), std::move(queue), why);
+}
+
+std::shared_ptr<Listener> Listener::createAtPath(const std::string& path, DispatchQueueRef queue,
+                                                 std::string* why) {
+    struct sockaddr_un addr = {};
+    addr.sun_family = AF_UNIX;
+    if (path.empty() || path.size() >= sizeof addr.sun_path)
+        return failCreate(why, Format("socket path too long: %s", path));
+    std::memcpy(addr.sun_path, path.data(), path.size());
+
+    std::error_code ec;
+    std::filesystem::create_directories(std::filesystem::path(path).parent_path(), ec);
+    if (ec) return failCreate(why, Format("cannot create %s: %s", path, ec.message()));
+
+    struct stat st;
+    if (::lstat(path.c_str(), &st) == 0) {
+        if (!S_ISSOCK(st.st_mode))
+            return failCreate(why, Format("%s exists and is not a socket", path));
+        // A stale socket from an earlier run is replaced; a live one is not.
+        const int probe = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0);
+        const bool live =
+            probe >= 0 && ::connect(probe, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
+        sock::CloseFd(probe);
+        if (live) return failCreate(why, Format("another process is listening on %s", path));
+        if (::unlink(path.c_str()) != 0 && errno != ENOENT)
+            return failCreate(why, Format("unlink %s: %s", path, std::strerror(errno)));
+    }
+
+    const int fd = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
+    if (fd < 0) return failCreate(why, Format("socket: %s", std::strerror(errno)));
+    if (::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0)
+        return failCreate(why, Format("bind %s: %s", path, std::strerror(errno)), fd);
+    // Any local process may ask; what it may do is decided by its entitlements.
+    if (::chmod(path.c_str(), 0666) != 0 || ::listen(fd, SOMAXCONN) != 0) {
+        const std::string reason = Format("listen %s: %s", path, std::strerror(errno));
+        (void)::unlink(path.c_str());  // ours, just made
+        return failCreate(why, reason, fd);
+    }
+    auto l = std::make_shared<Listener>(PrivateTag{}, fd, path, true, std::move(queue));
+    l->io_->owner = l;
+    return l;
+}
+
+void Listener::setNewConnectionHandler(std::function<void(const ConnectionRef&)> handler) {
+    MutexLock l(io_->mu);
+    io_->handler = std::move(handler);
+}
+
+void Listener::resume() {
+    {
+        MutexLock l(io_->mu);
+        if (io_->started || io_->stopped) return;
+        io_->started = true;
+    }
+    io_->epollFd = ::epoll_create1(EPOLL_CLOEXEC);
+    io_->wakeFd = ::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK);
+    if (io_->epollFd < 0 || io_->wakeFd < 0) {
+        PlatformLog("conduit", PlatformLogType::Fault, "Cannot start the listener on %s: %s",
+                    socketPath_, std::strerror(errno));
+        return;
+    }
+    struct epoll_event ev = {};
+    ev.events = EPOLLIN;
+    ev.data.u64 = kWakeKey;
+    (void)::epoll_ctl(io_->epollFd, EPOLL_CTL_ADD, io_->wakeFd, &ev);  // fresh fds: cannot fail
+    io_->arm(io_->listenFd, kListenKey, true);
+    io_->thread = std::thread([io = io_] { io->run(); });
+}
+
+void Listener::cancel() {
+    std::map<uint64_t, ConnectionRef> connections;
+    {
+        MutexLock l(io_->mu);
+        if (io_->stopped) return;
+        io_->stopped = true;
+        connections.swap(io_->connections);
+        io_->handler = nullptr;
+    }
+    if (io_->thread.joinable()) {
+        const uint64_t one = 1;
+        (void)!::write(io_->wakeFd, &one, sizeof one);  // an eventfd write cannot fail here
+        if (io_->thread.get_id() == std::this_thread::get_id()) {
+            io_->thread.detach();  // the I/O thread let go of the last reference
+        } else {
+            io_->thread.join();
+            // Close now so that late connects fail instead of waiting in the backlog.
+            sock::CloseFd(io_->listenFd);
+            io_->listenFd = -1;
+        }
+    } else {
+        sock::CloseFd(io_->listenFd);
+        io_->listenFd = -1;
+    }
+    for (auto& [serial, c] : connections) c->cancel();
+    if (ownsPath_) (void)::unlink(socketPath_.c_str());  // gone already is fine
+}
+
+void Listener::forget(const Connection& c) {
+    ConnectionRef keep;  // released outside the lock
+    MutexLock l(io_->mu);
+    auto it = io_->connections.find(c.serial_);
+    if (it == io_->connections.end()) return;
+    keep = std::move(it->second);
+    io_->connections.erase(it);
+    if (io_->epollFd >= 0) (void)::epoll_ctl(io_->epollFd, EPOLL_CTL_DEL, c.fd_, nullptr);
+}
+
+size_t Listener::TEST_connectionCount() const {
+    MutexLock l(io_->mu);
+    return io_->connections.size();
+}
+
+}  // namespace tarn::conduit

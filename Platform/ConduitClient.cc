@@ -1,0 +1,145 @@
+// Client side of Conduit: one blocking socket, requests matched to replies by id.
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+#include "Platform/Conduit.h"
+#include "Platform/ConduitSocket.h"
+#include "Platform/ConduitWire.h"
+#include "Platform/Format.h"
+
+namespace tarn::conduit {
+
+namespace {
+
+constexpr std::chrono::milliseconds kClientSendTimeout{30000};
+// Replies kept for other waiters; a server that sends more than this unasked is misbehaving.
+constexpr size_t kMaxStashedReplies = 256;
+
+}  // namespace
+
+struct Client::Assembly {
+    RecordAssembler assembler;
+    std::vector<uint8_t> record;
+};
+
+Client::Client(PrivateTag, int fd) : fd_(fd), assembly_(std::make_unique<Assembly>()) {}
+
+Client::~Client() { sock::CloseFd(fd_); }
+
+std::unique_ptr<Client> Client::connect(const std::string& socketPath, std::string* why) {
+    struct sockaddr_un addr = {};
+    addr.sun_family = AF_UNIX;
+    if (socketPath.empty() || socketPath.size() >= sizeof addr.sun_path) {
+        if (why) *why = Format("socket path too long: %s", socketPath);
+        return nullptr;
+    }
+    std::memcpy(addr.sun_path, socketPath.data(), socketPath.size());
+    const int fd = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0);
+    if (fd < 0) {
+        if (why) *why = Format("socket: %s", std::strerror(errno));
+        return nullptr;
+    }
+    int r;
+    do {
+        r = ::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+    } while (r != 0 && errno == EINTR);
+    if (r != 0) {
+        if (why) *why = Format("connect %s: %s", socketPath, std::strerror(errno));
+        sock::CloseFd(fd);
+        return nullptr;
+    }
+    return std::make_unique<Client>(PrivateTag{}, fd);
+}
+
+bool Client::sendMessage(const PlistValue& body, uint16_t flags, uint64_t id, std::string* why) {
+    std::vector<uint8_t> bytes;
+    if (!EncodeBody(body, &bytes, why)) return false;
+    RecordHeader h;
+    h.flags = flags;
+    h.messageId = id;
+    return sock::SendRecords(fd_, BuildRecords(h, bytes), kClientSendTimeout, why);
+}
+
+std::optional<uint64_t> Client::sendRequest(const PlistValue& request, std::string* why) {
+    const uint64_t id = nextId_++;
+    if (!sendMessage(request, kFlagRequest, id, why)) return std::nullopt;
+    return id;
+}
+
+bool Client::sendOneWay(const PlistValue& message, std::string* why) {
+    return sendMessage(message, 0, nextId_++, why);
+}
+
+bool Client::sendRaw(const void* bytes, size_t n) {
+    return ::send(fd_, bytes, n, MSG_NOSIGNAL) == static_cast<ssize_t>(n);
+}
+
+std::optional<Client::Received> Client::receive(std::chrono::milliseconds timeout,
+                                                std::string* why) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    for (;;) {
+        auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+            deadline - std::chrono::steady_clock::now());
+        if (!sock::WaitReadable(fd_, std::max(left, std::chrono::milliseconds(0)), why))
+            return std::nullopt;
+        switch (sock::ReceiveRecord(fd_, kMaxRecordBytes, &assembly_->record, why)) {
+            case sock::RecvResult::WouldBlock:
+                continue;
+            case sock::RecvResult::Closed:
+                if (why) *why = "connection closed by the peer";
+                return std::nullopt;
+            case sock::RecvResult::Error:
+                return std::nullopt;
+            case sock::RecvResult::Record:
+                break;
+        }
+        const auto r =
+            assembly_->assembler.add(assembly_->record.data(), assembly_->record.size(), why);
+        if (r == RecordAssembler::Result::Malformed) {
+            // The stream cannot be resynchronised; start over on the next record.
+            assembly_->assembler = RecordAssembler();
+            return std::nullopt;
+        }
+        if (r == RecordAssembler::Result::NeedMore) continue;
+        const RecordHeader h = assembly_->assembler.header();
+        std::vector<uint8_t> body = assembly_->assembler.take();
+        auto value = DecodeBody(body.data(), body.size(), why);
+        if (!value) return std::nullopt;
+        return Received{h.messageId, h.replyTo, h.flags, std::move(*value)};
+    }
+}
+
+std::optional<PlistValue> Client::waitForReply(uint64_t id, std::chrono::milliseconds timeout,
+                                               std::string* why) {
+    auto stashed = std::find_if(stash_.begin(), stash_.end(),
+                                [id](const Received& r) { return r.replyTo == id; });
+    if (stashed != stash_.end()) {
+        PlistValue body = std::move(stashed->body);
+        stash_.erase(stashed);
+        return body;
+    }
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    for (;;) {
+        auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+            deadline - std::chrono::steady_clock::now());
+        auto m = receive(std::max(left, std::chrono::milliseconds(0)), why);
+        if (!m) return std::nullopt;
+        if (!(m->flags & kFlagReply)) continue;  // nobody asked for it
+        if (m->replyTo == id) return std::move(m->body);
+        if (stash_.size() < kMaxStashedReplies) stash_.push_back(std::move(*m));
+    }
+}
+
+std::optional<PlistValue> Client::sendSync(const PlistValue& request,
+                                           std::chrono::milliseconds timeout, std::string* why) {
+    auto id = sendRequest(request, why);
+    if (!id) return std::nullopt;
+    return waitForReply(*id, timeout, why);
+}
+
+}  // namespace tarn::conduit

@@ -1,0 +1,51 @@
+// Socket and process primitives behind Conduit (Linux). Used by the Conduit
+// implementation and its test/benchmark harness only; the daemon talks to
+// Conduit.h.
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace tarn::conduit::sock {
+
+// Sends each record as one SOCK_SEQPACKET record. A full send buffer is
+// waited out for at most `timeout` per record. No SIGPIPE.
+bool SendRecords(int fd, const std::vector<std::vector<uint8_t>>& records,
+                 std::chrono::milliseconds timeout, std::string* why);
+
+enum class RecvResult { Record, WouldBlock, Closed, Error };
+// Receives one record into `buffer` (resized to the record). A record longer
+// than `limit` is reported as Error with a reason, without keeping its bytes.
+RecvResult ReceiveRecord(int fd, size_t limit, std::vector<uint8_t>* buffer, std::string* why);
+
+// Waits until `fd` is readable; false on timeout (why = "timed out") or error.
+bool WaitReadable(int fd, std::chrono::milliseconds timeout, std::string* why);
+
+void CloseFd(int fd);
+
+// The peer of a connected Unix socket as the kernel recorded it at connect time.
+struct PeerCredentials {
+    uid_t euid = 0;
+    gid_t egid = 0;
+    pid_t pid = 0;
+    uint64_t startTime = 0;  // clock ticks after boot
+    int pidfd = -1;          // owned by the caller
+};
+// Takes SO_PEERCRED and the peer's pidfd (SO_PEERPIDFD, or pidfd_open checked
+// against the accept time), and the start time read while the pidfd shows the
+// process alive. Empty with a reason when the peer is already gone.
+std::optional<PeerCredentials> ReadPeerCredentials(int fd, std::string* why);
+
+// Field 22 of /proc/PID/stat; empty when the process is gone.
+std::optional<uint64_t> ProcessStartTime(pid_t pid);
+// True while the process behind `pidfd` has not exited.
+bool PidfdAlive(int pidfd);
+// readlink of /proc/PID/exe.
+std::optional<std::string> ProcessExecutable(pid_t pid);
+
+}  // namespace tarn::conduit::sock
