@@ -190,7 +190,14 @@ std::optional<FileURL> TarnFileManager::_realPathWhatExistsInPath(const std::str
         std::string prefix = joinComponents(comps, 0, k);
         if (!itemExistsAtURL(prefix)) continue;
         auto real = _realPathForURL(prefix, false);
-        if (!real) continue;
+        if (!real) {
+            // It exists but does not resolve: a dangling or looping link.
+            // Appending the tail to a shorter prefix would hide that the
+            // path goes through it, and whoever creates the tail later
+            // would follow it wherever it points.
+            TarnLog(kLogError, __func__, "Refusing %@: %@ exists but has no real path", path, prefix);
+            return std::nullopt;
+        }
         std::string rest = joinComponents(comps, k, n);
         TarnLog(kLogDebug, __func__, "Realpathed %@ ; appending non-existing components %@", *real, rest);
         return PathJoin(*real, rest);

@@ -36,6 +36,7 @@ FsStat fromStat(const struct stat& s) {
     o.gid = s.st_gid;
     o.size = s.st_size;
     o.blocks = s.st_blocks;
+    o.mtimeSec = s.st_mtim.tv_sec;
     return o;
 }
 

@@ -31,6 +31,7 @@ struct FsStat {
     gid_t gid = 0;
     int64_t size = 0;
     int64_t blocks = 0;  // 512-byte units
+    int64_t mtimeSec = 0;
     bool isDirectory() const;
     bool isRegular() const;
     bool isSymlink() const;
