@@ -9,7 +9,9 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
+#include <filesystem>
 
 #include "Platform/ConduitSocket.h"
 #include "Platform/Format.h"
@@ -119,7 +121,16 @@ bool setCpus(pid_t pid, const std::vector<int>& cpus, std::string* why) {
 bool SetThreadCpus(const std::vector<int>& cpus, std::string* why) { return setCpus(0, cpus, why); }
 
 bool SetProcessCpus(pid_t pid, const std::vector<int>& cpus, std::string* why) {
-    return setCpus(pid, cpus, why);
+    // sched_setaffinity moves one thread; a process is every task it has now.
+    std::error_code ec;
+    bool any = false;
+    for (const auto& task :
+         std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/task", ec)) {
+        const pid_t tid = static_cast<pid_t>(std::atoi(task.path().filename().c_str()));
+        if (tid > 0 && !setCpus(tid, cpus, why)) return false;
+        any = true;
+    }
+    return any || setCpus(pid, cpus, why);
 }
 
 std::unique_ptr<SeqpacketEcho> SeqpacketEcho::start(std::string* why) {

@@ -48,7 +48,8 @@ private:
 std::vector<int> AllowedCpus();
 // Pins the calling thread (and the threads it starts later) to `cpus`.
 bool SetThreadCpus(const std::vector<int>& cpus, std::string* why);
-// Pins another process.
+// Pins every thread another process has now (threads it starts later inherit
+// from their creator).
 bool SetProcessCpus(pid_t pid, const std::vector<int>& cpus, std::string* why);
 
 // A SOCK_SEQPACKET socket pair with a thread that sends every record back.

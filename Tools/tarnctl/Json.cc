@@ -299,7 +299,12 @@ private:
             return PlistValue(*u);
         }
         if (key == "$int64") {
-            auto i = v.isInteger() ? v.asInt64() : std::nullopt;
+            // A UInt past INT64_MAX has no int64 form.
+            auto i = v.type() == PlistValue::Type::Int ||
+                             (v.type() == PlistValue::Type::UInt &&
+                              *v.asUInt64() <= uint64_t{std::numeric_limits<int64_t>::max()})
+                         ? v.asInt64()
+                         : std::nullopt;
             if (!i) return error("\"$int64\" needs an integer within the signed 64-bit range");
             return PlistValue(*i);
         }
