@@ -92,6 +92,14 @@ ChildProcess::~ChildProcess() {
     (void)wait(std::chrono::milliseconds(10000));
 }
 
+std::string SelfExecutablePath() {
+    auto path = sock::ProcessExecutable(::getpid());
+    if (!path) return {};
+    std::error_code ec;
+    auto real = std::filesystem::canonical(*path, ec);
+    return ec ? *path : real.string();
+}
+
 std::vector<int> AllowedCpus() {
     cpu_set_t set;
     CPU_ZERO(&set);

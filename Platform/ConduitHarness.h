@@ -44,6 +44,9 @@ private:
     bool reaped_ = false;
 };
 
+// Real path of this process's executable (empty when unreadable).
+std::string SelfExecutablePath();
+
 // CPUs the calling thread may run on.
 std::vector<int> AllowedCpus();
 // Pins the calling thread (and the threads it starts later) to `cpus`.

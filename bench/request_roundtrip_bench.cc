@@ -1,0 +1,197 @@
+// Request round trip: what Conduit and the daemon add on top of the socket.
+//
+//   (a) floor: the bytes of one encoded request record echoed over a bare
+//       SOCK_SEQPACKET socket pair by a thread;
+//   (b) the same request ({"Command": 27}, answered with "ReplyError" 49)
+//       through a running tarnkeeperd in a scratch root.
+//
+// Rounds of (a) and (b) alternate back to back so that both see the same
+// machine state; medians and the ratio b/a are printed, once with everything
+// pinned to one CPU and once unpinned. (b) is skipped with a message when the
+// daemon does not answer.
+//
+//   request_roundtrip_bench [ROUNDS] [OPS_PER_ROUND]
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <string>
+#include <vector>
+
+#include "Platform/Conduit.h"
+#include "Platform/ConduitHarness.h"
+#include "Platform/ConduitWire.h"
+#include "Platform/PlatformLog.h"
+
+using namespace tarn;
+using namespace tarn::conduit;
+using Clock = std::chrono::steady_clock;
+using namespace std::chrono_literals;
+
+namespace {
+
+std::string makeScratchRoot() {
+    const char* tmp = std::getenv("TMPDIR");
+    std::string tmpl = std::string(tmp && *tmp ? tmp : "/tmp") + "/tarn-bench-XXXXXX";
+    if (!::mkdtemp(tmpl.data())) return {};
+    namespace fs = std::filesystem;
+    fs::create_directories(tmpl + "/etc");
+    fs::create_directories(tmpl + "/private/var/mobile");
+    fs::create_directories(tmpl + "/private/var/root");
+    std::ofstream(tmpl + "/etc/passwd") << "root:x:0:0:root:/private/var/root:/bin/sh\n"
+                                           "_installd:x:33:33:installd:/private/var/installd:/bin/false\n"
+                                           "mobile:x:501:501:Mobile User:/private/var/mobile:/bin/sh\n";
+    std::ofstream(tmpl + "/etc/group") << "wheel:x:0:\nmobile:x:501:\nsystemusers:x:1020:\n";
+    // The daemon answers command 27 only to a client entitled to it.
+    fs::create_directories(tmpl + "/etc/tarnkeeper/codesign");
+    PlistDict entitlements;
+    entitlements["com.ostrea.private.TarnKeeper.allowed"] = PlistValue(true);
+    PlistDict entry;
+    entry["Executable"] = PlistValue(harness::SelfExecutablePath());
+    entry["SigningIdentifier"] = PlistValue("com.ostrea.tarnkeeperd.bench");
+    entry["Entitlements"] = PlistValue(std::move(entitlements));
+    const auto bytes = PlistValue(std::move(entry)).toBinary();
+    std::ofstream(tmpl + "/etc/tarnkeeper/codesign/bench.plist", std::ios::binary)
+        .write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
+    return tmpl;
+}
+
+PlistValue command27() {
+    PlistDict d;
+    d["Command"] = PlistValue(uint64_t{27});
+    return PlistValue(std::move(d));
+}
+
+bool daemonAnswers(Client& client, std::string* why) {
+    auto reply = client.sendSync(command27(), 5000ms, why);
+    if (!reply) return false;
+    const PlistValue* e = reply->find("ReplyError");
+    if (!e || e->asUInt64() != uint64_t{49}) {
+        *why = "unexpected reply " + reply->description();
+        return false;
+    }
+    return true;
+}
+
+double medianUs(std::vector<double> v) {
+    if (v.empty()) return 0;
+    std::sort(v.begin(), v.end());
+    return v[v.size() / 2];
+}
+
+struct Result {
+    double echoUs = 0;
+    double daemonUs = 0;
+    bool daemon = false;
+};
+
+Result measure(harness::SeqpacketEcho& echo, Client* daemon, const std::vector<uint8_t>& record,
+               int rounds, int ops) {
+    std::vector<double> echoLat, daemonLat;
+    std::vector<uint8_t> back;
+    std::string why;
+    for (int r = 0; r < rounds; ++r) {
+        for (int i = 0; i < ops; ++i) {
+            const auto t0 = Clock::now();
+            if (!echo.roundTrip(record, &back)) {
+                std::fprintf(stderr, "echo failed\n");
+                std::exit(1);
+            }
+            echoLat.push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+        }
+        if (!daemon) continue;
+        for (int i = 0; i < ops; ++i) {
+            const auto t0 = Clock::now();
+            if (!daemon->sendSync(command27(), 5000ms, &why)) {
+                std::fprintf(stderr, "daemon round trip failed: %s\n", why.c_str());
+                std::exit(1);
+            }
+            daemonLat.push_back(
+                std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+        }
+    }
+    return {medianUs(echoLat), medianUs(daemonLat), daemon != nullptr};
+}
+
+void report(const char* config, const Result& r) {
+    if (r.daemon) {
+        std::printf("%-10s echo median %8.2f us   daemon median %8.2f us   ratio %6.2f\n", config,
+                    r.echoUs, r.daemonUs, r.echoUs > 0 ? r.daemonUs / r.echoUs : 0.0);
+    } else {
+        std::printf("%-10s echo median %8.2f us   daemon skipped\n", config, r.echoUs);
+    }
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    const int rounds = argc > 1 ? std::max(1, std::atoi(argv[1])) : 20;
+    const int ops = argc > 2 ? std::max(1, std::atoi(argv[2])) : 200;
+    PlatformLogSetQuiet(true);
+
+    // The exact record Conduit sends for the request.
+    std::vector<uint8_t> body;
+    std::string why;
+    if (!EncodeBody(command27(), &body, &why)) return 1;
+    RecordHeader h;
+    h.flags = kFlagRequest;
+    h.messageId = 1;
+    const std::vector<uint8_t> record = BuildRecords(h, body).front();
+
+    const std::string root = makeScratchRoot();
+    if (root.empty()) {
+        std::fprintf(stderr, "cannot make a scratch root\n");
+        return 1;
+    }
+    harness::ChildProcess::Options opts;
+    opts.stdoutPath = root + "/daemon.out";
+    opts.stderrPath = root + "/daemon.err";
+    auto daemon = harness::ChildProcess::spawn(
+        {TARN_BINARY_DIR "/tarnkeeperd", "--root", root}, opts, &why);
+    std::unique_ptr<Client> client;
+    const std::string socket = root + "/run/com.ostrea.tarnkeeperd.socket";
+    const auto deadline = Clock::now() + 15s;
+    while (daemon && Clock::now() < deadline) {
+        client = Client::connect(socket, &why);
+        if (client && daemonAnswers(*client, &why)) break;
+        client.reset();
+        if (daemon->wait(50ms)) {
+            why = "the daemon exited";
+            break;
+        }
+    }
+    if (!client)
+        std::printf("daemon round trip skipped: %s (see %s)\n",
+                    daemon ? why.c_str() : "cannot start " TARN_BINARY_DIR "/tarnkeeperd",
+                    opts.stderrPath.c_str());
+
+    std::printf("request {\"Command\": 27}: %zu-byte record, %d rounds x %d ops each side\n",
+                record.size(), rounds, ops);
+    const std::vector<int> all = harness::AllowedCpus();
+    {
+        // Pinned: this thread, the echo thread it starts, and every daemon thread.
+        if (!harness::SetThreadCpus({all.front()}, &why)) std::fprintf(stderr, "%s\n", why.c_str());
+        if (client && !harness::SetProcessCpus(daemon->pid(), {all.front()}, &why))
+            std::fprintf(stderr, "%s\n", why.c_str());
+        auto echo = harness::SeqpacketEcho::start(&why);
+        if (!echo) return 1;
+        measure(*echo, client.get(), record, 1, ops);  // warm-up
+        report("pinned", measure(*echo, client.get(), record, rounds, ops));
+    }
+    {
+        (void)harness::SetThreadCpus(all, &why);  // back to every CPU we had
+        if (client) (void)harness::SetProcessCpus(daemon->pid(), all, &why);
+        auto echo = harness::SeqpacketEcho::start(&why);
+        if (!echo) return 1;
+        measure(*echo, client.get(), record, 1, ops);
+        report("unpinned", measure(*echo, client.get(), record, rounds, ops));
+    }
+
+    client.reset();
+    if (daemon) daemon->terminate();
+    std::error_code ec;
+    std::filesystem::remove_all(root, ec);
+    return 0;
+}
