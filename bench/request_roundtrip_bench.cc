@@ -3,7 +3,9 @@
 //   (a) floor: the bytes of one encoded request record echoed over a bare
 //       SOCK_SEQPACKET socket pair by a thread;
 //   (b) the same request ({"Command": 27}, answered with "ReplyError" 49)
-//       through a running tarnkeeperd in a scratch root.
+//       through a running tarnkeeperd in a scratch root;
+//   (c) for reference, the same request through an in-process Conduit
+//       listener that only echoes: what Conduit alone costs.
 //
 // Rounds of (a) and (b) alternate back to back so that both see the same
 // machine state; medians and the ratio b/a are printed, once with everything
@@ -19,6 +21,8 @@
 #include <fstream>
 #include <string>
 #include <vector>
+
+#include <unistd.h>
 
 #include "Platform/Conduit.h"
 #include "Platform/ConduitHarness.h"
@@ -83,13 +87,26 @@ double medianUs(std::vector<double> v) {
 
 struct Result {
     double echoUs = 0;
+    double conduitUs = 0;
     double daemonUs = 0;
     bool daemon = false;
 };
 
-Result measure(harness::SeqpacketEcho& echo, Client* daemon, const std::vector<uint8_t>& record,
-               int rounds, int ops) {
-    std::vector<double> echoLat, daemonLat;
+void timeRequests(Client& client, int ops, std::vector<double>* lat) {
+    std::string why;
+    for (int i = 0; i < ops; ++i) {
+        const auto t0 = Clock::now();
+        if (!client.sendSync(command27(), 5000ms, &why)) {
+            std::fprintf(stderr, "round trip failed: %s\n", why.c_str());
+            std::exit(1);
+        }
+        lat->push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+    }
+}
+
+Result measure(harness::SeqpacketEcho& echo, Client& conduitEcho, Client* daemon,
+               const std::vector<uint8_t>& record, int rounds, int ops) {
+    std::vector<double> echoLat, conduitLat, daemonLat;
     std::vector<uint8_t> back;
     std::string why;
     for (int r = 0; r < rounds; ++r) {
@@ -101,27 +118,20 @@ Result measure(harness::SeqpacketEcho& echo, Client* daemon, const std::vector<u
             }
             echoLat.push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
         }
-        if (!daemon) continue;
-        for (int i = 0; i < ops; ++i) {
-            const auto t0 = Clock::now();
-            if (!daemon->sendSync(command27(), 5000ms, &why)) {
-                std::fprintf(stderr, "daemon round trip failed: %s\n", why.c_str());
-                std::exit(1);
-            }
-            daemonLat.push_back(
-                std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
-        }
+        timeRequests(conduitEcho, ops, &conduitLat);
+        if (daemon) timeRequests(*daemon, ops, &daemonLat);
     }
-    return {medianUs(echoLat), medianUs(daemonLat), daemon != nullptr};
+    return {medianUs(echoLat), medianUs(conduitLat), medianUs(daemonLat), daemon != nullptr};
 }
 
 void report(const char* config, const Result& r) {
-    if (r.daemon) {
-        std::printf("%-10s echo median %8.2f us   daemon median %8.2f us   ratio %6.2f\n", config,
-                    r.echoUs, r.daemonUs, r.echoUs > 0 ? r.daemonUs / r.echoUs : 0.0);
-    } else {
-        std::printf("%-10s echo median %8.2f us   daemon skipped\n", config, r.echoUs);
-    }
+    std::printf("%-9s (a) echo %7.2f us | (c) conduit echo %7.2f us (x%.2f)", config, r.echoUs,
+                r.conduitUs, r.echoUs > 0 ? r.conduitUs / r.echoUs : 0.0);
+    if (r.daemon)
+        std::printf(" | (b) daemon %7.2f us  ratio b/a %.2f\n", r.daemonUs,
+                    r.echoUs > 0 ? r.daemonUs / r.echoUs : 0.0);
+    else
+        std::printf(" | (b) daemon skipped\n");
 }
 
 }  // namespace
@@ -167,29 +177,58 @@ int main(int argc, char** argv) {
                     daemon ? why.c_str() : "cannot start " TARN_BINARY_DIR "/tarnkeeperd",
                     opts.stderrPath.c_str());
 
+    // (c): a Conduit listener in this process that answers like the daemon would.
+    auto echoQueue = DispatchQueue::createSerial("bench.conduit-echo");
+    auto echoListener = Listener::createAtPath(root + "/run/bench.echo.socket", echoQueue, &why);
+    if (!echoListener) {
+        std::fprintf(stderr, "conduit echo listener: %s\n", why.c_str());
+        return 1;
+    }
+    echoListener->setNewConnectionHandler([](const ConnectionRef& c) {
+        std::weak_ptr<Connection> weak = c;
+        c->setEventHandler([weak](const Event& e) {
+            auto c = weak.lock();
+            if (e.kind != Event::Kind::Message || !c) return;
+            auto reply = e.message->createReply();
+            if (!reply) return;
+            reply->body().set("ReplyError", PlistValue(uint64_t{49}));
+            c->send(reply);
+        });
+        c->resume();
+    });
+    echoListener->resume();
+    auto conduitEcho = Client::connect(echoListener->socketPath(), &why);
+    if (!conduitEcho) {
+        std::fprintf(stderr, "conduit echo connect: %s\n", why.c_str());
+        return 1;
+    }
+
     std::printf("request {\"Command\": 27}: %zu-byte record, %d rounds x %d ops each side\n",
                 record.size(), rounds, ops);
     const std::vector<int> all = harness::AllowedCpus();
     {
-        // Pinned: this thread, the echo thread it starts, and every daemon thread.
-        if (!harness::SetThreadCpus({all.front()}, &why)) std::fprintf(stderr, "%s\n", why.c_str());
+        // Pinned: every thread of ours (the echo thread starts after), and of the daemon.
+        if (!harness::SetProcessCpus(::getpid(), {all.front()}, &why))
+            std::fprintf(stderr, "%s\n", why.c_str());
         if (client && !harness::SetProcessCpus(daemon->pid(), {all.front()}, &why))
             std::fprintf(stderr, "%s\n", why.c_str());
         auto echo = harness::SeqpacketEcho::start(&why);
         if (!echo) return 1;
-        measure(*echo, client.get(), record, 1, ops);  // warm-up
-        report("pinned", measure(*echo, client.get(), record, rounds, ops));
+        measure(*echo, *conduitEcho, client.get(), record, 1, ops);  // warm-up
+        report("pinned", measure(*echo, *conduitEcho, client.get(), record, rounds, ops));
     }
     {
-        (void)harness::SetThreadCpus(all, &why);  // back to every CPU we had
+        (void)harness::SetProcessCpus(::getpid(), all, &why);  // back to every CPU we had
         if (client) (void)harness::SetProcessCpus(daemon->pid(), all, &why);
         auto echo = harness::SeqpacketEcho::start(&why);
         if (!echo) return 1;
-        measure(*echo, client.get(), record, 1, ops);
-        report("unpinned", measure(*echo, client.get(), record, rounds, ops));
+        measure(*echo, *conduitEcho, client.get(), record, 1, ops);
+        report("unpinned", measure(*echo, *conduitEcho, client.get(), record, rounds, ops));
     }
 
     client.reset();
+    conduitEcho.reset();
+    echoListener->cancel();
     if (daemon) daemon->terminate();
     std::error_code ec;
     std::filesystem::remove_all(root, ec);
