@@ -54,19 +54,19 @@ bool parseNumber(std::string_view s, uint64_t* out) {
     return true;
 }
 
-bool parseAction(std::string_view spec, Action* out) {
+bool parseAction(std::string_view actionText, Action* out) {
     Action a;
-    if (auto at = spec.find('@'); at != std::string_view::npos) {
-        if (!parseNumber(spec.substr(at + 1), &a.onHit) || a.onHit == 0) return false;
-        spec = spec.substr(0, at);
+    if (auto at = actionText.find('@'); at != std::string_view::npos) {
+        if (!parseNumber(actionText.substr(at + 1), &a.onHit) || a.onHit == 0) return false;
+        actionText = actionText.substr(0, at);
     }
     uint64_t n = 0;
-    if (spec == "kill") {
+    if (actionText == "kill") {
         a.kind = Action::Kind::Kill;
-    } else if (spec.starts_with("errno:") && parseNumber(spec.substr(6), &n) && n > 0 && n < 4096) {
+    } else if (actionText.starts_with("errno:") && parseNumber(actionText.substr(6), &n) && n > 0 && n < 4096) {
         a.kind = Action::Kind::Errno;
         a.value = static_cast<int>(n);
-    } else if (spec.starts_with("sleep:") && parseNumber(spec.substr(6), &n) && n <= 600000) {
+    } else if (actionText.starts_with("sleep:") && parseNumber(actionText.substr(6), &n) && n <= 600000) {
         a.kind = Action::Kind::Sleep;
         a.value = static_cast<int>(n);
     } else {
@@ -116,9 +116,9 @@ std::optional<int> FailpointHit(std::string_view name) {
     return std::nullopt;
 }
 
-bool FailpointSet(std::string_view name, std::string_view spec) {
+bool FailpointSet(std::string_view name, std::string_view actionText) {
     Action a;
-    if (!FailpointIsKnown(name) || !parseAction(spec, &a)) return false;
+    if (!FailpointIsKnown(name) || !parseAction(actionText, &a)) return false;
     setArmed(registry(), name, a);
     return true;
 }

@@ -37,6 +37,8 @@ inline constexpr const char* kFailpointNames[] = {
     "fm.standardizeOwnership",
     "fm.setTopLevelACL",
     "fm.standardizeACLs",
+    // Daemon start-up (tests of requests that arrive during start-up)
+    "daemon.startup",
 };
 
 bool FailpointIsKnown(std::string_view name);
@@ -44,10 +46,10 @@ bool FailpointIsKnown(std::string_view name);
 // Hit of a failpoint: the errno to fail with, or nullopt to go on.
 std::optional<int> FailpointHit(std::string_view name);
 
-// Test API. `spec` as in the environment variable ("errno:28", "kill",
-// "sleep:500", optionally "@N"). Returns false for a malformed spec or an
+// Test API. `actionText` as in the environment variable ("errno:28", "kill",
+// "sleep:500", optionally "@N"). Returns false for a malformed action or an
 // unknown name.
-bool FailpointSet(std::string_view name, std::string_view spec);
+bool FailpointSet(std::string_view name, std::string_view actionText);
 void FailpointClear(std::string_view name);
 void FailpointClearAll();
 // Parses a whole TARN_FAILPOINTS value, replacing what is armed.

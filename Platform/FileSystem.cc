@@ -473,20 +473,20 @@ std::string procPath(int fd) {
 
 }  // namespace
 
-int FsSetGroupACLAt(int dirFd, const std::string& name, const FsGroupACL& spec) {
+int FsSetGroupACLAt(int dirFd, const std::string& name, const FsGroupACL& wanted) {
     FsFd fd;
     if (int err = FsOpenItem(dirFd, name, &fd)) return err == ELOOP ? EOPNOTSUPP : err;
     struct stat s;
     if (::fstat(fd.get(), &s) != 0) return errnoOr(EIO);
     int owner = (s.st_mode >> 6) & 7, group = (s.st_mode >> 3) & 7, other = s.st_mode & 7;
-    if (spec.accessPerms >= 0) {
+    if (wanted.accessPerms >= 0) {
         AclHolder acl;
-        if (int err = buildAcl(owner, group, other, spec.gid, spec.accessPerms, &acl)) return err;
+        if (int err = buildAcl(owner, group, other, wanted.gid, wanted.accessPerms, &acl)) return err;
         if (acl_set_fd(fd.get(), acl.acl) != 0) return errnoOr(EIO);
     }
-    if (spec.defaultPerms >= 0 && S_ISDIR(s.st_mode)) {
+    if (wanted.defaultPerms >= 0 && S_ISDIR(s.st_mode)) {
         AclHolder acl;
-        if (int err = buildAcl(spec.defaultOwnerPerms, 0, 0, spec.gid, spec.defaultPerms, &acl))
+        if (int err = buildAcl(wanted.defaultOwnerPerms, 0, 0, wanted.gid, wanted.defaultPerms, &acl))
             return err;
         // Default ACLs have no descriptor call; the /proc path names the
         // directory already open, so no link can redirect it.

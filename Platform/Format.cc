@@ -8,7 +8,7 @@ namespace {
 
 enum class Length { Int, Long, Short, Char };
 
-std::string formatInteger(const std::string& spec, char conv, const FormatArg& a, Length len) {
+std::string formatInteger(const std::string& directive, char conv, const FormatArg& a, Length len) {
     // Reproduce C's truncation for the length modifier, then print at 64 bits.
     bool isSigned = conv == 'd' || conv == 'i';
     uint64_t raw = a.kind == FormatArg::Kind::Signed     ? static_cast<uint64_t>(a.i)
@@ -21,7 +21,7 @@ std::string formatInteger(const std::string& spec, char conv, const FormatArg& a
         return a.s;
     }
     char buf[80];
-    std::string f = spec + "ll" + conv;
+    std::string f = directive + "ll" + conv;
     if (isSigned) {
         int64_t v = static_cast<int64_t>(raw);
         if (len == Length::Int) v = static_cast<int32_t>(raw);
@@ -57,14 +57,14 @@ std::string formatArgs(std::string_view fmt, const FormatArg* args, size_t count
         }
         // %[flags][width][.precision][length]conversion
         size_t j = i + 1;
-        std::string spec = "%";
+        std::string directive = "%";
         while (j < fmt.size() && std::string_view("-+ #0'").find(fmt[j]) != std::string_view::npos)
-            spec += fmt[j++];
-        while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) spec += fmt[j++];
+            directive += fmt[j++];
+        while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) directive += fmt[j++];
         if (j < fmt.size() && fmt[j] == '.') {
-            spec += fmt[j++];
+            directive += fmt[j++];
             while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j])))
-                spec += fmt[j++];
+                directive += fmt[j++];
         }
         Length len = Length::Int;
         while (j < fmt.size() && std::string_view("hlqjztL").find(fmt[j]) != std::string_view::npos) {
@@ -88,10 +88,10 @@ std::string formatArgs(std::string_view fmt, const FormatArg* args, size_t count
             case '@': out += a.s; break;
             case 's': {
                 // Width and precision apply as printf would apply them.
-                if (spec == "%") {
+                if (directive == "%") {
                     out += a.s;
                 } else {
-                    std::snprintf(buf, sizeof buf, (spec + "s").c_str(), a.s.c_str());
+                    std::snprintf(buf, sizeof buf, (directive + "s").c_str(), a.s.c_str());
                     out += buf;
                 }
                 break;
@@ -100,7 +100,7 @@ std::string formatArgs(std::string_view fmt, const FormatArg* args, size_t count
                 if (conv == 'c') {
                     out += static_cast<char>(a.kind == FormatArg::Kind::Signed ? a.i : a.u);
                 } else {
-                    out += formatInteger(spec, conv, a, len);
+                    out += formatInteger(directive, conv, a, len);
                 }
                 break;
             case 'f': case 'F': case 'g': case 'G': case 'e': case 'E': {
@@ -108,7 +108,7 @@ std::string formatArgs(std::string_view fmt, const FormatArg* args, size_t count
                            : a.kind == FormatArg::Kind::Signed   ? static_cast<double>(a.i)
                            : a.kind == FormatArg::Kind::Unsigned ? static_cast<double>(a.u)
                                                                  : 0.0;
-                std::snprintf(buf, sizeof buf, (spec + conv).c_str(), v);
+                std::snprintf(buf, sizeof buf, (directive + conv).c_str(), v);
                 out += buf;
                 break;
             }
@@ -119,7 +119,7 @@ std::string formatArgs(std::string_view fmt, const FormatArg* args, size_t count
             }
             default:
                 // Unknown conversion: keep the text so the line still says something.
-                out.append(fmt.substr(i - (spec.size() - 1) - 1, spec.size() + 1));
+                out.append(fmt.substr(i - (directive.size() - 1) - 1, directive.size() + 1));
                 --next;
                 break;
         }
