@@ -26,13 +26,14 @@ FileURL homeChild(const char* relative) { return PathJoin(RootPath(kHome), relat
 
 TarnGlobalConfiguration& TarnGlobalConfiguration::sharedInstance() {
     static std::mutex lock;
-    static TarnGlobalConfiguration* current = nullptr;
+    // Never freed: references handed out under an earlier root stay valid, and
+    // nothing is torn down at exit while other threads may still use it.
+    static auto& made = *new std::vector<std::unique_ptr<TarnGlobalConfiguration>>();
     std::lock_guard<std::mutex> guard(lock);
-    if (!current || current->rootPrefix() != RootPrefix()) {
-        // Never freed: references handed out under an earlier root stay valid.
-        current = new TarnGlobalConfiguration();
+    if (made.empty() || made.back()->rootPrefix() != RootPrefix()) {
+        made.push_back(std::make_unique<TarnGlobalConfiguration>());
     }
-    return *current;
+    return *made.back();
 }
 
 TarnGlobalConfiguration::TarnGlobalConfiguration()

@@ -565,14 +565,15 @@ void TarnUserIdentityCache::TEST_drainFlushQueue() { flushQueue_->sync([] {}); }
 TarnUserIdentitySharedCache& TarnUserIdentitySharedCache::sharedInstance() {
     static std::mutex lock;
     static std::string root;
-    static TarnUserIdentitySharedCache* current = nullptr;
+    // Never freed: references handed out under an earlier root stay valid, and
+    // nothing is torn down at exit while other threads may still use it.
+    static auto& made = *new std::vector<std::unique_ptr<TarnUserIdentitySharedCache>>();
     std::lock_guard<std::mutex> guard(lock);
-    if (!current || root != RootPrefix()) {
-        // Never freed: references handed out before stay valid.
-        current = new TarnUserIdentitySharedCache(PersonaRoster::sharedManager());
+    if (made.empty() || root != RootPrefix()) {
+        made.push_back(std::make_unique<TarnUserIdentitySharedCache>(PersonaRoster::sharedManager()));
         root = RootPrefix();
     }
-    return *current;
+    return *made.back();
 }
 
 }  // namespace tarn

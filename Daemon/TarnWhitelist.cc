@@ -199,9 +199,11 @@ std::unique_ptr<TarnWhitelist> TarnWhitelist::whitelistWithTable(const PlistValu
 TarnWhitelist& TarnWhitelist::sharedWhitelist() {
     static std::mutex lock;
     static std::string root;
-    static TarnWhitelist* current = nullptr;
+    // Never freed: references handed out under an earlier root stay valid, and
+    // nothing is torn down at exit while other threads may still use it.
+    static auto& built = *new std::vector<std::unique_ptr<TarnWhitelist>>();
     std::lock_guard<std::mutex> guard(lock);
-    if (current && root == RootPrefix()) return *current;
+    if (!built.empty() && root == RootPrefix()) return *built.back();
 
     const bool internal = TarnGlobalConfiguration::sharedInstance().isInternalImage();
     std::unique_ptr<TarnWhitelist> made;
@@ -218,10 +220,9 @@ TarnWhitelist& TarnWhitelist::sharedWhitelist() {
         }
     }
     if (!made) made = whitelistWithTable(builtInTable(), internal, nullptr);
-    // Never freed: references handed out under an earlier root stay valid.
-    current = made.release();
+    built.push_back(std::move(made));
     root = RootPrefix();
-    return *current;
+    return *built.back();
 }
 
 TarnWhitelist::TarnWhitelist(

@@ -96,16 +96,17 @@ std::string PersonaListDescription(const std::optional<PersonaAttributesList>& l
 PersonaRoster& PersonaRoster::sharedManager() {
     static std::mutex lock;
     static std::string root;
-    static FilePersonaRoster* current = nullptr;
+    // Never freed: references handed out under an earlier root stay valid (the
+    // old ones only stop watching a tree that is gone), and nothing is torn
+    // down at exit while other threads may still use it.
+    static auto& made = *new std::vector<std::unique_ptr<FilePersonaRoster>>();
     std::lock_guard<std::mutex> guard(lock);
-    if (!current || root != RootPrefix()) {
-        // The old one stays alive for references handed out before; it only
-        // stops watching a tree that is gone.
-        if (current) current->stopWatching();
-        current = new FilePersonaRoster(RootPath(kListFile));
+    if (made.empty() || root != RootPrefix()) {
+        if (!made.empty()) made.back()->stopWatching();
+        made.push_back(std::make_unique<FilePersonaRoster>(RootPath(kListFile)));
         root = RootPrefix();
     }
-    return *current;
+    return *made.back();
 }
 
 PersonaAttributesRef PersonaRoster::personaInfoForPersonaID(uint32_t personaID) {
