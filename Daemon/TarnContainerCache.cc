@@ -1,0 +1,713 @@
+#include "Daemon/TarnContainerCache.h"
+
+#include <cstdlib>
+#include <cstring>
+#include <exception>
+#include <mutex>
+#include <unordered_set>
+
+#include "Daemon/TarnCodeSigningMapping.h"
+#include "Daemon/TarnFileManager.h"
+#include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnLog.h"
+#include "Daemon/TarnTestLocks.h"
+#include "Daemon/TarnWhitelist.h"
+#include "Platform/ContainerLibrary.h"
+#include "Platform/Notifications.h"
+#include "Platform/PlatformLog.h"
+#include "Platform/RootPrefix.h"
+#include "Platform/SandboxUserState.h"
+
+namespace tarn {
+
+namespace {
+
+// The cache's test gate (see TarnTestLocks.h).
+constexpr uint64_t kCacheTestGate = 6;
+// Identifiers from the sandbox state are compared over at most this many bytes.
+constexpr size_t kSandboxIdentifierCompareLimit = 1024;
+
+const char* transientMarker(bool transient) { return transient ? "(transient)" : ""; }
+
+// The user a class's items are filed under: system containers belong to user 0.
+uint32_t sandboxUserForClass(const TarnUserIdentityRef& userIdentity, TarnContainerClass c) {
+    return TarnContainerClassIsSystem(c) ? 0 : userIdentity->posixUIDForContainerClass(c);
+}
+
+TarnErrorRef exceptionError(const char* function, int line, const std::exception* e) {
+    return TarnErrorMake(function, line, TarnErrorException, nullptr, true,
+                         Format("Got exception: %@ : %@", e ? e->what() : "unknown exception",
+                                "(no call stack)"));
+}
+
+}  // namespace
+
+TarnContainerCache& TarnContainerCache::sharedInstance() {
+    static std::mutex lock;
+    static std::string root;
+    // Leaked on purpose: request threads may still use an instance at exit.
+    static auto& made = *new std::vector<std::shared_ptr<TarnContainerCache>>();
+    std::lock_guard<std::mutex> guard(lock);
+    if (made.empty() || root != RootPrefix()) {
+        made.push_back(initWithUserIdentityCache(TarnUserIdentitySharedCache::sharedInstance(),
+                                                 TarnCodeSigningMapping::sharedInstance(),
+                                                 SandboxUserState::sharedInstance()));
+        root = RootPrefix();
+    }
+    return *made.back();
+}
+
+std::shared_ptr<TarnContainerCache> TarnContainerCache::initWithUserIdentityCache(
+    TarnUserIdentityCache& userIdentityCache, TarnCodeSigningMapping* codeSigningMapping) {
+    return initWithUserIdentityCache(userIdentityCache, codeSigningMapping,
+                                     SandboxUserState::sharedInstance());
+}
+
+std::shared_ptr<TarnContainerCache> TarnContainerCache::initWithUserIdentityCache(
+    TarnUserIdentityCache& userIdentityCache, TarnCodeSigningMapping* codeSigningMapping,
+    SandboxUserState& sandboxUserState) {
+    auto cache = std::make_shared<TarnContainerCache>(PrivateTag{}, userIdentityCache,
+                                                      codeSigningMapping, sandboxUserState);
+    userIdentityCache.addObserver(cache);
+    return cache;
+}
+
+TarnContainerCache::TarnContainerCache(PrivateTag, TarnUserIdentityCache& userIdentityCache,
+                                       TarnCodeSigningMapping* codeSigningMapping,
+                                       SandboxUserState& sandboxUserState)
+    : userIdentityCache_(userIdentityCache),
+      codeSigningMapping_(codeSigningMapping),
+      sandboxUserState_(sandboxUserState),
+      invalidationQueue_(
+          DispatchQueue::createSerial("com.ostrea.tarnkeeperd.TarnContainerCache.invalidation")) {}
+
+TarnContainerCache::~TarnContainerCache() { userIdentityCache_.removeObserver(this); }
+
+void TarnContainerCache::assertNotOnMappingQueue() const {
+    if (codeSigningMapping_ && codeSigningMapping_->queue() &&
+        codeSigningMapping_->queue()->isCurrent()) {
+        PlatformLogWrite("cache", PlatformLogType::Fault,
+                         "Container cache called on the code-signing mapping queue");
+        std::abort();
+    }
+}
+
+std::string TarnContainerCache::_cacheKeyForUserIdentity(const TarnUserIdentityRef& userIdentity,
+                                                         TarnContainerClass containerClass) {
+    const char* shortName = TarnContainerClassShortName(containerClass);
+    std::string name = shortName ? shortName : "(null)";
+    if (TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass))
+        return Format("[%@]-%@", userIdentity ? userIdentity->identifier() : "(null)", name);
+    return name;
+}
+
+bool TarnContainerCache::containerURL(const FileURL& url,
+                                      TarnContainerClass isValidForContainerClass) const {
+    const std::string name = PathLastComponent(url);
+    if (Uuid::parse(name)) return true;
+    if (isValidForContainerClass == TarnContainerClassSystemData)
+        return TarnWhitelist::sharedWhitelist().systemContainerIdIsWellknown(name);
+    if (isValidForContainerClass == TarnContainerClassSystemGroup)
+        return TarnWhitelist::sharedWhitelist().systemGroupContainerIdIsWellknown(name);
+    return false;
+}
+
+// ---- Building ----
+
+TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
+    const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
+    TarnErrorRef* error) {
+    return _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, true, true, error);
+}
+
+TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
+    const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
+    bool populateSandboxCache, bool buildCache, TarnErrorRef* error) {
+    const std::string key = _cacheKeyForUserIdentity(userIdentity, contentClass);
+    auto& dictionaries = transient ? transientContainerCache_ : liveContainerCache_;
+    if (auto it = dictionaries.find(key); it != dictionaries.end()) return it->second;
+    if (!buildCache) return nullptr;
+
+    TarnLog(kLogNotice, __func__, "Rebuilding container class cache: %@%@", key,
+            transientMarker(transient));
+    SignpostInterval interval("cache", "RebuildingCache", {{"class", std::to_string(contentClass)}});
+    TarnTestLocks::sharedInstance().waitOnLock(kCacheTestGate);
+    rebuildCount_.fetch_add(1);
+
+    auto directory = TarnGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
+        userIdentity, contentClass, transient);
+    if (!directory) {
+        if (error)
+            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
+                                static_cast<int64_t>(contentClass));
+        return nullptr;
+    }
+    TarnErrorRef listError;
+    auto entries = TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(*directory, &listError);
+    if (!entries) {
+        if (error) *error = listError;
+        return nullptr;
+    }
+
+    auto dictionary = std::make_shared<TarnContainerClassCache>();
+    dictionary->reserve(entries->size());
+    // One durable write of the sandbox state for the whole scan, not one per container.
+    SandboxUserState::Batch batch(sandboxUserState_);
+    for (const FileURL& entry : *entries) {
+        if (!containerURL(entry, contentClass)) continue;
+        TarnErrorRef readError;
+        TarnMetadataRef metadata =
+            TarnMetadata::readAndValidateMetadataAtUrl(entry, userIdentity, true, &readError);
+        if (!metadata) continue;  // not a container of ours; the error is of no use here
+        const std::string identifier = metadata->identifier();
+        (*dictionary)[identifier] = metadata;
+        if (populateSandboxCache && !transient &&
+            _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier,
+                                                               contentClass) &&
+            !setSandboxContainerMappingForUserIdentity(userIdentity, identifier, contentClass,
+                                                       metadata->url())) {
+            TarnLog(kLogError, __func__,
+                    "Failed to set container mapping during create/lookup operation of %@, %llu",
+                    identifier, contentClass);
+        }
+    }
+    dictionaries[key] = dictionary;
+    interval.end({{"class", std::to_string(contentClass)}, {"count", std::to_string(dictionary->size())}});
+    return dictionary;
+}
+
+void TarnContainerCache::_lock_forEachContainerInContainerCache(
+    const TarnContainerClassCache& cache,
+    const std::function<void(const TarnMetadataRef&)>& performBlock) {
+    for (const auto& [identifier, metadata] : cache) performBlock(metadata);
+}
+
+// ---- The registration rule ----
+
+bool TarnContainerCache::shouldRegisterSandboxMappingWithUserIdentity(
+    const TarnUserIdentityRef& userIdentity, const std::string& identifier,
+    TarnContainerClass containerClass) {
+    assertNotOnMappingQueue();
+    MutexLock lock(cacheLock_);
+    return _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, containerClass);
+}
+
+bool TarnContainerCache::_lock_shouldRegisterSandboxMappingWithUserIdentity(
+    const TarnUserIdentityRef& userIdentity, const std::string& identifier,
+    TarnContainerClass containerClass) {
+    return _shouldRegister(userIdentity, identifier, containerClass);
+}
+
+bool TarnContainerCache::_shouldRegister(const TarnUserIdentityRef& userIdentity,
+                                         const std::string& identifier,
+                                         TarnContainerClass containerClass) {
+    if (!userIdentity) return false;
+    bool decision = false;
+    bool isMulti = false;
+    std::optional<std::string> parent;
+    switch (containerClass) {
+        case TarnContainerClassAppData:
+        case TarnContainerClassPluginData:
+        case TarnContainerClassVPNPluginData:
+        case TarnContainerClassConduitServiceData:
+        case TarnContainerClassDaemonData:
+        case TarnContainerClassTempDir: {
+            std::string owner = identifier;
+            // A plug-in's data follows the personas of the application that carries it.
+            if ((containerClass == TarnContainerClassPluginData ||
+                 containerClass == TarnContainerClassVPNPluginData) &&
+                codeSigningMapping_) {
+                std::string p = codeSigningMapping_->parentIdentifierForChildIdentifier(identifier);
+                if (!p.empty()) {
+                    parent = p;
+                    owner = p;
+                }
+            }
+            TarnUserIdentitySet owners = userIdentityCache_.userIdentitiesForBundleIdentifier(owner);
+            TarnUserIdentityRef personal = userIdentityCache_.userIdentityForPersonalPersona();
+            if (owners.size() >= 2 && personal && owners.count(personal)) {
+                isMulti = true;
+                decision = !userIdentity->isEnterprise();
+            } else {
+                decision = owners.count(userIdentity) > 0;
+            }
+            break;
+        }
+        case TarnContainerClassAppGroup:
+            decision = true;
+            break;
+        default:
+            decision = !userIdentity->isEnterprise();
+            break;
+    }
+    PlatformLog("sandbox", PlatformLogType::Info,
+                "Deciding to register userIdentity: %@, identifier: %@ (%@), containerClass: %llu "
+                "with sandbox: %d because isMulti: %d",
+                userIdentity->shortDescription(), identifier, parent, containerClass, decision,
+                isMulti);
+    return decision;
+}
+
+// ---- Kernel sandbox mapping ----
+
+bool TarnContainerCache::setSandboxContainerMappingForUserIdentity(
+    const TarnUserIdentityRef& userIdentity, const std::string& identifier,
+    TarnContainerClass containerClass, const std::optional<FileURL>& url) {
+    if (TarnContainerClassIsBundle(containerClass)) return true;
+    if (!TarnContainerClassIsValid(containerClass) || !userIdentity) {
+        PlatformLog("sandbox", PlatformLogType::Error,
+                    "Unsupported class for setting sandbox container mapping: %llu", containerClass);
+        return false;
+    }
+    const uint32_t user = sandboxUserForClass(userIdentity, containerClass);
+    const uint32_t persona = userIdentity->kernelPersonaID();
+    const uint64_t itemType = TarnContainerClassSandboxItemType(containerClass);
+    const char* path = url ? url->c_str() : "(null)";
+
+    // Clearing first drops any earlier path of this identifier.
+    int result = sandboxUserState_.setUserStateItemWithPersona(user, persona, itemType,
+                                                               identifier.c_str(), nullptr);
+    if (result != 0) {
+        PlatformLog("sandbox", PlatformLogType::Error,
+                    "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: "
+                    "%llu, path: %s : %d",
+                    user, itemType, identifier, containerClass, path, result);
+        return false;
+    }
+    if (url) {
+        result = sandboxUserState_.setUserStateItemWithPersona(user, persona, itemType,
+                                                               identifier.c_str(), url->c_str());
+        if (result != 0) {
+            PlatformLog("sandbox", PlatformLogType::Error,
+                        "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: "
+                        "%llu, path: %s : %d",
+                        user, itemType, identifier, containerClass, path, result);
+            return false;
+        }
+    }
+    PlatformLog("sandbox", PlatformLogType::Default,
+                "Pushed user: %u, itemType: %llu, identifier %s, class: %llu, persona id: %d, path: %s",
+                user, itemType, identifier, containerClass, persona, path);
+    return true;
+}
+
+TarnMetadataRef TarnContainerCache::_lock_metadataFromSandboxForContainerIdentity(
+    const TarnContainerIdentityRef& identity) {
+    const TarnContainerClass containerClass = identity->containerClass();
+    if (!TarnContainerClassIsValid(containerClass) || TarnContainerClassIsBundle(containerClass))
+        return nullptr;
+    const TarnUserIdentityRef& userIdentity = identity->userIdentity();
+    if (!userIdentity) return nullptr;
+    const uint64_t wantedType = TarnContainerClassSandboxItemType(containerClass);
+    const uint32_t user = sandboxUserForClass(userIdentity, containerClass);
+    const std::string& wanted = identity->identifier();
+
+    SignpostInterval interval("cache", "ReadFromSandbox");
+    uint64_t count = 0;
+    std::optional<std::string> foundPath;
+    int result = sandboxUserState_.iterateUserStateItems(
+        user, [&](uint64_t itemType, const SandboxUserStateItem* item) {
+            ++count;
+            if (!item) {
+                PlatformLog("sandbox", PlatformLogType::Debug,
+                            "Sandbox kernel: Got an item iteration with no item struct; itemType = %llu",
+                            itemType);
+                return;
+            }
+            if (itemType != wantedType) return;
+            if (item->identifier.empty() || !item->path) {
+                PlatformLog("sandbox", PlatformLogType::Debug,
+                            "Sandbox kernel: Got an item with no identifier or path; itemType = %llu",
+                            itemType);
+                return;
+            }
+            if (containerClass == TarnContainerClassAppGroup &&
+                item->personaID != userIdentity->kernelPersonaID())
+                return;
+            if (std::strncmp(item->identifier.c_str(), wanted.c_str(),
+                             kSandboxIdentifierCompareLimit) == 0)
+                foundPath = item->path;
+        });
+    auto endInterval = [&] {
+        interval.end({{"count", "<private>"}, {"identifier", "<private>"}});
+    };
+    if (result != 0) {
+        PlatformLog("sandbox", PlatformLogType::Error, "Failed to read back sandbox cache; result = %d",
+                    result);
+        endInterval();
+        return nullptr;
+    }
+    if (!foundPath) {
+        endInterval();
+        return nullptr;
+    }
+    TarnErrorRef readError;
+    TarnMetadataRef metadata =
+        TarnMetadata::readAndValidateMetadataAtUrl(*foundPath, userIdentity, true, &readError);
+    TarnMetadataRef answer;
+    if (!metadata) {
+        TarnLog(kLogError, __func__, "Could not validate container from Sandbox-provided path [%@]; error = %@",
+                *foundPath, readError);
+    } else if (metadata->containerClass() != containerClass || metadata->identifier() != wanted) {
+        TarnLog(kLogError, __func__,
+                "Attempted to fetch container from Sandbox-provided path [%@] that was not what was "
+                "expected; expected class: %llu, expected identifier: [%@], actual class: %llu, actual "
+                "identifier: [%@]",
+                *foundPath, containerClass, wanted, metadata->containerClass(), metadata->identifier());
+    } else {
+        TarnLog(kLogNotice, __func__, "Using container from sandbox kernel cache: %@", metadata);
+        kernelHitCount_.fetch_add(1);
+        answer = metadata;
+    }
+    endInterval();
+    return answer;
+}
+
+// ---- Lookups ----
+
+TarnMetadataRef TarnContainerCache::containerForContainerIdentity(
+    const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox, TarnErrorRef* error) {
+    return containerForContainerIdentity(identity, transient, updateSandbox, true, error);
+}
+
+TarnMetadataRef TarnContainerCache::containerForContainerIdentity(
+    const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox,
+    bool allowKernelLookup, TarnErrorRef* error) {
+    assertNotOnMappingQueue();
+    try {
+        return _containerForContainerIdentity(identity, transient, updateSandbox, allowKernelLookup,
+                                              error);
+    } catch (const std::exception& e) {
+        if (error) *error = exceptionError(__func__, __LINE__, &e);
+    } catch (...) {
+        if (error) *error = exceptionError(__func__, __LINE__, nullptr);
+    }
+    return nullptr;
+}
+
+TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
+    const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox,
+    bool allowKernelLookup, TarnErrorRef* error) {
+    if (!identity) {
+        if (error) *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Cache: nil identity");
+        return nullptr;
+    }
+    const TarnUserIdentityRef& userIdentity = identity->userIdentity();
+    const TarnContainerClass containerClass = identity->containerClass();
+    const std::string& identifier = identity->identifier();
+    const std::string key = _cacheKeyForUserIdentity(userIdentity, containerClass);
+    const char* marker = transientMarker(transient);
+
+    TarnMetadataRef metadata;
+    {
+        MutexLock lock(cacheLock_);
+        TarnContainerClassCacheRef dictionary;
+        bool fromKernel = false;
+        if (allowKernelLookup) {
+            dictionary = _lock_getCacheForUserIdentity(userIdentity, containerClass, transient,
+                                                       updateSandbox, false, nullptr);
+            if (!dictionary && !transient) {
+                metadata = _lock_metadataFromSandboxForContainerIdentity(identity);
+                fromKernel = metadata != nullptr;
+            }
+        }
+        if (!fromKernel) {
+            if (!dictionary) {
+                TarnErrorRef buildError;
+                dictionary = _lock_getCacheForUserIdentity(userIdentity, containerClass, transient,
+                                                           updateSandbox, true, &buildError);
+                if (!dictionary) {
+                    const char* relative = TarnContainerClassRelativeDirectory(containerClass);
+                    if (error)
+                        *error = TARN_ERROR(TarnErrorCacheRebuildFailed, buildError,
+                                            "Cache: [%@]-%@%@: Failed to rebuild",
+                                            userIdentity ? userIdentity->identifier() : "(null)",
+                                            relative ? relative : "(null)", marker);
+                    return nullptr;
+                }
+            }
+            auto it = dictionary->find(identifier);
+            if (it == dictionary->end()) {
+                if (error)
+                    *error = TARN_ERROR(TarnErrorNotFound, nullptr,
+                                        "Cache: %@%@: Container Not Found with ID: %@", key, marker,
+                                        identifier);
+                return nullptr;
+            }
+            metadata = it->second;
+        }
+    }
+
+    if (metadata->url().empty() || metadata->url()[0] != '/') {
+        if (error)
+            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr,
+                                "Cache: %@%@: Invalid URL path string: %@", key, marker, metadata->url());
+        return nullptr;
+    }
+    const FileURL metadataFile = PathJoin(metadata->url(), kTarnMetadataFileName);
+    if (!TarnFileManager::defaultManager().itemExistsAtURL(metadataFile)) {
+        if (error)
+            *error = TARN_ERROR(TarnErrorCacheInconsistent, nullptr,
+                                "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu",
+                                key, marker, metadataFile, identifier, containerClass);
+        TarnErrorRef removeError;
+        if (!removeContainerForUserIdentity(userIdentity, containerClass, identifier, transient,
+                                            &removeError)) {
+            TarnLog(kLogError, __func__,
+                    "Failed to remove from cache user: %@, id: %@, class: %llu, transient: %d : %@",
+                    userIdentity, identifier, containerClass, transient, removeError);
+        }
+        return nullptr;
+    }
+    TarnLog(kLogDebug, __func__, "Cache: %@%@: Found Identifier: %@", key, marker, identifier);
+    return metadata;
+}
+
+TarnMetadataRef TarnContainerCache::containerForContainerIdentity(
+    const TarnConcreteContainerIdentityRef& identity) {
+    if (!identity) return nullptr;
+    TarnContainerIdentityRef base = identity->baseIdentity();
+    for (bool transient : {false, true}) {
+        TarnErrorRef ignored;  // a miss in one dictionary is not the caller's concern
+        TarnMetadataRef found = containerForContainerIdentity(base, transient, true, &ignored);
+        if (found && found->uuid() == identity->uuid()) {
+            if (found->transient() == transient) return found;
+            TarnMutableMetadataRef marked = found->copy();
+            marked->setTransient(transient);
+            return marked;
+        }
+    }
+    return nullptr;
+}
+
+std::optional<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersForUserIdentity(
+    const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
+    TarnErrorRef* error) {
+    return allContainersForUserIdentity(userIdentity, contentClass, transient, true, error);
+}
+
+std::optional<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersForUserIdentity(
+    const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
+    bool populateSandboxCache, TarnErrorRef* error) {
+    assertNotOnMappingQueue();
+    if (!TarnContainerClassIsValid(contentClass)) {
+        if (error)
+            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
+                                static_cast<int64_t>(contentClass));
+        return std::nullopt;
+    }
+    const char* marker = transientMarker(transient);
+    std::vector<TarnMetadataRef> all;
+    try {
+        MutexLock lock(cacheLock_);
+        std::vector<TarnUserIdentityRef> identities;
+        if (userIdentity && userIdentity->isNoSpecificPersona()) {
+            userIdentityCache_.forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+                [&](const TarnUserIdentityRef& u) { identities.push_back(u); });
+        } else {
+            identities.push_back(userIdentity);
+        }
+        std::unordered_set<const TarnContainerClassCache*> seen;
+        for (const auto& identity : identities) {
+            TarnErrorRef buildError;
+            auto dictionary = _lock_getCacheForUserIdentity(identity, contentClass, transient,
+                                                            populateSandboxCache, true, &buildError);
+            if (!dictionary) {
+                const char* relative = TarnContainerClassRelativeDirectory(contentClass);
+                if (error)
+                    *error = TARN_ERROR(TarnErrorCacheRebuildFailed, buildError,
+                                        "Cache: [%@]-%@%@: Failed to rebuild",
+                                        identity ? identity->identifier() : "(null)", relative, marker);
+                return std::nullopt;
+            }
+            // Global classes answer one dictionary for every identity.
+            if (!seen.insert(dictionary.get()).second) continue;
+            _lock_forEachContainerInContainerCache(
+                *dictionary, [&](const TarnMetadataRef& m) { all.push_back(m); });
+        }
+    } catch (const std::exception& e) {
+        if (error) *error = exceptionError(__func__, __LINE__, &e);
+        return std::nullopt;
+    }
+
+    std::vector<TarnMetadataRef> answer;
+    answer.reserve(all.size());
+    for (const auto& metadata : all) {
+        const std::string key = _cacheKeyForUserIdentity(metadata->userIdentity(), contentClass);
+        if (metadata->url().empty()) {
+            TarnLog(kLogError, __func__, "Cache: %@%@: nil URL from %@", key, marker, metadata);
+            continue;
+        }
+        const FileURL metadataFile = PathJoin(metadata->url(), kTarnMetadataFileName);
+        if (!TarnFileManager::defaultManager().itemExistsAtURL(metadataFile)) {
+            TarnLog(kLogError, __func__,
+                    "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", key,
+                    marker, metadataFile, metadata->identifier(), contentClass);
+            TarnErrorRef removeError;
+            if (!removeContainerForUserIdentity(metadata->userIdentity(), contentClass,
+                                                metadata->identifier(), transient, &removeError)) {
+                TarnLog(kLogError, __func__,
+                        "Failed to remove from cache user: %@, id: %@, class: %llu, transient: %d : %@",
+                        metadata->userIdentity(), metadata->identifier(), contentClass, transient,
+                        removeError);
+            }
+            continue;
+        }
+        TarnLog(kLogDebug, __func__, "Cache: %@%@: ALL Found Identifier: %@", key, marker,
+                metadata->identifier());
+        answer.push_back(metadata);
+    }
+    return answer;
+}
+
+// ---- Changes ----
+
+bool TarnContainerCache::addContainerMetadata(const TarnMetadataRef& metadata, const FileURL& url,
+                                              bool transient, bool updateSandbox, TarnErrorRef* error) {
+    assertNotOnMappingQueue();
+    if (!metadata || !TarnContainerClassIsValid(metadata->containerClass())) {
+        if (error)
+            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr,
+                                "Invalid Metadata Content Class: %lld",
+                                metadata ? static_cast<int64_t>(metadata->containerClass()) : int64_t{0});
+        return false;
+    }
+    if (metadata->identifier().empty()) {
+        if (error)
+            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid metadata Identifier: %@",
+                                metadata->identifier());
+        return false;
+    }
+    if (url.empty() || url[0] != '/') {
+        if (error)
+            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid input: URL: %@", url);
+        return false;
+    }
+    const TarnUserIdentityRef& userIdentity = metadata->userIdentity();
+    const TarnContainerClass containerClass = metadata->containerClass();
+    const std::string& identifier = metadata->identifier();
+    bool shouldRegister = false;
+    {
+        MutexLock lock(cacheLock_);
+        TarnErrorRef buildError;
+        auto dictionary = _lock_getCacheForUserIdentity(userIdentity, containerClass, transient,
+                                                        updateSandbox, updateSandbox, &buildError);
+        if (!dictionary) {
+            // Without a dictionary the container is on disk and the next build reads it.
+            if (!updateSandbox) return true;
+            if (error)
+                *error = TARN_ERROR(TarnErrorCacheRebuildFailed, buildError,
+                                    "Cache: [%@]-%@%@: Failed to rebuild",
+                                    userIdentity ? userIdentity->identifier() : "(null)",
+                                    TarnContainerClassRelativeDirectory(containerClass),
+                                    transientMarker(transient));
+            return false;
+        }
+        TarnMutableMetadataRef stored = metadata->copy();
+        stored->setUrl(url);
+        (*dictionary)[identifier] = stored;
+        if (updateSandbox)
+            shouldRegister =
+                _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, containerClass);
+    }
+    if (updateSandbox && !transient && shouldRegister &&
+        !setSandboxContainerMappingForUserIdentity(userIdentity, identifier, containerClass, url)) {
+        TarnLog(kLogError, __func__, "Failed to set container mapping of %@, %llu", identifier,
+                containerClass);
+    }
+    TarnLog(kLogDebug, __func__, "Cache: %@%@: Added Identifier: %@",
+            _cacheKeyForUserIdentity(userIdentity, containerClass), transientMarker(transient),
+            identifier);
+    return true;
+}
+
+bool TarnContainerCache::removeContainerForUserIdentity(const TarnUserIdentityRef& userIdentity,
+                                                        TarnContainerClass contentClass,
+                                                        const std::string& identifier, bool transient,
+                                                        TarnErrorRef* error) {
+    assertNotOnMappingQueue();
+    if (!TarnContainerClassIsValid(contentClass)) {
+        if (error)
+            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
+                                static_cast<int64_t>(contentClass));
+        return false;
+    }
+    if (identifier.empty()) {
+        if (error)
+            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Identifier: %@", identifier);
+        return false;
+    }
+    bool shouldRegister = false;
+    {
+        MutexLock lock(cacheLock_);
+        TarnErrorRef buildError;
+        auto dictionary = _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, &buildError);
+        if (!dictionary) {
+            if (error)
+                *error = TARN_ERROR(TarnErrorCacheRebuildFailed, buildError,
+                                    "Cache: [%@]-%@%@: Failed to rebuild",
+                                    userIdentity ? userIdentity->identifier() : "(null)",
+                                    TarnContainerClassRelativeDirectory(contentClass),
+                                    transientMarker(transient));
+            return false;
+        }
+        dictionary->erase(identifier);
+        shouldRegister =
+            _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, contentClass);
+    }
+    if (shouldRegister && !transient &&
+        !setSandboxContainerMappingForUserIdentity(userIdentity, identifier, contentClass,
+                                                   std::nullopt)) {
+        TarnLog(kLogError, __func__, "Failed to remove container mapping of %@, %llu", identifier,
+                contentClass);
+    }
+    TarnLog(kLogDebug, __func__, "Cache: %@%@: Removed Identifier: %@",
+            _cacheKeyForUserIdentity(userIdentity, contentClass), transientMarker(transient),
+            identifier);
+    return true;
+}
+
+// ---- Invalidation ----
+
+void TarnContainerCache::invalidateUserIdentity(const TarnUserIdentityRef& userIdentity) {
+    assertNotOnMappingQueue();
+    {
+        MutexLock lock(cacheLock_);
+        _lock_invalidateUserIdentity(userIdentity);
+    }
+    if (uint32_t status = NotifyPost(CONTAINER_NOTIFY_USER_INVALIDATED); status != 0)
+        TarnLog(kLogError, __func__, "Could not post user-invalidated notification: %u", status);
+}
+
+void TarnContainerCache::_lock_invalidateUserIdentity(const TarnUserIdentityRef& userIdentity) {
+    SandboxUserState::Batch batch(sandboxUserState_);
+    for (TarnContainerClass c = 1; c <= 13; ++c) {
+        const std::string key = _cacheKeyForUserIdentity(userIdentity, c);
+        if (auto it = liveContainerCache_.find(key); it != liveContainerCache_.end()) {
+            _lock_forEachContainerInContainerCache(*it->second, [&](const TarnMetadataRef& m) {
+                if (!setSandboxContainerMappingForUserIdentity(userIdentity, m->identifier(), c,
+                                                               std::nullopt))
+                    TarnLog(kLogError, "invalidateUserIdentity",
+                            "Failed to remove container mapping of [%@], class: %llu",
+                            m->identifier(), c);
+            });
+        }
+        liveContainerCache_.erase(key);
+        transientContainerCache_.erase(key);
+    }
+}
+
+void TarnContainerCache::userIdentityCache(TarnUserIdentityCache& cache,
+                                           const TarnUserIdentityRef& didInvalidateUserIdentity) {
+    std::weak_ptr<TarnContainerCache> weak = weak_from_this();
+    TarnUserIdentityRef identity = didInvalidateUserIdentity;
+    transactionAsync(invalidationQueue_, [weak, identity] {
+        if (auto self = weak.lock()) self->invalidateUserIdentity(identity);
+    });
+}
+
+void TarnContainerCache::TEST_drainInvalidations() {
+    invalidationQueue_->sync([] {});
+}
+
+}  // namespace tarn
