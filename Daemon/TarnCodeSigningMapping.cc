@@ -1,0 +1,537 @@
+#include "Daemon/TarnCodeSigningMapping.h"
+
+#include <cassert>
+#include <filesystem>
+#include <fstream>
+#include <iterator>
+#include <mutex>
+#include <system_error>
+
+#include "Daemon/TarnSQLiteDB.h"
+#include "Platform/PlatformLog.h"
+#include "Platform/RootPrefix.h"
+
+namespace tarn {
+
+namespace {
+
+constexpr const char* kQueueLabel = "com.ostrea.TarnKeeper.EntitlementQueue";
+constexpr const char* kLegacyMappingFileName = "tarn_code_signing_info.plist";
+
+// The daemon's library directory; the global configuration will answer this.
+FileURL libraryDirectoryURL() { return RootPath("/private/var/root/Library/TarnKeeper"); }
+
+std::mutex gSharedMutex;
+std::unique_ptr<TarnCodeSigningMapping> gSharedMapping;
+
+const std::optional<PlistDict> kNoInfo;
+
+}  // namespace
+
+// ---- counted set ----
+
+void TarnCountedSet::removeObject(std::string_view object) {
+    auto it = counts_.find(object);
+    if (it == counts_.end()) return;
+    if (--it->second == 0) counts_.erase(it);
+}
+
+size_t TarnCountedSet::countForObject(std::string_view object) const {
+    auto it = counts_.find(object);
+    return it == counts_.end() ? 0 : it->second;
+}
+
+// ---- life cycle ----
+
+TarnCodeSigningMapping* TarnCodeSigningMapping::sharedInstance() {
+    std::lock_guard<std::mutex> lock(gSharedMutex);
+    if (gSharedMapping) return gSharedMapping.get();
+    FileURL library = libraryDirectoryURL();
+    std::error_code ec;
+    // The global configuration creates this directory; until then make sure it exists.
+    std::filesystem::create_directories(library, ec);
+    std::unique_ptr<TarnSQLiteDB> db = TarnSQLiteDB::initWithParentDirectoryURL(library);
+    if (!db) {
+        TarnLog(kLogError, "sharedInstance", "Failed to initialize database.");
+        return nullptr;
+    }
+    gSharedMapping = std::make_unique<TarnCodeSigningMapping>(nullptr, DispatchQueue::createSerial(kQueueLabel),
+                                                              std::move(db));
+    return gSharedMapping.get();
+}
+
+void TarnCodeSigningMapping::TEST_setSharedInstance(std::unique_ptr<TarnCodeSigningMapping> mapping) {
+    std::lock_guard<std::mutex> lock(gSharedMutex);
+    gSharedMapping = std::move(mapping);
+}
+
+TarnCodeSigningMapping::TarnCodeSigningMapping(TarnUserIdentitySharedCache* userIdentityCache,
+                                               DispatchQueueRef queue, std::unique_ptr<TarnSQLiteDB> mappingDB)
+    : userIdentityCache_(userIdentityCache), queue_(std::move(queue)), codeSigningMappingDB_(std::move(mappingDB)) {
+    runOnQueue([&] { _onQueue_migrateFromMappingFileToDBIfNecessary(); });
+}
+
+TarnCodeSigningMapping::~TarnCodeSigningMapping() = default;
+
+void TarnCodeSigningMapping::runOnQueue(const std::function<void()>& work) {
+    // Entering our own serial queue from itself would never return.
+    assert(!queue_->isCurrent());
+    queue_->sync(work);
+}
+
+void TarnCodeSigningMapping::assertOnQueue() const { assert(queue_->isCurrent()); }
+
+// ---- entitlement helpers ----
+
+std::optional<std::vector<std::string>> TarnCodeSigningMapping::_copyApplicationGroupEntitlementForIdentifier(
+    const std::string& identifier, const PlistDict* entitlements, const char* groupKey) {
+    if (!entitlements) return std::nullopt;
+    auto it = entitlements->find(groupKey);
+    if (it == entitlements->end()) return std::nullopt;
+    const PlistValue& value = it->second;
+    if (const PlistArray* array = value.asArray()) {
+        std::vector<std::string> ids;
+        ids.reserve(array->size());
+        for (const PlistValue& element : *array) {
+            const std::string* s = element.asString();
+            if (!s) {
+                TarnLog(kLogError, "_copyApplicationGroupEntitlementForIdentifier",
+                        "Entitlement %@ for %@ contains non-string values; ignoring.", groupKey, identifier);
+                return std::nullopt;
+            }
+            ids.push_back(*s);
+        }
+        return ids;
+    }
+    if (const std::string* s = value.asString()) return std::vector<std::string>{*s};
+    TarnLog(kLogError, "_copyApplicationGroupEntitlementForIdentifier",
+            "Entitlement %@ for %@ does not contain supported types; ignoring.", groupKey, identifier);
+    return std::nullopt;
+}
+
+std::optional<std::vector<std::string>> TarnCodeSigningMapping::_appGroupIdentifiersForIdentifier(
+    const std::string& identifier, const PlistDict* entitlements) {
+    return _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, kTarnApplicationGroupsEntitlement);
+}
+
+std::optional<std::vector<std::string>> TarnCodeSigningMapping::_systemGroupIdentifiersForIdentifier(
+    const std::string& identifier, const PlistDict* entitlements) {
+    auto ids = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, kTarnSystemGroupsEntitlement);
+    if (!ids || ids->empty()) {
+        ids = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements,
+                                                            kTarnSystemGroupContainersEntitlement);
+    }
+    if (!ids) return std::nullopt;
+    std::vector<std::string> kept;
+    kept.reserve(ids->size());
+    for (std::string& id : *ids) {
+        if (id.starts_with(kTarnSystemGroupPrefix)) {
+            kept.push_back(std::move(id));
+        } else {
+            TarnLog(kLogError, "_systemGroupIdentifiersForIdentifier",
+                    "System group ID %@ does not have proper prefix, ignoring.", id);
+        }
+    }
+    return kept;
+}
+
+bool TarnCodeSigningMapping::_entitlementsHasSystemContainer(const PlistDict* entitlements) {
+    if (!entitlements) return false;
+    auto it = entitlements->find(kTarnSystemContainerEntitlement);
+    return it != entitlements->end() && it->second.truthy();
+}
+
+const PlistDict* TarnCodeSigningMapping::_entitlementsFromCodeSigningEntry(const TarnCodeSigningEntryRef& entry) {
+    return entry ? entry->entitlements() : nullptr;
+}
+
+const std::optional<PlistDict>& TarnCodeSigningMapping::_codeSigningInfoForCodeSigningEntry(
+    const TarnCodeSigningEntryRef& entry, bool externalRequest) {
+    if (!entry) return kNoInfo;
+    // Clients must not act on information the installer has not committed to
+    // or that belongs to a bundle that is gone.
+    if (externalRequest && (entry->placeholder() || entry->advanceCopy() || entry->invalid())) return kNoInfo;
+    return entry->codeSigningInfo();
+}
+
+// ---- on the queue ----
+
+TarnCodeSigningEntryRef TarnCodeSigningMapping::_onQueue_codeSigningEntryForIdentifier(
+    const std::string& identifier, TarnErrorRef* withError) {
+    assertOnQueue();
+    TarnErrorRef e;
+    TarnCodeSigningEntryRef entry = codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier, &e);
+    if (!entry && e) {
+        if (e->code() != TarnErrorDatabaseNotFound) {
+            TarnLog(kLogError, "_onQueue_codeSigningEntryForIdentifier",
+                    "Error retrieving entry from DB with identifier %@ : %@", identifier, e);
+        }
+        if (withError) *withError = e;
+    }
+    return entry;
+}
+
+std::optional<PlistDict> TarnCodeSigningMapping::_onQueue_codeSigningInfoForIdentifier(const std::string& identifier,
+                                                                                      bool externalRequest) {
+    assertOnQueue();
+    TarnCodeSigningEntryRef entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr);
+    return _codeSigningInfoForCodeSigningEntry(entry, externalRequest);
+}
+
+std::optional<PlistDict> TarnCodeSigningMapping::_onQueue_entitlementsForIdentifier(const std::string& identifier) {
+    assertOnQueue();
+    TarnCodeSigningEntryRef entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr);
+    if (const PlistDict* entitlements = _entitlementsFromCodeSigningEntry(entry)) return *entitlements;
+    return std::nullopt;
+}
+
+uint64_t TarnCodeSigningMapping::_onQueue_dataContainerTypeForIdentifier(const std::string& identifier) {
+    assertOnQueue();
+    TarnCodeSigningEntryRef entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr);
+    return entry ? entry->dataContainerClass() : 0;
+}
+
+bool TarnCodeSigningMapping::_onQueue_identifierHasCallerRegisteredEntitlements(const std::string& identifier) {
+    assertOnQueue();
+    TarnCodeSigningEntryRef entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr);
+    return entry && entry->registeredByCaller();
+}
+
+std::string TarnCodeSigningMapping::_onQueue_parentIdentifierForChildIdentifier(const std::string& identifier) {
+    assertOnQueue();
+    TarnErrorRef e;
+    std::string parent = codeSigningMappingDB_->parentIdentifierForChildIdentifier(identifier, &e);
+    if (e && e->code() != TarnErrorDatabaseNotFound) {
+        TarnLog(kLogError, "_onQueue_parentIdentifierForChildIdentifier",
+                "Error retrieving entry from DB with identifier %@ : %@", identifier, e);
+    }
+    return parent;
+}
+
+std::vector<std::string> TarnCodeSigningMapping::_onQueue_childBundleIdentifiersForParentIdentifier(
+    const std::string& identifier) {
+    assertOnQueue();
+    TarnErrorRef e;
+    std::vector<std::string> children = codeSigningMappingDB_->childIdentifiersForParentIdentifier(identifier, &e);
+    if (e && e->code() != TarnErrorDatabaseNotFound) {
+        TarnLog(kLogError, "_onQueue_childBundleIdentifiersForParentIdentifier",
+                "Error retrieving entry from DB with identifier %@ : %@", identifier, e);
+    }
+    return children;
+}
+
+std::set<std::string> TarnCodeSigningMapping::_onQueue_identifiersWithError(TarnErrorRef* error) {
+    assertOnQueue();
+    return codeSigningMappingDB_->identifiersWithError(error);
+}
+
+bool TarnCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifier(const std::string& identifier,
+                                                                            TarnErrorRef* error) {
+    assertOnQueue();
+    return codeSigningMappingDB_->invalidateCodeSigningWithIdentifier(identifier, error);
+}
+
+bool TarnCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(
+    const std::string& identifier, TarnErrorRef* error) {
+    assertOnQueue();
+    return codeSigningMappingDB_->invalidateCodeSigningForIdentifierAndAllChildren(identifier, error);
+}
+
+bool TarnCodeSigningMapping::_onQueue_removeAllAdvanceCopiesWithError(TarnErrorRef* error) {
+    assertOnQueue();
+    return codeSigningMappingDB_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(error);
+}
+
+void TarnCodeSigningMapping::_onQueue_iterateGroupIdsWithKey(const char* key, const char* fallBackKey,
+                                                             const GroupIdsBlock& forAllIdentifiersUsingBlock) {
+    assertOnQueue();
+    TarnErrorRef e = codeSigningMappingDB_->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+        [&](const std::string& identifier, const TarnCodeSigningEntryRef& entry) {
+            const PlistDict* entitlements = _entitlementsFromCodeSigningEntry(entry);
+            const PlistValue* value = nullptr;
+            if (entitlements) {
+                if (auto it = entitlements->find(key); it != entitlements->end()) value = &it->second;
+                if (fallBackKey) {
+                    auto primary = _copyApplicationGroupEntitlementForIdentifier(identifier, entitlements, key);
+                    if (!primary || primary->empty()) {
+                        if (auto it = entitlements->find(fallBackKey); it != entitlements->end()) value = &it->second;
+                    }
+                }
+            }
+            forAllIdentifiersUsingBlock(identifier, value);
+        });
+    if (e) TarnLog(kLogError, "_onQueue_iterateGroupIdsWithKey", "Failed to enumerate code signing info: %@", e);
+}
+
+TarnCountedSet TarnCodeSigningMapping::_onQueue_copyReferenceCountSetOfType(TarnGroupType type) {
+    assertOnQueue();
+    TarnCountedSet counts;
+    const char* key = type == TarnGroupTypeSystem ? kTarnSystemGroupsEntitlement : kTarnApplicationGroupsEntitlement;
+    const char* fallBackKey = type == TarnGroupTypeSystem ? kTarnSystemGroupContainersEntitlement : nullptr;
+    _onQueue_iterateGroupIdsWithKey(key, fallBackKey, [&](const std::string& identifier, const PlistValue* groupIds) {
+        if (!groupIds) return;
+        if (!groupIds->isArray() && !groupIds->isString()) {
+            TarnLog(kLogError, "_onQueue_copyReferenceCountSetOfType",
+                    "identifier: %@ has non-array type of group container IDs: %@", identifier, *groupIds);
+            return;
+        }
+        // The prefix rule of system groups is not applied: a container made
+        // under any name must still be counted before it can be removed.
+        PlistDict holder{{key, *groupIds}};
+        auto ids = _copyApplicationGroupEntitlementForIdentifier(identifier, &holder, key);
+        if (!ids) return;
+        TarnLog(kLogDebug, "_onQueue_copyReferenceCountSetOfType",
+                "Entitlements for identifier %@ references container IDs: %@", identifier, *groupIds);
+        for (const std::string& id : *ids) counts.addObject(id);
+    });
+    return counts;
+}
+
+uint64_t TarnCodeSigningMapping::_onQueue_setCodeSigningDictionaryValues(
+    const std::vector<TarnCodeSigningEntryRef>& values, const std::vector<std::string>& forIdentifiers) {
+    assertOnQueue();
+    if (values.size() != forIdentifiers.size()) {
+        TarnErrorRef e = TARN_ERROR(TarnErrorMismatchedInput, nullptr,
+                                    "Can't act on an invalid input: values count: %ld, IDs count: %ld",
+                                    values.size(), forIdentifiers.size());
+        return e->code();
+    }
+    for (size_t i = 0; i < values.size(); ++i) {
+        const std::string& identifier = forIdentifiers[i];
+        const TarnCodeSigningEntryRef& entry = values[i];
+        TarnErrorRef readError;
+        TarnCodeSigningEntryRef stored = codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier, &readError);
+        if (!stored && readError && readError->code() != TarnErrorDatabaseNotFound) {
+            TarnLog(kLogError, "_onQueue_setCodeSigningDictionaryValues",
+                    "Error retrieving entry from DB with identifier %@ : %@", identifier, readError);
+            break;
+        }
+        if (!entry || !entry->codeSigningInfo()) {
+            if (!stored) continue;
+            TarnErrorRef deleteError;
+            if (!codeSigningMappingDB_->deleteCodeSigningEntryWithIdentifier(identifier, &deleteError)) {
+                TarnLog(kLogError, "_onQueue_setCodeSigningDictionaryValues",
+                        "Failed to delete code signing info from DB for %@ : %@", identifier, deleteError);
+            } else {
+                PlatformLog("codesignmapping", PlatformLogType::Debug, "Deleted Code Signing Mapping for ID: %@",
+                            identifier);
+            }
+            continue;
+        }
+        if (TarnCodeSigningEntriesEqual(stored, entry)) continue;
+        TarnErrorRef writeError;
+        if (!codeSigningMappingDB_->addCodeSigningEntry(entry, identifier, &writeError)) {
+            TarnLog(kLogError, "_onQueue_setCodeSigningDictionaryValues",
+                    "Failed to write code signing info to DB for %@ : %@", identifier, writeError);
+        } else {
+            PlatformLog("codesignmapping", PlatformLogType::Default, "Set Code Signing Mapping for ID: %@ : %@",
+                        identifier, entry);
+        }
+    }
+    return TarnSuccess;
+}
+
+// ---- legacy mapping file ----
+
+std::optional<PlistDict> TarnCodeSigningMapping::_readCodeSigningMappingFromDiskAtURL(const FileURL& url,
+                                                                                     TarnErrorRef* error) {
+    std::error_code ec;
+    const uintmax_t size = std::filesystem::file_size(url, ec);
+    if (ec) {
+        if (error) *error = TARN_POSIX_ERROR(ec.value(), "%@: %s", url, ec.message());
+        return std::nullopt;
+    }
+    if (size > kMaxPlistBytes) {
+        if (error) *error = TARN_POSIX_ERROR(EFBIG, "%@ is too large to read (%llu bytes)", url, size);
+        return std::nullopt;
+    }
+    std::ifstream in(url, std::ios::binary);
+    std::vector<char> bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    if (!in.good() && !in.eof()) {
+        if (error) *error = TARN_POSIX_ERROR(EIO, "%@: read failed", url);
+        return std::nullopt;
+    }
+    std::string why;
+    std::optional<PlistValue> parsed = PlistValue::fromBytes(bytes.data(), bytes.size(), &why);
+    if (!parsed || !parsed->isDict()) {
+        if (error) {
+            *error = TARN_ERROR_SILENT(TarnErrorReadFailed, nullptr, "%@ is not a dictionary: %@", url,
+                                       parsed ? std::string("wrong root type") : why);
+        }
+        return std::nullopt;
+    }
+    return std::move(*parsed->asDict());
+}
+
+void TarnCodeSigningMapping::_onQueue_migrateFromMappingFileToDBIfNecessary() {
+    assertOnQueue();
+    const FileURL url = PathJoin(libraryDirectoryURL(), kLegacyMappingFileName);
+    TarnErrorRef readError;
+    std::optional<PlistDict> mapping = _readCodeSigningMappingFromDiskAtURL(url, &readError);
+    if (!mapping) {
+        if (!(readError && readError->posixCode() == ENOENT)) {
+            TarnLog(kLogError, "_onQueue_migrateFromMappingFileToDBIfNecessary",
+                    "Failed to read code signing mapping file at %@ : %@", url, readError);
+        }
+        return;
+    }
+    TarnLog(kLogNotice, "_onQueue_migrateFromMappingFileToDBIfNecessary", "Migrating code signing info from file to DB");
+    int migrated = 0;
+    int failed = 0;
+    for (const auto& [identifier, serialized] : *mapping) {
+        // An entry that cannot be decoded goes to the store as nothing, which
+        // refuses it with its own error.
+        TarnCodeSigningEntryRef entry = TarnCodeSigningEntry::initWithSerializedDictionary(serialized);
+        TarnErrorRef e;
+        if (codeSigningMappingDB_->addCodeSigningEntry(entry, identifier, &e)) {
+            ++migrated;
+        } else {
+            ++failed;
+            TarnLog(kLogError, "_onQueue_migrateFromMappingFileToDBIfNecessary",
+                    "Failed to migrate code signing entry for %@ : %@", identifier, e);
+        }
+    }
+    TarnLog(kLogNotice, "_onQueue_migrateFromMappingFileToDBIfNecessary",
+            "Successfully migrated %d entries, failed to migrate %d", migrated, failed);
+    // Keep a file none of whose entries made it, so the next start tries again.
+    if (migrated > 0) {
+        std::error_code ec;
+        if (!std::filesystem::remove(url, ec) && ec) {
+            TarnLog(kLogError, "_onQueue_migrateFromMappingFileToDBIfNecessary",
+                    "Failed to remove legacy code signing mapping file: %@",
+                    TARN_POSIX_ERROR(ec.value(), "%@: %s", url, ec.message()));
+        }
+    }
+}
+
+// ---- public operations ----
+
+std::optional<PlistDict> TarnCodeSigningMapping::entitlementsForIdentifier(const std::string& identifier) {
+    if (identifier.empty()) return std::nullopt;
+    std::optional<PlistDict> entitlements;
+    runOnQueue([&] { entitlements = _onQueue_entitlementsForIdentifier(identifier); });
+    return entitlements;
+}
+
+std::optional<PlistDict> TarnCodeSigningMapping::getCodeSigningInfoForIdentifier(const std::string& identifier) {
+    if (identifier.empty()) return std::nullopt;
+    // First through the internal read, which is where information still kept
+    // in a bundle container gets imported.
+    (void)entitlementsForIdentifier(identifier);
+    std::optional<PlistDict> info;
+    runOnQueue([&] { info = _onQueue_codeSigningInfoForIdentifier(identifier, true); });
+    return info;
+}
+
+TarnCodeSigningEntryRef TarnCodeSigningMapping::codeSigningEntryForIdentifier(const std::string& identifier,
+                                                                              TarnErrorRef* withError) {
+    TarnCodeSigningEntryRef entry;
+    runOnQueue([&] { entry = _onQueue_codeSigningEntryForIdentifier(identifier, withError); });
+    return entry;
+}
+
+std::optional<std::vector<std::string>> TarnCodeSigningMapping::appGroupIdentifiersForIdentifier(
+    const std::string& identifier) {
+    std::optional<PlistDict> entitlements = entitlementsForIdentifier(identifier);
+    return _appGroupIdentifiersForIdentifier(identifier, entitlements ? &*entitlements : nullptr);
+}
+
+std::optional<std::vector<std::string>> TarnCodeSigningMapping::systemGroupIdentifiersForIdentifier(
+    const std::string& identifier) {
+    std::optional<PlistDict> entitlements = entitlementsForIdentifier(identifier);
+    return _systemGroupIdentifiersForIdentifier(identifier, entitlements ? &*entitlements : nullptr);
+}
+
+bool TarnCodeSigningMapping::identifierHasSystemContainer(const std::string& identifier) {
+    std::optional<PlistDict> entitlements = entitlementsForIdentifier(identifier);
+    return _entitlementsHasSystemContainer(entitlements ? &*entitlements : nullptr);
+}
+
+bool TarnCodeSigningMapping::identifierHasCallerRegisteredEntitlements(const std::string& identifier) {
+    bool registered = false;
+    runOnQueue([&] { registered = _onQueue_identifierHasCallerRegisteredEntitlements(identifier); });
+    return registered;
+}
+
+uint64_t TarnCodeSigningMapping::dataContainerTypeForIdentifier(const std::string& identifier) {
+    uint64_t type = 0;
+    runOnQueue([&] { type = _onQueue_dataContainerTypeForIdentifier(identifier); });
+    return type;
+}
+
+std::string TarnCodeSigningMapping::parentIdentifierForChildIdentifier(const std::string& identifier) {
+    std::string parent;
+    runOnQueue([&] { parent = _onQueue_parentIdentifierForChildIdentifier(identifier); });
+    return parent;
+}
+
+std::vector<std::string> TarnCodeSigningMapping::childBundleIdentifiersForParentIdentifier(
+    const std::string& identifier) {
+    std::vector<std::string> children;
+    runOnQueue([&] { children = _onQueue_childBundleIdentifiersForParentIdentifier(identifier); });
+    return children;
+}
+
+std::set<std::string> TarnCodeSigningMapping::identifiersWithError(TarnErrorRef* error) {
+    std::set<std::string> identifiers;
+    runOnQueue([&] { identifiers = _onQueue_identifiersWithError(error); });
+    return identifiers;
+}
+
+TarnCountedSet TarnCodeSigningMapping::copyReferenceCountSetOfType(TarnGroupType type) {
+    TarnCountedSet counts;
+    runOnQueue([&] { counts = _onQueue_copyReferenceCountSetOfType(type); });
+    return counts;
+}
+
+bool TarnCodeSigningMapping::invalidateCodeSigningInfoForIdentifier(const std::string& identifier,
+                                                                    TarnErrorRef* withError) {
+    bool ok = false;
+    runOnQueue([&] { ok = _onQueue_invalidateCodeSigningInfoForIdentifier(identifier, withError); });
+    return ok;
+}
+
+bool TarnCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
+                                                                                  TarnErrorRef* withError) {
+    bool ok = false;
+    runOnQueue([&] { ok = _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(identifier, withError); });
+    return ok;
+}
+
+bool TarnCodeSigningMapping::removeAllAdvanceCopiesWithError(TarnErrorRef* error) {
+    bool ok = false;
+    runOnQueue([&] { ok = _onQueue_removeAllAdvanceCopiesWithError(error); });
+    return ok;
+}
+
+uint64_t TarnCodeSigningMapping::processCallerRegisteredEntitlements(const PlistDict& entitlements,
+                                                                     const std::string& forIdentifier,
+                                                                     TarnCommandQueue* commandQueue) {
+    return TarnSuccess;
+}
+
+// ---- command 19 ----
+
+void TarnHandleGetCodeSigningInfoCommand(const PlistValue& request, PlistValue& reply,
+                                         TarnClientConnection* connection, uint64_t* error) {
+    try {
+        std::string identifier;
+        if (const PlistValue* value = request.find("Identifier")) {
+            if (const std::string* s = value->asString()) identifier = *s;
+        }
+        std::optional<PlistDict> info;
+        if (TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance()) {
+            info = mapping->getCodeSigningInfoForIdentifier(identifier);
+        }
+        if (!info) {
+            TarnSetError(error, TarnErrorNotFound);
+            return;
+        }
+        reply.set("ReplyInfoDictionary", std::move(*info));
+    } catch (const std::exception& ex) {
+        TarnErrorRef e = TARN_ERROR(TarnErrorException, nullptr, "Got exception: %@ : %@", ex.what(), "()");
+        TarnSetError(error, e->code());
+    }
+}
+
+}  // namespace tarn

@@ -1,0 +1,195 @@
+// The code-signing mapping: per code-signing identifier, the code-signing
+// information and entitlements the installer (or the client itself) gave the
+// daemon, kept in TarnSQLiteDB, and the answers derived from them (group
+// identifiers, system container, data-container class, parent and children).
+//
+// Concurrency: every store access runs on the mapping's one serial queue,
+// "com.ostrea.TarnKeeper.EntitlementQueue". Public operations enter it
+// synchronously, so they must not be called from it (that would deadlock;
+// it is asserted). `_onQueue_` operations must run on it. Work on the queue
+// runs strictly one item at a time in submission order, so a read never sees
+// half of a write.
+//
+// Lifetime: the shared instance is made on first use and lives for the whole
+// process. Entries handed out are immutable snapshots.
+//
+// Views: internal reads answer an entry's information whatever its flags;
+// external reads (answers that leave the daemon) answer nothing for a
+// placeholder, an advance copy or an invalidated entry.
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <map>
+#include <memory>
+#include <optional>
+#include <set>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "Daemon/TarnCodeSigningEntry.h"
+#include "Daemon/TarnError.h"
+#include "Platform/Dispatch.h"
+#include "Platform/Path.h"
+#include "Platform/PropertyList.h"
+
+namespace tarn {
+
+class TarnSQLiteDB;
+class TarnCommandQueue;
+class TarnClientConnection;
+class TarnUserIdentitySharedCache;
+
+// Group type: which entitlement names the groups and which class their containers have.
+enum TarnGroupType : uint64_t {
+    TarnGroupTypeApplication = 0,  // class 7
+    TarnGroupTypeSystem = 1,       // class 13
+};
+
+inline constexpr const char* kTarnApplicationGroupsEntitlement = "com.ostrea.security.application-groups";
+inline constexpr const char* kTarnSystemGroupsEntitlement = "com.ostrea.security.system-groups";
+inline constexpr const char* kTarnSystemGroupContainersEntitlement =
+    "com.ostrea.security.system-group-containers";
+inline constexpr const char* kTarnSystemContainerEntitlement = "com.ostrea.security.system-container";
+inline constexpr const char* kTarnSystemGroupPrefix = "systemgroup.";
+
+// A multiset of group identifiers: how many stored entries name each group.
+class TarnCountedSet {
+public:
+    void addObject(const std::string& object) { ++counts_[object]; }
+    // Decreases the count by one; a count of zero removes the object.
+    void removeObject(std::string_view object);
+    size_t countForObject(std::string_view object) const;
+    // Number of distinct objects.
+    size_t count() const { return counts_.size(); }
+    const std::map<std::string, size_t, std::less<>>& counts() const { return counts_; }
+
+private:
+    std::map<std::string, size_t, std::less<>> counts_;
+};
+
+class TarnCodeSigningMapping {
+public:
+    // The one mapping; empty when its store could not be made (a later call
+    // tries again).
+    static TarnCodeSigningMapping* sharedInstance();
+    // Tests: replaces the shared instance (empty: the next call makes a new one).
+    static void TEST_setSharedInstance(std::unique_ptr<TarnCodeSigningMapping> mapping);
+
+    // initWithUserIdentityCache:queue:mappingDB: imports the legacy mapping
+    // file into the store on `queue` before it returns. `userIdentityCache`
+    // may be null until group clean-up needs it.
+    TarnCodeSigningMapping(TarnUserIdentitySharedCache* userIdentityCache, DispatchQueueRef queue,
+                           std::unique_ptr<TarnSQLiteDB> mappingDB);
+    ~TarnCodeSigningMapping();
+    TarnCodeSigningMapping(const TarnCodeSigningMapping&) = delete;
+    TarnCodeSigningMapping& operator=(const TarnCodeSigningMapping&) = delete;
+
+    const DispatchQueueRef& queue() const { return queue_; }
+    // Only to be used on queue().
+    TarnSQLiteDB* codeSigningMappingDB() const { return codeSigningMappingDB_.get(); }
+    TarnUserIdentitySharedCache* userIdentityCache() const { return userIdentityCache_; }
+
+    // ---- reads ----
+
+    // Entitlements for the daemon's own decisions (internal view); empty when none.
+    std::optional<PlistDict> entitlementsForIdentifier(const std::string& identifier);
+    // The code-signing info as a client may see it (external view); empty when none.
+    std::optional<PlistDict> getCodeSigningInfoForIdentifier(const std::string& identifier);
+    // The stored entry; empty with 67 when there is none.
+    TarnCodeSigningEntryRef codeSigningEntryForIdentifier(const std::string& identifier,
+                                                          TarnErrorRef* withError);
+    std::optional<std::vector<std::string>> appGroupIdentifiersForIdentifier(const std::string& identifier);
+    // Only identifiers with the "systemgroup." prefix.
+    std::optional<std::vector<std::string>> systemGroupIdentifiersForIdentifier(const std::string& identifier);
+    bool identifierHasSystemContainer(const std::string& identifier);
+    bool identifierHasCallerRegisteredEntitlements(const std::string& identifier);
+    // 0 when unknown.
+    uint64_t dataContainerTypeForIdentifier(const std::string& identifier);
+    // Empty when the identifier is nobody's child.
+    std::string parentIdentifierForChildIdentifier(const std::string& identifier);
+    std::vector<std::string> childBundleIdentifiersForParentIdentifier(const std::string& identifier);
+    std::set<std::string> identifiersWithError(TarnErrorRef* error);
+    // How many stored entries (invalid, placeholder and advance copies included)
+    // name each group of the type.
+    TarnCountedSet copyReferenceCountSetOfType(TarnGroupType type);
+
+    // ---- changes ----
+
+    bool invalidateCodeSigningInfoForIdentifier(const std::string& identifier, TarnErrorRef* withError);
+    bool invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
+                                                              TarnErrorRef* withError);
+    bool removeAllAdvanceCopiesWithError(TarnErrorRef* error);
+    // A connecting client's own entitlements. Registration (with its group
+    // clean-up) is not done yet: this answers success without storing.
+    uint64_t processCallerRegisteredEntitlements(const PlistDict& entitlements,
+                                                 const std::string& forIdentifier,
+                                                 TarnCommandQueue* commandQueue);
+
+    // ---- helpers on entitlements (no store access) ----
+
+    // The list under `groupKey`: an array of strings as it is, one string as a
+    // one-element list, anything else (or an array holding a non-string) empty.
+    static std::optional<std::vector<std::string>> _copyApplicationGroupEntitlementForIdentifier(
+        const std::string& identifier, const PlistDict* entitlements, const char* groupKey);
+    static std::optional<std::vector<std::string>> _appGroupIdentifiersForIdentifier(
+        const std::string& identifier, const PlistDict* entitlements);
+    static std::optional<std::vector<std::string>> _systemGroupIdentifiersForIdentifier(
+        const std::string& identifier, const PlistDict* entitlements);
+    static bool _entitlementsHasSystemContainer(const PlistDict* entitlements);
+    static const PlistDict* _entitlementsFromCodeSigningEntry(const TarnCodeSigningEntryRef& entry);
+    static const std::optional<PlistDict>& _codeSigningInfoForCodeSigningEntry(
+        const TarnCodeSigningEntryRef& entry, bool externalRequest);
+
+    // ---- on the queue ----
+
+    TarnCodeSigningEntryRef _onQueue_codeSigningEntryForIdentifier(const std::string& identifier,
+                                                                   TarnErrorRef* withError);
+    std::optional<PlistDict> _onQueue_codeSigningInfoForIdentifier(const std::string& identifier,
+                                                                   bool externalRequest);
+    std::optional<PlistDict> _onQueue_entitlementsForIdentifier(const std::string& identifier);
+    uint64_t _onQueue_dataContainerTypeForIdentifier(const std::string& identifier);
+    bool _onQueue_identifierHasCallerRegisteredEntitlements(const std::string& identifier);
+    std::string _onQueue_parentIdentifierForChildIdentifier(const std::string& identifier);
+    std::vector<std::string> _onQueue_childBundleIdentifiersForParentIdentifier(const std::string& identifier);
+    std::set<std::string> _onQueue_identifiersWithError(TarnErrorRef* error);
+    bool _onQueue_invalidateCodeSigningInfoForIdentifier(const std::string& identifier, TarnErrorRef* error);
+    bool _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
+                                                                       TarnErrorRef* error);
+    bool _onQueue_removeAllAdvanceCopiesWithError(TarnErrorRef* error);
+    TarnCountedSet _onQueue_copyReferenceCountSetOfType(TarnGroupType type);
+    // Calls `block` with every stored identifier and the group value under
+    // `key` (or `fallBackKey` when that gives nothing or an empty list).
+    using GroupIdsBlock = std::function<void(const std::string& identifier, const PlistValue* groupIds)>;
+    void _onQueue_iterateGroupIdsWithKey(const char* key, const char* fallBackKey,
+                                         const GroupIdsBlock& forAllIdentifiersUsingBlock);
+    // Writes each entry under its identifier, deleting where the entry has no
+    // info; a read failure ends the batch. 60 when the counts differ.
+    uint64_t _onQueue_setCodeSigningDictionaryValues(const std::vector<TarnCodeSigningEntryRef>& values,
+                                                     const std::vector<std::string>& forIdentifiers);
+    // Imports "tarn_code_signing_info.plist" from the library directory.
+    void _onQueue_migrateFromMappingFileToDBIfNecessary();
+    // The legacy mapping file: identifier -> serialised entry. Empty with the
+    // error when it cannot be read; a missing file is a POSIX ENOENT error.
+    static std::optional<PlistDict> _readCodeSigningMappingFromDiskAtURL(const FileURL& url,
+                                                                         TarnErrorRef* error);
+
+private:
+    // Runs `work` synchronously on the queue; must be called off it.
+    void runOnQueue(const std::function<void()>& work);
+    void assertOnQueue() const;
+
+    // Constant after construction.
+    TarnUserIdentitySharedCache* const userIdentityCache_;
+    const DispatchQueueRef queue_;
+    // Used on queue_ only.
+    const std::unique_ptr<TarnSQLiteDB> codeSigningMappingDB_;
+};
+
+// Command 19: answers "ReplyInfoDictionary" with the external view of the
+// identifier's code-signing info, or fails with 21 when there is none.
+void TarnHandleGetCodeSigningInfoCommand(const PlistValue& request, PlistValue& reply,
+                                         TarnClientConnection* connection, uint64_t* error);
+
+}  // namespace tarn

@@ -1,0 +1,276 @@
+// The read side of the code-signing mapping: views, group lists from
+// entitlements, parent/child look-ups, invalidation, reference counts, the
+// legacy mapping-file import and command 19.
+#include "Daemon/TarnCodeSigningMapping.h"
+
+#include <filesystem>
+
+#include "Daemon/TarnSQLiteDB.h"
+#include "Platform/PlatformLog.h"
+#include "support/ScratchRoot.h"
+
+namespace tarn {
+namespace {
+
+constexpr const char* kLibrary = "/private/var/root/Library/TarnKeeper";
+
+TarnCodeSigningEntryRef entryWith(PlistDict entitlements, uint64_t dataClass = 2,
+                                  std::function<void(TarnCodeSigningEntry&)> adjust = nullptr) {
+    auto e = std::make_shared<TarnCodeSigningEntry>(PlistDict{{kTarnEntitlementsKey, std::move(entitlements)}},
+                                                    dataClass);
+    if (adjust) adjust(*e);
+    return e;
+}
+
+class TarnCodeSigningMappingTest : public test::ScratchRootTest {
+protected:
+    void SetUp() override {
+        PlatformLogSetQuiet(true);
+        root_.mkdirs(kLibrary);
+    }
+    void TearDown() override { TarnCodeSigningMapping::TEST_setSharedInstance(nullptr); }
+
+    std::unique_ptr<TarnCodeSigningMapping> makeMapping() {
+        return std::make_unique<TarnCodeSigningMapping>(
+            nullptr, DispatchQueue::createSerial("com.ostrea.TarnKeeper.EntitlementQueue"),
+            TarnSQLiteDB::initWithParentDirectoryURL(root_.at(kLibrary)));
+    }
+
+    TarnCodeSigningMapping& mapping() {
+        if (!mapping_) mapping_ = makeMapping();
+        return *mapping_;
+    }
+
+    void store(const std::string& id, const TarnCodeSigningEntryRef& entry) {
+        bool ok = false;
+        TarnErrorRef e;
+        mapping().queue()->sync([&] { ok = mapping().codeSigningMappingDB()->addCodeSigningEntry(entry, id, &e); });
+        ASSERT_TRUE(ok) << (e ? e->description() : "");
+    }
+
+    std::unique_ptr<TarnCodeSigningMapping> mapping_;
+};
+
+TEST_F(TarnCodeSigningMappingTest, ExternalViewHidesUncommittedAndInvalidEntries) {
+    PlistDict ents{{"com.ostrea.security.system-container", true}};
+    store("com.valid", entryWith(ents));
+    store("com.placeholder", entryWith(ents, 2, [](auto& e) { e.setPlaceholder(true); }));
+    store("com.advance", entryWith(ents, 2, [](auto& e) { e.setAdvanceCopy(true); }));
+    store("com.invalid", entryWith(ents, 2, [](auto& e) { e.setInvalid(true); }));
+
+    EXPECT_EQ(mapping().getCodeSigningInfoForIdentifier("com.valid"), (PlistDict{{kTarnEntitlementsKey, ents}}));
+    for (const char* id : {"com.placeholder", "com.advance", "com.invalid"}) {
+        EXPECT_FALSE(mapping().getCodeSigningInfoForIdentifier(id)) << id;
+        EXPECT_EQ(mapping().entitlementsForIdentifier(id), ents) << id;
+        EXPECT_TRUE(mapping().identifierHasSystemContainer(id)) << id;
+    }
+    EXPECT_FALSE(mapping().getCodeSigningInfoForIdentifier("com.unknown"));
+    EXPECT_FALSE(mapping().entitlementsForIdentifier("com.unknown"));
+    EXPECT_FALSE(mapping().getCodeSigningInfoForIdentifier(""));
+}
+
+TEST_F(TarnCodeSigningMappingTest, GroupListsFromEntitlements) {
+    using Ids = std::optional<std::vector<std::string>>;
+    store("com.single", entryWith({{"com.ostrea.security.application-groups", "group.one"},
+                                   {"com.ostrea.security.system-groups", "systemgroup.one"}}));
+    store("com.mixed", entryWith({{"com.ostrea.security.application-groups", PlistArray{"group.a", uint64_t{1}}},
+                                  {"com.ostrea.security.system-groups", PlistArray{"systemgroup.a", true}}}));
+    store("com.list", entryWith({{"com.ostrea.security.application-groups", PlistArray{"group.b", "group.a", "group.b"}},
+                                 {"com.ostrea.security.system-groups",
+                                  PlistArray{"systemgroup.x", "group.nope", "systemgroup.y"}},
+                                 {"com.ostrea.security.system-group-containers", PlistArray{"systemgroup.old"}}}));
+    store("com.fallback-empty", entryWith({{"com.ostrea.security.system-groups", PlistArray{}},
+                                           {"com.ostrea.security.system-group-containers", "systemgroup.old"}}));
+    store("com.fallback-absent", entryWith({{"com.ostrea.security.system-group-containers",
+                                             PlistArray{"systemgroup.old", "nope"}}}));
+    store("com.wrongtype", entryWith({{"com.ostrea.security.application-groups", PlistDict{}}}));
+
+    EXPECT_EQ(mapping().appGroupIdentifiersForIdentifier("com.single"), Ids({"group.one"}));
+    EXPECT_EQ(mapping().systemGroupIdentifiersForIdentifier("com.single"), Ids({"systemgroup.one"}));
+    // One non-string spoils the whole list.
+    EXPECT_EQ(mapping().appGroupIdentifiersForIdentifier("com.mixed"), std::nullopt);
+    // A rejected primary list falls back; with no fallback key the answer is nothing.
+    EXPECT_EQ(mapping().systemGroupIdentifiersForIdentifier("com.mixed"), std::nullopt);
+    // Order and duplicates are kept; the prefix filter drops the stranger; the
+    // fallback is not read when the primary has entries.
+    EXPECT_EQ(mapping().appGroupIdentifiersForIdentifier("com.list"), Ids({"group.b", "group.a", "group.b"}));
+    EXPECT_EQ(mapping().systemGroupIdentifiersForIdentifier("com.list"), Ids({"systemgroup.x", "systemgroup.y"}));
+    EXPECT_EQ(mapping().systemGroupIdentifiersForIdentifier("com.fallback-empty"), Ids({"systemgroup.old"}));
+    EXPECT_EQ(mapping().systemGroupIdentifiersForIdentifier("com.fallback-absent"), Ids({"systemgroup.old"}));
+    EXPECT_EQ(mapping().appGroupIdentifiersForIdentifier("com.wrongtype"), std::nullopt);
+    EXPECT_EQ(mapping().appGroupIdentifiersForIdentifier("com.unknown"), std::nullopt);
+}
+
+TEST_F(TarnCodeSigningMappingTest, FlagsClassParentsAndChildren) {
+    store("com.app", entryWith({{"com.ostrea.security.system-container", false}}, 2, [](auto& e) {
+              e.setChildBundleIdentifiers({"com.app.ext1", "com.app.ext2"});
+              e.setRegisteredByCaller(true);
+          }));
+    store("com.app.ext1", entryWith({{"com.ostrea.security.system-container", uint64_t{1}}}, 4));
+    EXPECT_FALSE(mapping().identifierHasSystemContainer("com.app"));
+    EXPECT_TRUE(mapping().identifierHasSystemContainer("com.app.ext1"));
+    EXPECT_FALSE(mapping().identifierHasSystemContainer("com.unknown"));
+    EXPECT_TRUE(mapping().identifierHasCallerRegisteredEntitlements("com.app"));
+    EXPECT_FALSE(mapping().identifierHasCallerRegisteredEntitlements("com.app.ext1"));
+    EXPECT_EQ(mapping().dataContainerTypeForIdentifier("com.app.ext1"), 4u);
+    EXPECT_EQ(mapping().dataContainerTypeForIdentifier("com.unknown"), 0u);
+    EXPECT_EQ(mapping().parentIdentifierForChildIdentifier("com.app.ext2"), "com.app");
+    EXPECT_EQ(mapping().parentIdentifierForChildIdentifier("com.app"), "");
+    EXPECT_EQ(mapping().childBundleIdentifiersForParentIdentifier("com.app"),
+              (std::vector<std::string>{"com.app.ext1", "com.app.ext2"}));
+    EXPECT_TRUE(mapping().childBundleIdentifiersForParentIdentifier("com.app.ext1").empty());
+
+    TarnErrorRef e;
+    EXPECT_EQ(mapping().identifiersWithError(&e), (std::set<std::string>{"com.app", "com.app.ext1"}));
+    EXPECT_FALSE(mapping().codeSigningEntryForIdentifier("com.unknown", &e));
+    ASSERT_TRUE(e);
+    EXPECT_EQ(e->code(), TarnErrorDatabaseNotFound);
+}
+
+TEST_F(TarnCodeSigningMappingTest, InvalidationAndAdvanceCopies) {
+    store("com.p", entryWith({}, 2, [](auto& e) { e.setChildBundleIdentifiers({"com.p.kid"}); }));
+    store("com.p.kid", entryWith({}, 4));
+    store("com.q", entryWith({}, 2, [](auto& e) { e.setChildBundleIdentifiers({"com.q.kid"}); }));
+    store("com.q.kid", entryWith({}, 4));
+    store("com.adv", entryWith({}, 2, [](auto& e) { e.setAdvanceCopy(true); }));
+
+    TarnErrorRef e;
+    ASSERT_TRUE(mapping().invalidateCodeSigningInfoForIdentifier("com.q", &e));
+    EXPECT_TRUE(mapping().codeSigningEntryForIdentifier("com.q", &e)->invalid());
+    EXPECT_FALSE(mapping().codeSigningEntryForIdentifier("com.q.kid", &e)->invalid());
+    ASSERT_TRUE(mapping().invalidateCodeSigningInfoForIdentifierAndItsChildren("com.p", &e));
+    EXPECT_TRUE(mapping().codeSigningEntryForIdentifier("com.p", &e)->invalid());
+    EXPECT_TRUE(mapping().codeSigningEntryForIdentifier("com.p.kid", &e)->invalid());
+    EXPECT_TRUE(mapping().invalidateCodeSigningInfoForIdentifier("com.unknown", &e));
+
+    ASSERT_TRUE(mapping().removeAllAdvanceCopiesWithError(&e));
+    EXPECT_EQ(mapping().identifiersWithError(&e).count("com.adv"), 0u);
+    EXPECT_EQ(mapping().identifiersWithError(&e).size(), 4u);
+}
+
+TEST_F(TarnCodeSigningMappingTest, ReferenceCountsCoverEveryStoredEntry) {
+    store("com.a", entryWith({{"com.ostrea.security.application-groups", PlistArray{"g.shared", "g.a", "g.a"}}}));
+    store("com.b", entryWith({{"com.ostrea.security.application-groups", "g.shared"}}, 2,
+                             [](auto& e) { e.setInvalid(true); }));
+    store("com.c", entryWith({{"com.ostrea.security.application-groups", PlistArray{"g.shared"}},
+                              {"com.ostrea.security.system-groups", PlistArray{"systemgroup.s", "unprefixed"}}},
+                             2, [](auto& e) { e.setPlaceholder(true); }));
+    store("com.d", entryWith({{"com.ostrea.security.application-groups", PlistArray{"g.never", uint64_t{2}}},
+                              {"com.ostrea.security.system-groups", PlistArray{}},
+                              {"com.ostrea.security.system-group-containers", "systemgroup.s"}}));
+    store("com.e", entryWith({{"com.ostrea.security.application-groups", PlistDict{{"x", "y"}}}}));
+
+    TarnCountedSet app = mapping().copyReferenceCountSetOfType(TarnGroupTypeApplication);
+    EXPECT_EQ(app.countForObject("g.shared"), 3u);
+    EXPECT_EQ(app.countForObject("g.a"), 2u);
+    EXPECT_EQ(app.countForObject("g.never"), 0u);
+    EXPECT_EQ(app.count(), 2u);
+
+    TarnCountedSet system = mapping().copyReferenceCountSetOfType(TarnGroupTypeSystem);
+    EXPECT_EQ(system.countForObject("systemgroup.s"), 2u);
+    // Counting does not filter by prefix.
+    EXPECT_EQ(system.countForObject("unprefixed"), 1u);
+
+    app.removeObject("g.a");
+    EXPECT_EQ(app.countForObject("g.a"), 1u);
+    app.removeObject("g.a");
+    app.removeObject("g.a");
+    EXPECT_EQ(app.countForObject("g.a"), 0u);
+    EXPECT_EQ(app.count(), 1u);
+}
+
+TEST_F(TarnCodeSigningMappingTest, LegacyMappingFileIsImportedOnce) {
+    // Missing file: nothing happens.
+    mapping_ = makeMapping();
+    TarnErrorRef e;
+    EXPECT_TRUE(mapping().identifiersWithError(&e).empty());
+    mapping_.reset();
+
+    const std::string file = std::string(kLibrary) + "/tarn_code_signing_info.plist";
+    TarnCodeSigningEntry good(PlistDict{{kTarnEntitlementsKey, PlistDict{{"k", "v"}}}}, 2);
+    good.setChildBundleIdentifiers({"com.good.kid"});
+    good.setRegisteredByCaller(true);
+    PlistDict legacy{
+        {"com.good", good.serialize()},
+        {"com.noinfo", PlistDict{{"Invalid", true}}},  // nothing to store: refused
+        {"com.junk", "not a dictionary"},
+    };
+    root_.writeFile(file, [&] {
+        auto bytes = PlistValue(legacy).toBinary();
+        return std::string(bytes.begin(), bytes.end());
+    }());
+    mapping_ = makeMapping();
+    TarnCodeSigningEntryRef back = mapping().codeSigningEntryForIdentifier("com.good", &e);
+    ASSERT_TRUE(back);
+    EXPECT_EQ(*back, good);
+    EXPECT_EQ(mapping().identifiersWithError(&e), std::set<std::string>{"com.good"});
+    EXPECT_FALSE(std::filesystem::exists(root_.at(file)));
+    mapping_.reset();
+
+    // A file none of whose entries could be stored stays for the next start.
+    root_.writeFile(file, [] {
+        auto bytes = PlistValue(PlistDict{{"com.junk", "x"}}).toBinary();
+        return std::string(bytes.begin(), bytes.end());
+    }());
+    mapping_ = makeMapping();
+    EXPECT_TRUE(std::filesystem::exists(root_.at(file)));
+    mapping_.reset();
+
+    // An unreadable file is left alone and does not stop the mapping.
+    root_.writeFile(file, "garbage");
+    mapping_ = makeMapping();
+    EXPECT_TRUE(std::filesystem::exists(root_.at(file)));
+    EXPECT_TRUE(mapping().codeSigningEntryForIdentifier("com.good", &e));
+}
+
+TEST_F(TarnCodeSigningMappingTest, GetCodeSigningInfoCommand) {
+    PlistDict info{{kTarnEntitlementsKey, PlistDict{{"k", "v"}}}, {"Extra", uint64_t{1}}};
+    store("com.app", std::make_shared<TarnCodeSigningEntry>(info, 2));
+    store("com.placeholder", entryWith({}, 2, [](auto& e) { e.setPlaceholder(true); }));
+    TarnCodeSigningMapping::TEST_setSharedInstance(std::move(mapping_));
+
+    struct Case {
+        PlistValue request;
+        uint64_t code;
+    };
+    const Case cases[] = {
+        {PlistDict{{"Identifier", "com.app"}}, TarnSuccess},
+        {PlistDict{{"Identifier", "com.placeholder"}}, TarnErrorNotFound},
+        {PlistDict{{"Identifier", "com.unknown"}}, TarnErrorNotFound},
+        {PlistDict{{"Identifier", uint64_t{7}}}, TarnErrorNotFound},
+        {PlistDict{}, TarnErrorNotFound},
+    };
+    for (const Case& c : cases) {
+        PlistValue reply{PlistDict{}};
+        uint64_t error = TarnSuccess;
+        TarnHandleGetCodeSigningInfoCommand(c.request, reply, nullptr, &error);
+        EXPECT_EQ(error, c.code) << c.request.description();
+        if (c.code == TarnSuccess) {
+            ASSERT_TRUE(reply.find("ReplyInfoDictionary"));
+            EXPECT_EQ(*reply.find("ReplyInfoDictionary"), PlistValue(info));
+        } else {
+            EXPECT_FALSE(reply.find("ReplyInfoDictionary"));
+        }
+    }
+}
+
+TEST_F(TarnCodeSigningMappingTest, BatchWriteDeletesStoresAndChecksCounts) {
+    store("com.gone", entryWith({}));
+    auto kept = entryWith({{"k", "v"}});
+    uint64_t code = 0;
+    mapping().queue()->sync([&] {
+        code = mapping()._onQueue_setCodeSigningDictionaryValues({kept}, {"com.a", "com.b"});
+    });
+    EXPECT_EQ(code, TarnErrorMismatchedInput);
+    mapping().queue()->sync([&] {
+        code = mapping()._onQueue_setCodeSigningDictionaryValues(
+            {std::make_shared<TarnCodeSigningEntry>(), kept, std::make_shared<TarnCodeSigningEntry>()},
+            {"com.gone", "com.kept", "com.never"});
+    });
+    EXPECT_EQ(code, TarnSuccess);
+    TarnErrorRef e;
+    EXPECT_EQ(mapping().identifiersWithError(&e), std::set<std::string>{"com.kept"});
+}
+
+}  // namespace
+}  // namespace tarn
