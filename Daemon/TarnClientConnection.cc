@@ -2,7 +2,15 @@
 
 #include <mutex>
 
+#include "Daemon/TarnCodeSigningMapping.h"
+#include "Daemon/TarnDaemon.h"
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnFileManager.h"
+#include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnLog.h"
+#include "Daemon/TarnUserIdentityCache.h"
+#include "Daemon/TarnWhitelist.h"
+#include "Platform/RootPrefix.h"
 
 namespace tarn {
 
@@ -18,7 +26,8 @@ TarnClientConnection::TarnClientConnection(TarnClientIdentityRef clientIdentity,
       lookup_(std::move(lookup)),
       entitledWipeIdentifiers_(std::move(entitledWipeIdentifiers)),
       commandQueue_(std::move(commandQueue)),
-      backgroundQueue_(_sharedBackgroundQueue()) {}
+      backgroundQueue_(_sharedBackgroundQueue()),
+      userIdentityCache_(TarnUserIdentitySharedCache::sharedInstance()) {}
 
 TarnClientConnection::TarnClientConnection()
     : TarnClientConnection(TarnClientIdentity::anonymousPrivilegedClientIdentity(), true, false,
@@ -40,6 +49,199 @@ std::shared_ptr<TarnClientConnection> TarnClientConnection::privilegedClientConn
     return std::make_shared<TarnClientConnection>(
         TarnClientIdentity::privilegedClientIdentityWithUserIdentity(std::move(userIdentity), kernel),
         true, true, true, std::nullopt, std::nullopt, std::make_shared<TarnCommandQueue>());
+}
+
+// ---- Lookup rules ----
+
+namespace {
+
+// Keys of the lookup entitlement, by class number.
+const char* lookupKeyForContainerClass(TarnContainerClass containerClass) {
+    static const char* const kKeys[] = {nullptr,     "app",        "appData",        "plugin",
+                                        "pluginData", "vpn",       "vpnData",        "appGroup",
+                                        "framework", "conduitService", "daemon",     "tempDir",
+                                        "systemData", "systemGroup"};
+    return containerClass < std::size(kKeys) ? kKeys[containerClass] : nullptr;
+}
+
+}  // namespace
+
+std::set<std::string> TarnClientConnection::_setOfStringsFromArray(const PlistArray& array) {
+    std::set<std::string> strings;
+    for (const PlistValue& v : array)
+        if (const std::string* s = v.asString()) strings.insert(*s);
+    return strings;
+}
+
+const PlistValue* TarnClientConnection::lookupValueForKey(const std::string& key) const {
+    return lookup_ ? lookup_->find(key) : nullptr;
+}
+
+TarnLookupSet TarnClientConnection::_lookupForContainerClass(TarnContainerClass containerClass) {
+    const char* key = lookupKeyForContainerClass(containerClass);
+    if (!key) return nullptr;
+    {
+        MutexLock lock(lock_);
+        if (!lookup_) return nullptr;
+        sanitizedLookupCreated_ = true;
+    }
+    MutexLock lock(sanitizedLookupLock_);
+    auto it = sanitizedLookup_.find(key);
+    if (it != sanitizedLookup_.end()) return it->second;
+    const PlistValue* value = lookupValueForKey(key);
+    const PlistArray* array = value ? value->asArray() : nullptr;
+    auto granted = std::make_shared<const std::set<std::string>>(
+        array ? _setOfStringsFromArray(*array) : std::set<std::string>());
+    sanitizedLookup_.emplace(key, granted);
+    return granted;
+}
+
+bool TarnClientConnection::isEntitledForLookupWithClass(TarnContainerClass containerClass,
+                                                        const std::string& identifier) {
+    TarnLookupSet granted = _lookupForContainerClass(containerClass);
+    return granted && granted->count(identifier) > 0;
+}
+
+bool TarnClientConnection::_lookupRuleCommon(TarnContainerClass containerClass,
+                                             const std::string& identifier, bool withGroupRule) {
+    const std::string bundleIdentifier = clientBundleIdentifier();
+    if (identifier == bundleIdentifier) return true;
+    if (allowOtherIdLookup_) return true;
+    if (withGroupRule && TarnContainerClassIsGroup(containerClass) && allowGroupIdLookup_) return true;
+    if (unrestricted_) return true;
+    if (isEntitledForLookupWithClass(containerClass, identifier)) return true;
+    return TarnWhitelist::sharedWhitelist().isLookupWhitelistedFromCodeSignIdentifier(
+        bundleIdentifier, containerClass, identifier);
+}
+
+bool TarnClientConnection::_passesLookupRuleForContainerClass(TarnContainerClass containerClass,
+                                                              const std::string& identifier,
+                                                              TarnErrorRef* error) {
+    if (_lookupRuleCommon(containerClass, identifier, true)) return true;
+    if (error)
+        *error = TARN_ERROR(TarnErrorNotEntitled, nullptr,
+                            "%@ not entitled to retrieve container class %ld with identifier %@",
+                            clientBundleIdentifier(), static_cast<int64_t>(containerClass), identifier);
+    return false;
+}
+
+bool TarnClientConnection::_passesSystemDataGateForContainerClass(TarnContainerClass containerClass,
+                                                                  const std::string& identifier,
+                                                                  TarnErrorRef* error) {
+    if (allowOtherIdLookup_ || containerClass != TarnContainerClassSystemData || unrestricted_ ||
+        isEntitledForLookupWithClass(TarnContainerClassSystemData, identifier))
+        return true;
+    const std::string bundleIdentifier = clientBundleIdentifier();
+    if (TarnWhitelist::sharedWhitelist().isLookupWhitelistedFromCodeSignIdentifier(
+            bundleIdentifier, TarnContainerClassSystemData, identifier))
+        return true;
+    // Only a client whose signature asks for a system container gets its own.
+    TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance();
+    if (mapping && identifier == bundleIdentifier && mapping->identifierHasSystemContainer(identifier))
+        return true;
+    if (error)
+        *error = TARN_ERROR(TarnErrorNotEntitled, nullptr,
+                            "%@ not entitled for system container with identifier %@",
+                            bundleIdentifier, identifier);
+    return false;
+}
+
+bool TarnClientConnection::_passesGroupOwnerRuleForContainerClass(TarnContainerClass groupContainerClass,
+                                                                  const std::string& ownerIdentifier,
+                                                                  TarnErrorRef* error) {
+    if (_lookupRuleCommon(groupContainerClass, ownerIdentifier, false)) return true;
+    if (error)
+        *error = TARN_ERROR(TarnErrorNotEntitled, nullptr,
+                            "%@ not entitled to retrieve group container class %ld with identifier %@",
+                            clientBundleIdentifier(), static_cast<int64_t>(groupContainerClass),
+                            ownerIdentifier);
+    return false;
+}
+
+// ---- Death row ----
+
+bool TarnClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, bool isDir,
+                                                    bool startDeletionThread, TarnErrorRef* error) {
+    auto& fm = TarnFileManager::defaultManager();
+    TarnErrorRef underlying;
+    // A directory of its own keeps two items of the same name from colliding.
+    auto unique = fm.createTemporaryDirectoryInDirectoryURL(
+        TarnGlobalConfiguration::sharedInstance().deathrowDirectory(), &underlying);
+    if (!unique) {
+        if (error)
+            *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, underlying,
+                                "Failed to create unique directory at: %@", url);
+        return false;
+    }
+    const FileURL destination = PathJoin(*unique, PathLastComponent(url));
+    if (!fm.moveItemAtURL(url, destination, &underlying)) {
+        if (underlying && underlying->posixCode() == ENOENT) {
+            // Already gone; the empty directory goes with the next pass.
+            return true;
+        }
+        if (error)
+            *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, underlying,
+                                "Failed to move item at: %@ to: %@", url, destination);
+        return false;
+    }
+    if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
+    return true;
+}
+
+void TarnClientConnection::deleteContainersOnDeathRowWithCompletion(
+    std::function<void(uint64_t)> completion) {
+    // The pass owns nothing of the connection, which may be gone when it runs.
+    transactionAsync(TarnDeathRowQueue(), [completion = std::move(completion)] {
+        const FileURL deathRow = TarnGlobalConfiguration::sharedInstance().deathrowDirectory();
+        TarnErrorRef listError;
+        auto items = TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow, &listError);
+        uint64_t result = TarnSuccess;
+        if (!items) {
+            if (!(listError && listError->posixCode() == ENOENT)) {
+                TarnErrorRef e = TARN_ERROR(TarnErrorDeleteFailed, listError,
+                                            "Failed to get items for deletion: %@ : %@", deathRow,
+                                            listError);
+                result = e->code();
+            }
+        } else {
+            for (const FileURL& item : *items) {
+                TarnErrorRef removeError;
+                if (!_removeItemOrMoveToTempAtURL(item, &removeError)) {
+                    TarnErrorRef e = TARN_ERROR(TarnErrorDestroyFailed, removeError,
+                                                "Failed to destroy item at: %@", item);
+                    result = e->code();
+                }
+            }
+        }
+        if (completion) completion(result);
+    });
+}
+
+bool TarnClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& url, TarnErrorRef* error) {
+    auto& fm = TarnFileManager::defaultManager();
+    TarnErrorRef removeError;
+    if (fm.removeItemAtURL(url, &removeError) || (removeError && removeError->posixCode() == ENOENT))
+        return true;
+    TarnLog(kLogDebug, __func__, "Couldn't remove, so moving item to /tmp: %@ : %@", url, removeError);
+
+    const FileURL tmp = RootPath("/tmp");
+    TarnErrorRef moveError;
+    if (fm.itemDoesNotExistAtURL(tmp))
+        (void)fm.createDirectoryAtURL(tmp, true, 01777, &moveError);  // the move reports any failure
+    FileURL destination = PathJoin(tmp, PathLastComponent(url));
+    // Never replace something already in /tmp: a taken name goes into a fresh directory.
+    if (!fm.itemDoesNotExistAtURL(destination)) {
+        auto unique = fm.createTemporaryDirectoryInDirectoryURL(tmp, "tarnkeeperd.", &moveError);
+        if (unique) destination = PathJoin(*unique, PathLastComponent(url));
+    }
+    if (!fm.moveItemAtURL(url, destination, &moveError)) {
+        if (moveError && moveError->posixCode() == ENOENT) return true;
+        if (error)
+            *error = TARN_ERROR(TarnErrorMoveFailed, moveError, "Failed to move dir: %@ to: %@", url,
+                                "/tmp");
+        return false;
+    }
+    return true;
 }
 
 TarnClientConnection& TarnClientConnection::sharedClientConnection() {

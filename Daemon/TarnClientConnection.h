@@ -1,7 +1,20 @@
 // The object through which every container operation is carried out, for one
 // request (or, privileged, for the daemon's own work). It carries the caller's
-// rights and its command queue; it holds no container state of its own.
-// Used from request threads; several connections run at once.
+// rights, its command queue and a per-connection cache of its lookup
+// entitlement; it holds no container state of its own.
+//
+// Used from request threads; several connections run at once. One connection
+// is used by one handler at a time, except the lookup-entitlement cache,
+// which is safe across threads (two locks: lock_ first, then
+// sanitizedLookupLock_, never both at once).
+//
+// Death row: whatever is to go is renamed into a unique directory inside the
+// death-row directory (one rename, same volume) and destroyed later by a
+// deletion pass on the serial death-row queue (TarnDeathRowQueue()). Passes
+// run one after another, each listing death row afresh, under a process
+// transaction. An item that cannot be removed is moved out of the way into
+// the temporary directory under the root prefix. ENOENT counts as success
+// wherever the aim is that an item be gone.
 #pragma once
 
 #include <cstdint>
@@ -14,11 +27,19 @@
 
 #include "Daemon/TarnClientIdentity.h"
 #include "Daemon/TarnCommandQueue.h"
+#include "Daemon/TarnContainerClass.h"
+#include "Daemon/TarnError.h"
+#include "Platform/Path.h"
 #include "Platform/Dispatch.h"
 #include "Platform/PropertyList.h"
 #include "Platform/ThreadAnnotations.h"
 
 namespace tarn {
+
+class TarnUserIdentitySharedCache;
+
+// What the lookup entitlement grants for one class.
+using TarnLookupSet = std::shared_ptr<const std::set<std::string>>;
 
 class TarnClientConnection {
 public:
@@ -35,23 +56,71 @@ public:
         bool unrestricted, std::optional<PlistValue> lookup,
         std::optional<PlistValue> entitledWipeIdentifiers,
         std::shared_ptr<TarnCommandQueue> commandQueue);
+    // Privileged connections pass every lookup rule. `kernel`: made for the
+    // kernel upcall service.
     static std::shared_ptr<TarnClientConnection> privilegedClientConnectionWithUserIdentity(
         std::shared_ptr<const TarnUserIdentity> userIdentity, bool kernel = false);
+    // One process-wide anonymous privileged connection (boot work, data protection).
     static TarnClientConnection& sharedClientConnection();
 
     const TarnClientIdentityRef& clientIdentity() const { return clientIdentity_; }
+    // The client identity's bundle identifier (not the stored field).
     std::string clientBundleIdentifier() const;
+    void setClientBundleIdentifier(std::string clientBundleIdentifier) {
+        clientBundleIdentifier_ = std::move(clientBundleIdentifier);
+    }
     bool entitled() const { return entitled_; }
     bool allowOtherIdLookup() const { return allowOtherIdLookup_; }
     bool allowGroupIdLookup() const { return allowGroupIdLookup_; }
     bool unrestricted() const { return unrestricted_; }
+    void setEntitled(bool value) { entitled_ = value; }
+    void setAllowOtherIdLookup(bool value) { allowOtherIdLookup_ = value; }
     void setUnrestricted(bool value) { unrestricted_ = value; }
+    // Only ever set to true (by the group lookup of an owner).
     void setAllowGroupIdLookup(bool value) { allowGroupIdLookup_ = value; }
     const std::shared_ptr<TarnCommandQueue>& commandQueue() const { return commandQueue_; }
     const std::optional<PlistValue>& lookup() const { return lookup_; }
     const std::optional<PlistValue>& entitledWipeIdentifiers() const {
         return entitledWipeIdentifiers_;
     }
+    TarnUserIdentitySharedCache& userIdentityCache() const { return userIdentityCache_; }
+
+    // ---- Lookup rules ----
+
+    // The identifiers the lookup entitlement grants for the class; nullptr
+    // when there is no entitlement or the class has no key (0, 14 and up).
+    // A value that is not an array grants nothing (an empty set).
+    TarnLookupSet _lookupForContainerClass(TarnContainerClass containerClass);
+    bool isEntitledForLookupWithClass(TarnContainerClass containerClass, const std::string& identifier);
+    // The string members of the array; others are dropped.
+    static std::set<std::string> _setOfStringsFromArray(const PlistArray& array);
+
+    // Whether the caller may look up (and create) a container of the class
+    // with the identifier; on refusal error 55 in *error.
+    bool _passesLookupRuleForContainerClass(TarnContainerClass containerClass,
+                                            const std::string& identifier, TarnErrorRef* error);
+    // The second gate of system data containers (class 12); other classes pass.
+    bool _passesSystemDataGateForContainerClass(TarnContainerClass containerClass,
+                                                const std::string& identifier, TarnErrorRef* error);
+    // Whether the caller may list the groups of `ownerIdentifier`.
+    bool _passesGroupOwnerRuleForContainerClass(TarnContainerClass groupContainerClass,
+                                                const std::string& ownerIdentifier,
+                                                TarnErrorRef* error);
+
+    // ---- Death row ----
+
+    // Renames the item into a new unique directory on death row; a missing
+    // item succeeds without starting a pass. Errors: 41.
+    bool _moveItemAtURLToDeathRow(const FileURL& url, bool isDir, bool startDeletionThread,
+                                  TarnErrorRef* error);
+    // Queues a deletion pass and returns at once; `completion` (may be empty)
+    // gets 1, or the code of the pass's last failure (17 or 28), on the
+    // death-row queue.
+    void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
+    // Removes the item or, failing that, moves it into the temporary
+    // directory under the root prefix (into a fresh unique directory there
+    // when its name is taken). Errors: 4.
+    static bool _removeItemOrMoveToTempAtURL(const FileURL& url, TarnErrorRef* error);
 
     // Runs the command queue until it is exhausted or a command fails.
     bool completeWithError(uint64_t* error);
@@ -65,6 +134,13 @@ public:
     static DispatchQueueRef _sharedBackgroundQueue();
 
 private:
+    // The lookup entitlement's value for a class key, or nullptr.
+    const PlistValue* lookupValueForKey(const std::string& key) const;
+    bool _lookupRuleCommon(TarnContainerClass containerClass, const std::string& identifier,
+                           bool withGroupRule);
+
+    // Read-only after construction, except the rights a handler adjusts
+    // (booleans, client bundle identifier) on the request's own thread.
     TarnClientIdentityRef clientIdentity_;
     bool entitled_;
     bool allowOtherIdLookup_;
@@ -74,6 +150,15 @@ private:
     std::optional<PlistValue> entitledWipeIdentifiers_;
     std::shared_ptr<TarnCommandQueue> commandQueue_;
     DispatchQueueRef backgroundQueue_;
+    TarnUserIdentitySharedCache& userIdentityCache_;
+    std::string clientBundleIdentifier_;
+
+    // The lookup-entitlement cache: created under lock_, filled under
+    // sanitizedLookupLock_.
+    Mutex lock_;
+    Mutex sanitizedLookupLock_;
+    bool sanitizedLookupCreated_ GUARDED_BY(lock_) = false;
+    std::map<std::string, TarnLookupSet> sanitizedLookup_ GUARDED_BY(sanitizedLookupLock_);
 };
 
 }  // namespace tarn
