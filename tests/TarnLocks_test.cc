@@ -6,7 +6,6 @@
 #include <chrono>
 #include <functional>
 #include <future>
-#include <map>
 #include <random>
 #include <set>
 #include <thread>
@@ -56,20 +55,9 @@ class Holder {
     std::future<void> acquiredFuture_;
 };
 
-enum class Kind { IdRead, IdWrite, GlobalRead, GlobalWrite };
-const char* Name(Kind kind) {
-    switch (kind) {
-        case Kind::IdRead:
-            return "identifier read";
-        case Kind::IdWrite:
-            return "identifier write";
-        case Kind::GlobalRead:
-            return "global read";
-        case Kind::GlobalWrite:
-            return "global write";
-    }
-    return "?";
-}
+enum Kind { IdRead, IdWrite, GlobalRead, GlobalWrite };
+const char* const kKindNames[] = {"identifier read", "identifier write", "global read",
+                                  "global write"};
 
 class TarnLocksTest : public ::testing::Test {
   protected:
@@ -82,24 +70,17 @@ class TarnLocksTest : public ::testing::Test {
         EXPECT_EQ(locks_.TEST_allReaderWriterState(), 0);
     }
 
-    std::unique_ptr<Holder> hold(Kind kind, const std::string& identifier = "X") {
-        switch (kind) {
-            case Kind::IdRead:
-                return std::make_unique<Holder>(
-                    [=, this] { locks_.read_lock_identifier(identifier); },
-                    [=, this] { locks_.unlock_identifier(identifier); });
-            case Kind::IdWrite:
-                return std::make_unique<Holder>(
-                    [=, this] { locks_.write_lock_identifier(identifier); },
-                    [=, this] { locks_.unlock_identifier(identifier); });
-            case Kind::GlobalRead:
-                return std::make_unique<Holder>([this] { locks_.read_lock_all_identifiers(); },
-                                                [this] { locks_.unlock_all_identifiers(); });
-            case Kind::GlobalWrite:
-                return std::make_unique<Holder>([this] { locks_.write_lock_all_identifiers(); },
-                                                [this] { locks_.unlock_all_identifiers(); });
-        }
-        return nullptr;
+    std::unique_ptr<Holder> hold(Kind kind, const std::string& id = "X") {
+        return std::make_unique<Holder>(
+            [=, this] {
+                if (kind == IdRead) locks_.read_lock_identifier(id);
+                if (kind == IdWrite) locks_.write_lock_identifier(id);
+                if (kind == GlobalRead) locks_.read_lock_all_identifiers();
+                if (kind == GlobalWrite) locks_.write_lock_all_identifiers();
+            },
+            [=, this] {
+                kind >= GlobalRead ? locks_.unlock_all_identifiers() : locks_.unlock_identifier(id);
+            });
     }
 
     TarnLocks locks_;
@@ -131,8 +112,8 @@ TEST_F(TarnLocksTest, ArrayLocksDistinctIdentifiersAscendingAndUnlocksDescending
 }
 
 TEST_F(TarnLocksTest, ReadersShareARecordThatDisappearsAfterTheLastUnlock) {
-    auto first = hold(Kind::IdRead);
-    auto second = hold(Kind::IdRead);
+    auto first = hold(IdRead);
+    auto second = hold(IdRead);
     ASSERT_TRUE(first->granted());
     ASSERT_TRUE(second->granted());
     EXPECT_EQ(locks_.TEST_lockState("X"), 2);
@@ -144,11 +125,11 @@ TEST_F(TarnLocksTest, ReadersShareARecordThatDisappearsAfterTheLastUnlock) {
 }
 
 TEST_F(TarnLocksTest, WriterOfOneIdentifierExcludesOnlyThatIdentifier) {
-    auto writer = hold(Kind::IdWrite, "X");
+    auto writer = hold(IdWrite, "X");
     ASSERT_TRUE(writer->granted());
-    auto other = hold(Kind::IdWrite, "Y");
+    auto other = hold(IdWrite, "Y");
     EXPECT_TRUE(other->granted());
-    auto reader = hold(Kind::IdRead, "X");
+    auto reader = hold(IdRead, "X");
     EXPECT_TRUE(reader->blocked());
     // The waiter counts, so the record cannot vanish under it.
     EXPECT_EQ(locks_.TEST_refCount("X"), 2u);
@@ -158,11 +139,11 @@ TEST_F(TarnLocksTest, WriterOfOneIdentifierExcludesOnlyThatIdentifier) {
 }
 
 TEST_F(TarnLocksTest, GlobalWriteWaitsForEveryHolderAndBlocksEveryNewcomer) {
-    for (Kind held : {Kind::IdRead, Kind::IdWrite, Kind::GlobalRead}) {
-        SCOPED_TRACE(Name(held));
+    for (Kind held : {IdRead, IdWrite, GlobalRead}) {
+        SCOPED_TRACE(kKindNames[held]);
         auto holder = hold(held);
         ASSERT_TRUE(holder->granted());
-        auto global = hold(Kind::GlobalWrite);
+        auto global = hold(GlobalWrite);
         EXPECT_TRUE(global->blocked());
         holder->release();
         EXPECT_TRUE(global->granted());
@@ -170,12 +151,12 @@ TEST_F(TarnLocksTest, GlobalWriteWaitsForEveryHolderAndBlocksEveryNewcomer) {
         global->release();
     }
 
-    auto global = hold(Kind::GlobalWrite);
+    auto global = hold(GlobalWrite);
     ASSERT_TRUE(global->granted());
     std::vector<std::unique_ptr<Holder>> newcomers;
-    for (Kind kind : {Kind::IdRead, Kind::IdWrite, Kind::GlobalRead, Kind::GlobalWrite}) {
-        newcomers.push_back(hold(kind, std::string("N") + Name(kind)));
-        EXPECT_TRUE(newcomers.back()->blocked()) << Name(kind);
+    for (Kind kind : {IdRead, IdWrite, GlobalRead, GlobalWrite}) {
+        newcomers.push_back(hold(kind, std::string("N") + kKindNames[kind]));
+        EXPECT_TRUE(newcomers.back()->blocked()) << kKindNames[kind];
     }
     global->release();
     // They get in in no particular order (the global writer alone); each one
@@ -193,13 +174,13 @@ TEST_F(TarnLocksTest, GlobalWriteWaitsForEveryHolderAndBlocksEveryNewcomer) {
 }
 
 TEST_F(TarnLocksTest, GlobalReadAdmitsIdentifierReadersButHoldsIdentifierWriters) {
-    auto firstGlobal = hold(Kind::GlobalRead);
-    auto secondGlobal = hold(Kind::GlobalRead);
+    auto firstGlobal = hold(GlobalRead);
+    auto secondGlobal = hold(GlobalRead);
     ASSERT_TRUE(firstGlobal->granted());
     ASSERT_TRUE(secondGlobal->granted());
-    auto reader = hold(Kind::IdRead);
+    auto reader = hold(IdRead);
     EXPECT_TRUE(reader->granted());
-    auto writer = hold(Kind::IdWrite, "Y");
+    auto writer = hold(IdWrite, "Y");
     EXPECT_TRUE(writer->blocked());
     firstGlobal->release();
     EXPECT_TRUE(writer->blocked());
@@ -207,7 +188,7 @@ TEST_F(TarnLocksTest, GlobalReadAdmitsIdentifierReadersButHoldsIdentifierWriters
     EXPECT_TRUE(writer->granted());
 
     // And the other way round: a held identifier writer keeps global readers out.
-    auto global = hold(Kind::GlobalRead);
+    auto global = hold(GlobalRead);
     EXPECT_TRUE(global->blocked());
     writer->release();
     EXPECT_TRUE(global->granted());
