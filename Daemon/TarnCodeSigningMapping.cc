@@ -7,9 +7,10 @@
 #include <mutex>
 #include <system_error>
 
+#include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnSQLiteDB.h"
+#include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/PlatformLog.h"
-#include "Platform/RootPrefix.h"
 
 namespace tarn {
 
@@ -18,8 +19,7 @@ namespace {
 constexpr const char* kQueueLabel = "com.ostrea.TarnKeeper.EntitlementQueue";
 constexpr const char* kLegacyMappingFileName = "tarn_code_signing_info.plist";
 
-// The daemon's library directory; the global configuration will answer this.
-FileURL libraryDirectoryURL() { return RootPath("/private/var/root/Library/TarnKeeper"); }
+FileURL libraryDirectoryURL() { return TarnGlobalConfiguration::sharedInstance().libraryDirectory(); }
 
 std::mutex gSharedMutex;
 std::unique_ptr<TarnCodeSigningMapping> gSharedMapping;
@@ -46,17 +46,13 @@ size_t TarnCountedSet::countForObject(std::string_view object) const {
 TarnCodeSigningMapping* TarnCodeSigningMapping::sharedInstance() {
     std::lock_guard<std::mutex> lock(gSharedMutex);
     if (gSharedMapping) return gSharedMapping.get();
-    FileURL library = libraryDirectoryURL();
-    std::error_code ec;
-    // The global configuration creates this directory; until then make sure it exists.
-    std::filesystem::create_directories(library, ec);
-    std::unique_ptr<TarnSQLiteDB> db = TarnSQLiteDB::initWithParentDirectoryURL(library);
+    std::unique_ptr<TarnSQLiteDB> db = TarnSQLiteDB::initWithParentDirectoryURL(libraryDirectoryURL());
     if (!db) {
         TarnLog(kLogError, "sharedInstance", "Failed to initialize database.");
         return nullptr;
     }
-    gSharedMapping = std::make_unique<TarnCodeSigningMapping>(nullptr, DispatchQueue::createSerial(kQueueLabel),
-                                                              std::move(db));
+    gSharedMapping = std::make_unique<TarnCodeSigningMapping>(&TarnUserIdentitySharedCache::sharedInstance(),
+                                                              DispatchQueue::createSerial(kQueueLabel), std::move(db));
     return gSharedMapping.get();
 }
 

@@ -78,8 +78,9 @@ public:
     static void TEST_setSharedInstance(std::unique_ptr<TarnCodeSigningMapping> mapping);
 
     // initWithUserIdentityCache:queue:mappingDB: imports the legacy mapping
-    // file into the store on `queue` before it returns. `userIdentityCache`
-    // may be null until group clean-up needs it.
+    // file from the library directory into the store on `queue` before it
+    // returns. `userIdentityCache` (not owned, may be null in tests that do no
+    // group clean-up) must outlive the mapping.
     TarnCodeSigningMapping(TarnUserIdentitySharedCache* userIdentityCache, DispatchQueueRef queue,
                            std::unique_ptr<TarnSQLiteDB> mappingDB);
     ~TarnCodeSigningMapping();

@@ -6,7 +6,7 @@
 #include <cstdlib>
 #include <exception>
 
-#include "Platform/HostConfiguration.h"
+#include "Daemon/TarnGlobalConfiguration.h"
 #include "Platform/PlatformLog.h"
 
 namespace tarn {
@@ -75,8 +75,7 @@ constexpr const char* kDeleteAdvanceCopies = "DELETE FROM code_signing_info WHER
 constexpr int kPlaceholderBit = 1;
 constexpr int kAdvanceCopyBit = 2;
 
-// Until the global configuration answers isInternalImage, the host file does.
-bool isInternalBuild() { return HostConfiguration::shared().internalBuild; }
+bool isInternalBuild() { return TarnGlobalConfiguration::sharedInstance().isInternalImage(); }
 
 // The daemon cannot run without its database: open failures end the process.
 [[noreturn]] void stopDaemon(const char* message) {

@@ -15,7 +15,7 @@
 #include <stdexcept>
 #include <thread>
 
-#include "Platform/HostConfiguration.h"
+#include "Daemon/TarnGlobalConfiguration.h"
 #include "Platform/PlatformLog.h"
 #include "support/ScratchRoot.h"
 
@@ -60,7 +60,7 @@ protected:
     void SetUp() override {
         PlatformLogSetQuiet(true);
         // A failure inside a transaction is only survivable on a customer build.
-        if (HostConfiguration::shared().internalBuild) HostConfiguration::TEST_setShared(HostConfiguration{});
+        TarnGlobalConfiguration::sharedInstance().setIsInternalImage(false);
         root_.mkdirs("/db");
         path_ = root_.at("/db/containers.sqlite3");
         db_ = TarnSQLiteDB::initWithParentDirectoryURL(root_.at("/db"));
@@ -275,6 +275,12 @@ TEST_F(TarnSQLiteDBTest, ExceptionInsideStoreIs40AndRollsBack) {
     }
     store("com.a", makeEntry("after"));
     EXPECT_EQ(*read("com.a"), *makeEntry("after", {"com.a.kid"}));
+
+    // An internal build stops with the report instead.
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    TarnGlobalConfiguration::sharedInstance().setIsInternalImage(true);
+    db_->TEST_storeStepHook = [](const char*) { throw std::runtime_error("injected"); };
+    EXPECT_DEATH(db_->addCodeSigningEntry(makeEntry("x"), "com.a", nullptr), "INTERNAL ERROR: Uncaught Exception");
 }
 
 TEST_F(TarnSQLiteDBTest, ClosedStoreFailsWith66) {
