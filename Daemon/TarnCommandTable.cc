@@ -1,6 +1,7 @@
 #include "Daemon/TarnCommandTable.h"
 
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnTestLocks.h"
 
 namespace tarn {
 
@@ -45,7 +46,7 @@ const TarnCommandTableRow gTarnCommandTable[kTarnCommandCount] = {
     {28, nullptr, kTarnEntitlementUserManagedAssets, 1, 1, 0},  // user-managed assets path
     {29, nullptr, kTarnEntitlementUserManagedAssets, 1, 0, 0},  // delete a user-managed asset
     {30, nullptr, ALLOWED, 1, 0, 0},  // per-user data migration
-    {31, nullptr, kTarnEntitlementTestability, 1, 0, 0},  // test locks
+    {31, TarnHandleTestLockCommand, kTarnEntitlementTestability, 1, 0, 0},  // test locks
     {32, nullptr, ALLOWED, 1, 1, 1},  // persona unique strings
 };
 // clang-format on

@@ -10,7 +10,9 @@
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnLog.h"
 #include "Platform/ContainerLibrary.h"
+#include "Platform/Failpoints.h"
 #include "Platform/FirstBootMarker.h"
+#include "Platform/HostConfiguration.h"
 #include "Platform/LockState.h"
 #include "Platform/Notifications.h"
 #include "Platform/Path.h"
@@ -105,6 +107,7 @@ void TEST_resetLockState() {
 
 void TarnDaemonStartupWork(const std::function<void()>& onFinished) {
     SignpostInterval startingUp("conduit", "StartingUp");
+    (void)TARN_FAILPOINT("daemon.startup");  // only ever stalls: tests of early requests
     auto& config = TarnGlobalConfiguration::sharedInstance();
     std::string logPath = PathJoin(config.logDirectory(), "tarnkeeperd.log");
     LogHandle* handle = LogOpen("com.ostrea.tarnkeeperd", kLogNotice);
@@ -118,6 +121,8 @@ void TarnDaemonStartupWork(const std::function<void()>& onFinished) {
             ::syslog(LOG_ERR, "Failed to set up rotating logs at path %s", logPath.c_str());
     }
     TarnLog(kLogDebug, kInitTag, "tarnkeeperd built at %s %s started", __DATE__, __TIME__);
+    for (const auto& problem : HostConfiguration::shared().problems)
+        TarnLog(kLogError, kInitTag, "Host configuration: %@", problem);
     makeQueues();
 
     TarnClientConnection& shared = TarnClientConnection::sharedClientConnection();

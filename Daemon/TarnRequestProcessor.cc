@@ -41,19 +41,16 @@ private:
 
 thread_local conduit::MessageRef* tCurrentReply = nullptr;
 
-struct EntitlementGate {
-    bool entitled = false;
-    bool unrestricted = false;
-    bool allowOtherIdLookup = false;
-    std::optional<PlistValue> lookup;
-    std::optional<PlistValue> wipeList;
-};
+}  // namespace
 
-EntitlementGate checkEntitlements(const TarnClientIdentityRef& identity,
-                                  const TarnCommandTableRow& row) {
+TarnEntitlementGate TarnCheckEntitlements(const TarnClientIdentityRef& identity,
+                                          const TarnCommandTableRow& row) {
     const char* tag = "checkEntitlementsAndInitClientObject";
-    EntitlementGate g;
-    if (!identity) return g;
+    TarnEntitlementGate g;
+    if (!identity) {
+        g.admitted = row.anyClient;
+        return g;
+    }
     const std::string key = row.entitlement;
     if (identity->boolValueOfEntitlement(kTarnEntitlementAllowed)) {
         g.allowOtherIdLookup = true;
@@ -77,10 +74,9 @@ EntitlementGate checkEntitlements(const TarnClientIdentityRef& identity,
     } else {
         g.entitled = g.unrestricted || identity->boolValueOfEntitlement(key);
     }
+    g.admitted = row.anyClient || g.lookup || g.entitled;
     return g;
 }
-
-}  // namespace
 
 std::shared_ptr<TarnDeferredReply> TarnTakeDeferredReply() {
     if (!tCurrentReply || !*tCurrentReply) return nullptr;
@@ -124,12 +120,12 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
             codeSignInfo ? codeSignInfo->personaUniqueString : std::nullopt);
         TarnClientIdentityRef identity =
             TarnClientIdentity::clientIdentityWithConduitConnection(peer, codeSignInfo);
-        EntitlementGate gate = checkEntitlements(identity, *row);
-        if (identity && (gate.entitled || row->anyClient || gate.lookup)) {
+        TarnEntitlementGate gate = TarnCheckEntitlements(identity, *row);
+        if (identity && gate.admitted) {
             // Registration of the caller's entitlements joins here with the
             // code-signing mapping's processing of caller-registered entitlements.
         }
-        if (row->anyClient || gate.lookup || gate.entitled) {
+        if (gate.admitted) {
             connection = TarnClientConnection::initWithClientIdentity(
                 identity, gate.entitled, gate.allowOtherIdLookup, gate.unrestricted, gate.lookup,
                 gate.wipeList, commandQueue);

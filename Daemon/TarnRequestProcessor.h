@@ -5,6 +5,9 @@
 
 #include <exception>
 #include <memory>
+#include <optional>
+
+#include "Platform/PropertyList.h"
 
 namespace tarn {
 
@@ -12,6 +15,21 @@ namespace conduit {
 class Connection;
 struct Event;
 }  // namespace conduit
+
+class TarnClientIdentity;
+struct TarnCommandTableRow;
+
+// What the entitlement gate decided for one caller and one command row.
+struct TarnEntitlementGate {
+    bool entitled = false;
+    bool unrestricted = false;
+    bool allowOtherIdLookup = false;
+    bool admitted = false;  // a client connection is built
+    std::optional<PlistValue> lookup;
+    std::optional<PlistValue> wipeList;
+};
+TarnEntitlementGate TarnCheckEntitlements(const std::shared_ptr<const TarnClientIdentity>& identity,
+                                          const TarnCommandTableRow& row);
 
 void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
                              const conduit::Event& event);

@@ -22,21 +22,21 @@ std::string FirstBootMarkerName() {
 }
 
 bool FirstBootMarkerExists() {
-    sem_t* s = ::sem_open(("/" + FirstBootMarkerName()).c_str(), 0);
+    sem_t* s = ::sem_open((std::string("/") + FirstBootMarkerName()).c_str(), 0);
     if (s == SEM_FAILED) return false;
     ::sem_close(s);
     return true;
 }
 
 int FirstBootMarkerCreate() {
-    sem_t* s = ::sem_open(("/" + FirstBootMarkerName()).c_str(), O_CREAT, 0444, 0);
+    sem_t* s = ::sem_open((std::string("/") + FirstBootMarkerName()).c_str(), O_CREAT, 0444, 0);
     if (s == SEM_FAILED) return errno;
     ::sem_close(s);
     return 0;
 }
 
 int FirstBootMarkerRemove() {
-    if (::sem_unlink(("/" + FirstBootMarkerName()).c_str()) != 0 && errno != ENOENT) return errno;
+    if (::sem_unlink((std::string("/") + FirstBootMarkerName()).c_str()) != 0 && errno != ENOENT) return errno;
     return 0;
 }
 

@@ -12,7 +12,12 @@ namespace tarn {
 namespace {
 
 std::mutex gMu;
-std::unique_ptr<HostConfiguration> gShared;  // guarded by gMu; never replaced once read except in tests
+HostConfiguration* gShared = nullptr;  // guarded by gMu; replaced only by tests
+// Replaced configurations stay reachable: references handed out remain valid.
+std::vector<std::unique_ptr<HostConfiguration>>& retired() {
+    static auto* v = new std::vector<std::unique_ptr<HostConfiguration>>;
+    return *v;
+}
 
 std::string unquote(std::string v) {
     if (v.size() >= 2 && (v.front() == '"' || v.front() == '\'') && v.back() == v.front())
@@ -86,15 +91,17 @@ HostConfiguration HostConfiguration::load() {
 
 const HostConfiguration& HostConfiguration::shared() {
     std::lock_guard lock(gMu);
-    if (!gShared) gShared = std::make_unique<HostConfiguration>(load());
+    if (!gShared) {
+        retired().push_back(std::make_unique<HostConfiguration>(load()));
+        gShared = retired().back().get();
+    }
     return *gShared;
 }
 
 void HostConfiguration::TEST_setShared(HostConfiguration config) {
     std::lock_guard lock(gMu);
-    // The old object is leaked on purpose: references handed out stay valid.
-    (void)gShared.release();
-    gShared = std::make_unique<HostConfiguration>(std::move(config));
+    retired().push_back(std::make_unique<HostConfiguration>(std::move(config)));
+    gShared = retired().back().get();
 }
 
 }  // namespace tarn

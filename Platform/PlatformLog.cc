@@ -5,12 +5,15 @@
 #include <unistd.h>
 
 #include <cstdio>
+#include <atomic>
 #include <cstring>
 #include <mutex>
 
 namespace tarn {
 
 namespace {
+
+std::atomic<bool> gVerbose{::getenv("TARN_PLATFORM_LOG_VERBOSE") != nullptr};
 
 struct Sink {
     std::mutex mu;
@@ -54,7 +57,10 @@ void PlatformLogSetFile(const std::string& path) {
     if (s.file) std::fclose(s.file);
     s.file = path.empty() ? nullptr : std::fopen(path.c_str(), "ae");
     if (s.file) std::setvbuf(s.file, nullptr, _IOLBF, 0);
+    gVerbose = s.file != nullptr || ::getenv("TARN_PLATFORM_LOG_VERBOSE") != nullptr;
 }
+
+bool PlatformLogVerbose() { return gVerbose.load(std::memory_order_relaxed); }
 
 void PlatformLogSetQuiet(bool quiet) {
     auto& s = sink();
@@ -79,7 +85,10 @@ void PlatformLogWrite(const char* category, PlatformLogType type, const std::str
 
 SignpostInterval::SignpostInterval(const char* category, std::string name,
                                    std::vector<std::pair<std::string, std::string>> attributes)
-    : category_(category), name_(std::move(name)), start_(std::chrono::steady_clock::now()) {
+    : category_(category), recording_(PlatformLogVerbose()) {
+    if (!recording_) return;
+    name_ = std::move(name);
+    start_ = std::chrono::steady_clock::now();
     std::string text = "signpost begin " + name_;
     for (auto& [k, v] : attributes) text += " " + k + "=" + v;
     PlatformLogWrite(category_, PlatformLogType::Debug, text);
@@ -92,6 +101,7 @@ SignpostInterval::~SignpostInterval() {
 void SignpostInterval::end(std::vector<std::pair<std::string, std::string>> attributes) {
     if (ended_) return;
     ended_ = true;
+    if (!recording_) return;
     auto us = std::chrono::duration_cast<std::chrono::microseconds>(
                   std::chrono::steady_clock::now() - start_)
                   .count();

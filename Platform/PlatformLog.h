@@ -20,6 +20,10 @@ namespace tarn {
 enum class PlatformLogType { Debug, Info, Default, Error, Fault };
 
 void PlatformLogSetFile(const std::string& path);
+// Debug and info lines and signposts are recorded only when someone reads
+// them: a platform-log file is set, or TARN_PLATFORM_LOG_VERBOSE is in the
+// environment. Otherwise they cost one atomic load.
+bool PlatformLogVerbose();
 // Silences stderr/journald output (tests and tools); the file, if any, still gets lines.
 void PlatformLogSetQuiet(bool quiet);
 void PlatformLogWrite(const char* category, PlatformLogType type, const std::string& message);
@@ -27,6 +31,7 @@ void PlatformLogWrite(const char* category, PlatformLogType type, const std::str
 template <class... Args>
 void PlatformLog(const char* category, PlatformLogType type, std::string_view fmt,
                  const Args&... args) {
+    if (type <= PlatformLogType::Info && !PlatformLogVerbose()) return;
     PlatformLogWrite(category, type, Format(fmt, args...));
 }
 
@@ -47,6 +52,7 @@ private:
     std::string name_;
     std::chrono::steady_clock::time_point start_;
     bool ended_ = false;
+    bool recording_;
 };
 
 }  // namespace tarn

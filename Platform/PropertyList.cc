@@ -125,13 +125,9 @@ bool PlistValue::truthy() const {
 }
 
 bool PlistValue::operator==(const PlistValue& other) const {
-    // Integers compare by value across signedness, as they would after a file round trip.
-    if (isInteger() && other.isInteger()) {
-        auto a = *asInt64(), b = *other.asInt64();
-        if (a != b) return false;
-        bool aneg = type() == Type::Int && a < 0, bneg = other.type() == Type::Int && b < 0;
-        return aneg == bneg;
-    }
+    // Integers compare by their 64 bits across signedness: a property-list file
+    // cannot tell 2^64-1 from -1, so a round trip must not make them unequal.
+    if (isInteger() && other.isInteger()) return *asUInt64() == *other.asUInt64();
     return v_ == other.v_;
 }
 

@@ -2,6 +2,7 @@
 #include <CLI/CLI.hpp>
 
 #include "Platform/PlatformLog.h"
+#include "Tools/tarnctl/Maintenance.h"
 #include "Tools/tarnctl/Subcommands.h"
 
 namespace tarnctl {
@@ -10,6 +11,9 @@ namespace {
 // Every subcommand, in the order --help lists them. Add a line per new file.
 constexpr SubcommandSetup kSubcommands[] = {
     SetupSendCommand,
+    SetupLockCommands,
+    SetupWaitNotificationCommand,
+    SetupSimulateRebootCommand,
 };
 
 constexpr const char* kFooter = R"(JSON mapping (both ways):
@@ -31,8 +35,10 @@ Exit codes:
   3  the daemon cannot be reached
   4  no reply: timeout, connection closed, or a malformed reply
 
-Example:
-  tarnctl --root /tmp/scratch send '{"Command": 27}')";
+Examples:
+  tarnctl --root /tmp/scratch send '{"Command": 27}'
+  tarnctl --root /tmp/scratch lock
+  tarnctl --root /tmp/scratch wait-notification com.ostrea.tarnkeeper.cleanup-complete --timeout 5)";
 
 }  // namespace
 }  // namespace tarnctl

@@ -1,0 +1,130 @@
+// The daemon as a process: start-up order, the command table and entitlement
+// gate over IPC, first-boot work, and resilience to garbage on the socket.
+#include <gtest/gtest.h>
+
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <filesystem>
+#include <thread>
+
+#include "Platform/Conduit.h"
+#include "support/DaemonHarness.h"
+
+namespace tarn {
+namespace {
+
+using test::DaemonHarness;
+
+class DaemonSpineTest : public test::ScratchRootTest {
+protected:
+    void SetUp() override {
+        if (!std::filesystem::exists(test::BuiltBinary("tarnkeeperd")) ||
+            !std::filesystem::exists(test::BuiltBinary("tarnctl")))
+            GTEST_SKIP() << "tarnkeeperd and tarnctl are not built";
+        daemon_ = std::make_unique<DaemonHarness>(root_);
+        admin_ = daemon_->addPrivilegedClient();
+        guest_ = daemon_->addClient("guest", "com.ostrea.test.guest", PlistValue(PlistDict{}));
+    }
+    size_t count(const std::string& needle) {
+        std::string log = daemon_->platformLog();
+        size_t n = 0;
+        for (size_t pos = log.find(needle); pos != std::string::npos; pos = log.find(needle, pos + 1)) ++n;
+        return n;
+    }
+    std::unique_ptr<DaemonHarness> daemon_;
+    std::string admin_, guest_;
+};
+
+TEST_F(DaemonSpineTest, CommandTableAndGateOverIpc) {
+    daemon_->start();
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 27})"), 49u);
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 33})"), 49u);
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 4000000000})"), 49u);
+    // The unentitled client is refused before the handler of 27 could answer.
+    EXPECT_EQ(daemon_->sendError(guest_, R"({"Command": 27})"), 55u);
+    // A request without "Command" is command 0.
+    auto reply = daemon_->send(admin_, R"({"Identifier": "x"})");
+    ASSERT_TRUE(reply) << daemon_->lastResult().err;
+    EXPECT_TRUE(reply->find("ReplyError"));
+    EXPECT_GE(count("command=0, client="), 1u);
+    EXPECT_GE(count("command=27, client=<unknown>, error=55"), 1u);
+    EXPECT_GE(count("command=27, client=com.ostrea.test.admin, error=49"), 1u);
+}
+
+TEST_F(DaemonSpineTest, GarbageOnTheSocketOnlyDropsThatPeer) {
+    daemon_->start();
+    for (int i = 0; i < 3; ++i) {
+        int fd = ::socket(AF_UNIX, SOCK_SEQPACKET, 0);
+        ASSERT_GE(fd, 0);
+        sockaddr_un addr{};
+        addr.sun_family = AF_UNIX;
+        ::strncpy(addr.sun_path, daemon_->socketPath().c_str(), sizeof addr.sun_path - 1);
+        ASSERT_EQ(::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr), 0);
+        std::string junk(100 + i * 1000, static_cast<char>(0xA5 + i));
+        (void)!::write(fd, junk.data(), junk.size());
+        char buf[16];
+        // The daemon closes this connection rather than answering.
+        EXPECT_LE(::read(fd, buf, sizeof buf), 0);
+        ::close(fd);
+    }
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 27})"), 49u);
+}
+
+TEST_F(DaemonSpineTest, FirstBootWorkRunsOncePerBoot) {
+    daemon_->start();
+    EXPECT_TRUE(daemon_->waitForNotification("com.ostrea.tarnkeeper.reboot-cleanup-complete",
+                                             std::chrono::seconds(10)));
+    EXPECT_EQ(daemon_->stop(), 0);
+    EXPECT_EQ(count("tarnkeeperd performing first boot initialization"), 1u);
+    daemon_->start();
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 27})"), 49u)
+        << daemon_->lastResult().err;
+    EXPECT_EQ(daemon_->stop(), 0);
+    EXPECT_EQ(count("tarnkeeperd performing first boot initialization"), 1u);
+    EXPECT_EQ(count("signpost begin BootSetup"), 2u);
+
+    auto r = daemon_->tarnctl(admin_, {"simulate-reboot"});
+    EXPECT_EQ(r.exitCode, 0) << r.err;
+    daemon_->start();
+    EXPECT_EQ(count("tarnkeeperd performing first boot initialization"), 2u);
+}
+
+TEST_F(DaemonSpineTest, RequestsWaitForStartUp) {
+    // Start-up stalls in its first step; a request sent meanwhile is answered after it.
+    setenv("TARN_FAILPOINTS", "daemon.startup=sleep:1500", 1);
+    daemon_->start(/*waitReady=*/false);
+    unsetenv("TARN_FAILPOINTS");
+    std::string why;
+    std::unique_ptr<conduit::Client> client;
+    for (int i = 0; i < 200 && !client; ++i) {
+        client = conduit::Client::connect(daemon_->socketPath(), &why);
+        if (!client) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    ASSERT_TRUE(client) << why;
+    PlistValue req{PlistDict{}};
+    req.set("Command", uint64_t{27});
+    auto reply = client->sendSync(req, std::chrono::seconds(20), &why);
+    ASSERT_TRUE(reply) << why;
+    std::string log = daemon_->platformLog();
+    size_t started = log.find("signpost end StartingUp");
+    size_t handled = log.find("command=27,");
+    ASSERT_NE(started, std::string::npos);
+    ASSERT_NE(handled, std::string::npos);
+    EXPECT_LT(started, handled);
+}
+
+TEST_F(DaemonSpineTest, LockStateCommandsDriveTheDaemon) {
+    daemon_->start();
+    EXPECT_EQ(daemon_->tarnctl(admin_, {"lock"}).exitCode, 0);
+    EXPECT_EQ(daemon_->tarnctl(admin_, {"unlock"}).exitCode, 0);
+    // The daemon is still serving after the suspend/resume round.
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 27})"), 49u);
+    auto r = daemon_->tarnctl(admin_, {"wait-notification", "com.ostrea.never", "--timeout", "0.2"});
+    EXPECT_NE(r.exitCode, 0);
+}
+
+}  // namespace
+}  // namespace tarn
