@@ -5,8 +5,7 @@
 
 namespace tarn {
 
-TarnCommandQueue::TarnCommandQueue()
-    : queue_(DispatchQueue::createSerial("com.ostrea.tarnkeeperd.TarnCommandQueue")) {}
+TarnCommandQueue::TarnCommandQueue() = default;
 
 void TarnCommandQueue::insertCommand(std::shared_ptr<TarnCommand> command) {
     PlatformLog("unspecified", PlatformLogType::Info, "Added command <%p; %llu> to queue",
@@ -17,6 +16,7 @@ void TarnCommandQueue::insertCommand(std::shared_ptr<TarnCommand> command) {
 
 bool TarnCommandQueue::executeNextCommandWithError(uint64_t* error) {
     std::shared_ptr<TarnCommand> next;
+    DispatchQueueRef queue;
     {
         MutexLock lock(mu_);
         if (commands_.empty()) {
@@ -25,10 +25,12 @@ bool TarnCommandQueue::executeNextCommandWithError(uint64_t* error) {
         }
         next = commands_.front();
         commands_.pop_front();
+        if (!queue_) queue_ = DispatchQueue::createSerial("com.ostrea.tarnkeeperd.TarnCommandQueue");
+        queue = queue_;
     }
     bool ok = false;
     uint64_t code = TarnSuccess;
-    queue_->sync([&] {
+    queue->sync([&] {
         const void* p = next.get();
         PlatformLog("unspecified", PlatformLogType::Info, "Executing command <%p; %llu>...", p,
                     next->command());

@@ -41,8 +41,9 @@ public:
     size_t TEST_count();
 
 private:
-    DispatchQueueRef queue_;  // constant after construction
     Mutex mu_;
+    // Made by the first command that runs: most requests queue none.
+    DispatchQueueRef queue_ GUARDED_BY(mu_);
     std::deque<std::shared_ptr<TarnCommand>> commands_ GUARDED_BY(mu_);
 };
 
