@@ -262,15 +262,24 @@ Connection::~Connection() {
 
 std::optional<std::string> Connection::executablePath() const {
     auto path = sock::ProcessExecutable(creds_.pid);
-    // Alive after the read: the PID still named our peer while we read it. The
-    // start time guards against a pidfd of the wrong process, which cannot
-    // happen with SO_PEERPIDFD but costs nothing to check.
-    if (!path || !sock::PidfdAlive(pidfd_)) return std::nullopt;
+    auto file = sock::ProcessExecutableFile(creds_.pid);
+    // Alive after the reads: the PID still named our peer while we read it.
+    if (!path || !file || !sock::PidfdAlive(pidfd_)) return std::nullopt;
+    {
+        MutexLock l(exeMu_);
+        if (exe_ && exe_->link == *path && exe_->dev == file->dev && exe_->ino == file->ino)
+            return exe_->realPath;
+    }
+    // The start time guards against a pidfd of the wrong process, which cannot
+    // happen with SO_PEERPIDFD but is cheap once per executable.
     auto start = sock::ProcessStartTime(creds_.pid);
     if (!start || *start != creds_.startTime || !sock::PidfdAlive(pidfd_)) return std::nullopt;
     std::error_code ec;
     auto real = std::filesystem::canonical(*path, ec);
-    return ec ? *path : real.string();
+    std::string result = ec ? *path : real.string();
+    MutexLock l(exeMu_);
+    exe_ = ExecutableCache{*path, file->dev, file->ino, result};
+    return result;
 }
 
 void Connection::setEventHandler(std::function<void(const Event&)> handler) {

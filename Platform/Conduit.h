@@ -187,6 +187,18 @@ private:
     Mutex sendMu_ ACQUIRED_AFTER(mu_);  // keeps the records of one message together
     std::atomic<uint64_t> nextId_{1};
 
+    // The last executablePath() answer, reused while the peer still runs the
+    // same file under the same link: resolving it again costs a /proc read and
+    // a realpath walk per request.
+    struct ExecutableCache {
+        std::string link;
+        uint64_t dev = 0;
+        uint64_t ino = 0;
+        std::string realPath;
+    };
+    mutable Mutex exeMu_;
+    mutable std::optional<ExecutableCache> exe_ GUARDED_BY(exeMu_);
+
     // Touched by the Listener's I/O thread only.
     RecordAssembler assembler_;
 };

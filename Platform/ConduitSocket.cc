@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/un.h>
 #include <time.h>
@@ -162,6 +163,13 @@ std::optional<std::string> ProcessExecutable(pid_t pid) {
     const ssize_t n = ::readlink(link.c_str(), buf.data(), buf.size());
     if (n <= 0 || static_cast<size_t>(n) >= buf.size()) return std::nullopt;
     return std::string(buf.data(), static_cast<size_t>(n));
+}
+
+std::optional<FileIdentity> ProcessExecutableFile(pid_t pid) {
+    const std::string link = "/proc/" + std::to_string(pid) + "/exe";
+    struct stat st;
+    if (::stat(link.c_str(), &st) != 0) return std::nullopt;
+    return FileIdentity{static_cast<uint64_t>(st.st_dev), static_cast<uint64_t>(st.st_ino)};
 }
 
 std::optional<PeerCredentials> ReadPeerCredentials(int fd, std::string* why) {

@@ -47,5 +47,13 @@ std::optional<uint64_t> ProcessStartTime(pid_t pid);
 bool PidfdAlive(int pidfd);
 // readlink of /proc/PID/exe.
 std::optional<std::string> ProcessExecutable(pid_t pid);
+// Device and inode of the file /proc/PID/exe names: a new exec of another
+// file changes them even when the path stays the same.
+struct FileIdentity {
+    uint64_t dev = 0;
+    uint64_t ino = 0;
+    bool operator==(const FileIdentity&) const = default;
+};
+std::optional<FileIdentity> ProcessExecutableFile(pid_t pid);
 
 }  // namespace tarn::conduit::sock
