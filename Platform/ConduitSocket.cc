@@ -12,6 +12,7 @@
 #include <cerrno>
 #include <cstring>
 #include <fstream>
+#include <memory>
 #include <sstream>
 
 #include "Platform/Format.h"
@@ -76,18 +77,26 @@ bool SendRecords(int fd, const std::vector<std::vector<uint8_t>>& records,
 }
 
 RecvResult ReceiveRecord(int fd, size_t limit, std::vector<uint8_t>* buffer, std::string* why) {
-    buffer->resize(limit);
+    // Received into per-thread scratch and copied out at its real length:
+    // sizing the caller's vector to the limit first would zero the whole limit
+    // (64 KiB) on every call, the last one that finds nothing included.
+    thread_local std::unique_ptr<uint8_t[]> scratch;
+    thread_local size_t scratchSize = 0;
+    if (scratchSize < limit) {
+        scratch.reset(new uint8_t[limit]);
+        scratchSize = limit;
+    }
     for (;;) {
         // MSG_TRUNC makes recv report the record's real length, so an oversized
         // record is recognised instead of silently cut.
-        const ssize_t n = ::recv(fd, buffer->data(), limit, MSG_DONTWAIT | MSG_TRUNC);
+        const ssize_t n = ::recv(fd, scratch.get(), limit, MSG_DONTWAIT | MSG_TRUNC);
         if (n > 0) {
             if (static_cast<size_t>(n) > limit) {
                 if (why) *why = Format("record of %zd bytes is larger than the limit", n);
                 buffer->clear();
                 return RecvResult::Error;
             }
-            buffer->resize(static_cast<size_t>(n));
+            buffer->assign(scratch.get(), scratch.get() + n);
             return RecvResult::Record;
         }
         if (n == 0) {
