@@ -1,5 +1,6 @@
 #include "Daemon/TarnCommandTable.h"
 
+#include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnTestLocks.h"
 
@@ -34,7 +35,7 @@ const TarnCommandTableRow gTarnCommandTable[kTarnCommandCount] = {
     {16, nullptr, ALLOWED, 1, 1, 1},  // system group containers of an owner
     {17, nullptr, ALLOWED, 1, 1, 1},  // path of one system group container
     {18, nullptr, ALLOWED, 1, 0, 0},  // record code-signing information
-    {19, nullptr, ALLOWED, 1, 0, 0},  // read code-signing information
+    {19, TarnHandleGetCodeSigningInfoCommand, ALLOWED, 1, 0, 0},  // read code-signing information
     {20, nullptr, ALLOWED, 1, 0, 0},  // invalidate code-signing info without bundle
     {21, nullptr, ALLOWED, 0, 0, 0},  // set data protection
     {22, nullptr, ALLOWED, 1, 0, 0},  // same as 8

@@ -9,6 +9,7 @@
 
 #include "Daemon/TarnClientConnection.h"
 #include "Daemon/TarnClientIdentity.h"
+#include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnCommandTable.h"
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnLog.h"
@@ -122,8 +123,12 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
             TarnClientIdentity::clientIdentityWithConduitConnection(peer, codeSignInfo);
         TarnEntitlementGate gate = TarnCheckEntitlements(identity, *row);
         if (identity && gate.admitted) {
-            // Registration of the caller's entitlements joins here with the
-            // code-signing mapping's processing of caller-registered entitlements.
+            uint64_t result = TarnCodeSigningMapping::sharedInstance()->processCallerRegisteredEntitlements(
+                *identity->entitlements().asDict(), identity->bundleIdentifier(), commandQueue.get());
+            if (result != TarnSuccess)
+                TarnLog(kLogError, "checkEntitlementsAndInitClientObject",
+                        "Error processing entitlements for %@ : %llu", identity->bundleIdentifier(),
+                        result);
         }
         if (gate.admitted) {
             connection = TarnClientConnection::initWithClientIdentity(

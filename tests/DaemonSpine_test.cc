@@ -128,3 +128,47 @@ TEST_F(DaemonSpineTest, LockStateCommandsDriveTheDaemon) {
 
 }  // namespace
 }  // namespace tarn
+
+namespace tarn {
+namespace {
+
+class DaemonCommandsTest : public test::ScratchRootTest {
+protected:
+    void SetUp() override {
+        if (!std::filesystem::exists(test::BuiltBinary("tarnkeeperd")) ||
+            !std::filesystem::exists(test::BuiltBinary("tarnctl")))
+            GTEST_SKIP() << "tarnkeeperd and tarnctl are not built";
+        daemon_ = std::make_unique<test::DaemonHarness>(root_);
+        admin_ = daemon_->addPrivilegedClient();
+        PlistValue allowedOnly{PlistDict{}};
+        allowedOnly.set("com.ostrea.private.TarnKeeper.allowed", true);
+        allowed_ = daemon_->addClient("allowed", "com.ostrea.test.allowed", allowedOnly);
+    }
+    std::unique_ptr<test::DaemonHarness> daemon_;
+    std::string admin_, allowed_;
+};
+
+TEST_F(DaemonCommandsTest, TestLocksNeedTestabilityEvenWithAllowed) {
+    daemon_->start();
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 7, "Enable": true})"), 38u);
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 7, "Enable": false})"), 1u);
+    EXPECT_EQ(daemon_->sendError(allowed_, R"({"Command": 31, "TestLock": 7, "Enable": false})"), 55u);
+}
+
+TEST_F(DaemonCommandsTest, TestLocksAreInertOnCustomerBuilds) {
+    PlistValue host{PlistDict{}};
+    host.set("InternalBuild", false);
+    daemon_->writeHostConfig(host);
+    daemon_->start();
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 7, "Enable": true})"), 1u);
+}
+
+TEST_F(DaemonCommandsTest, CodeSigningInfoIsNotFoundForAnUnknownIdentifier) {
+    daemon_->start();
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 19, "Identifier": "com.ostrea.none"})"), 21u);
+    EXPECT_TRUE(std::filesystem::exists(
+        root_.at("/private/var/root/Library/TarnKeeper/containers.sqlite3")));
+}
+
+}  // namespace
+}  // namespace tarn
