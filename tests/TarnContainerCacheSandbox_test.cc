@@ -1,0 +1,111 @@
+// The sandbox layers under the container cache: the durable per-user item
+// tables and the extension tokens.
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "Platform/PlatformLog.h"
+#include "Platform/Sandbox.h"
+#include "Platform/SandboxUserState.h"
+#include "support/ScratchRoot.h"
+
+namespace tarn {
+namespace {
+
+namespace fs = std::filesystem;
+
+std::vector<std::string> items(SandboxUserState& state, uint32_t uid) {
+    std::vector<std::string> out;
+    EXPECT_EQ(state.iterateUserStateItems(uid, [&](uint64_t type, const SandboxUserStateItem* item) {
+        out.push_back(std::to_string(type) + ":" + item->identifier + ":" +
+                      std::to_string(item->personaID) + "=" + item->path.value_or("-"));
+    }), 0);
+    return out;
+}
+
+class SandboxUserStateTest : public test::ScratchRootTest {
+protected:
+    void SetUp() override { PlatformLogSetQuiet(true); }
+    void TearDown() override { PlatformLogSetQuiet(false); }
+    FileURL dir() const { return FileSandboxUserState::defaultDirectory(); }
+};
+
+TEST_F(SandboxUserStateTest, ItemsSurviveANewInstanceAndClearsAreDurable) {
+    {
+        FileSandboxUserState state(dir());
+        EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.a", "/c/A"), 0);
+        EXPECT_EQ(state.setUserStateItemWithPersona(501, 900, 1, "com.a", "/e/A"), 0)
+            << "another persona has its own item";
+        EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 2, "group.g", "/c/G"), 0);
+        EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.a", nullptr), 0);
+        EXPECT_EQ(state.setUserStateItemWithPersona(0, 501, 4, "com.sys", "/s"), 0);
+        EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "", "/x"), EINVAL);
+    }
+    FileSandboxUserState restarted(dir());
+    EXPECT_EQ(items(restarted, 501), (std::vector<std::string>{"1:com.a:900=/e/A", "2:group.g:501=/c/G"}));
+    EXPECT_EQ(items(restarted, 0), (std::vector<std::string>{"4:com.sys:501=/s"}));
+    EXPECT_TRUE(items(restarted, 777).empty());
+    EXPECT_TRUE(fs::exists(dir())) << "state lives below the root's run directory";
+}
+
+TEST_F(SandboxUserStateTest, ABatchWritesOnceAtItsEnd) {
+    FileSandboxUserState state(dir());
+    {
+        SandboxUserState::Batch batch(state);
+        for (int i = 0; i < 100; ++i)
+            ASSERT_EQ(state.setUserStateItemWithPersona(501, 501, 1, ("com.b" + std::to_string(i)).c_str(), "/p"), 0);
+        EXPECT_FALSE(fs::exists(state.fileForUID(501))) << "nothing written inside the batch";
+        EXPECT_EQ(items(state, 501).size(), 100u) << "but visible at once";
+    }
+    FileSandboxUserState restarted(dir());
+    EXPECT_EQ(items(restarted, 501).size(), 100u);
+}
+
+TEST_F(SandboxUserStateTest, MalformedStateFilesCountAsEmpty) {
+    fs::create_directories(dir());
+    std::ofstream(PathJoin(dir(), "501.plist")) << "not a property list";
+    FileSandboxUserState state(dir());
+    EXPECT_TRUE(items(state, 501).empty());
+    // And are replaced by the next write.
+    EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.c", "/c"), 0);
+    FileSandboxUserState restarted(dir());
+    EXPECT_EQ(items(restarted, 501).size(), 1u);
+}
+
+class SandboxExtensionTest : public test::ScratchRootTest {};
+
+TEST_F(SandboxExtensionTest, TokensBindClassPathAndProcess) {
+    SandboxAuditToken me{};
+    me[0] = 7;
+    SandboxAuditToken other = me;
+    other[31] = 1;
+    int error = 0;
+    auto token = SandboxExtensionIssueFile(kSandboxExtensionClassContainer, "/c/A;B", me, &error);
+    ASSERT_TRUE(token) << error;
+    EXPECT_EQ(token->rfind("1;com.ostrea.sandbox.container;", 0), 0u);
+    EXPECT_TRUE(SandboxExtensionVerify(*token, kSandboxExtensionClassContainer, "/c/A;B", me));
+    EXPECT_FALSE(SandboxExtensionVerify(*token, kSandboxExtensionClassApplicationGroup, "/c/A;B", me));
+    EXPECT_FALSE(SandboxExtensionVerify(*token, kSandboxExtensionClassContainer, "/c/A", me));
+    EXPECT_FALSE(SandboxExtensionVerify(*token, kSandboxExtensionClassContainer, "/c/A;B", other));
+    std::string forged = *token;
+    forged.back() = forged.back() == '0' ? '1' : '0';
+    EXPECT_FALSE(SandboxExtensionVerify(forged, kSandboxExtensionClassContainer, "/c/A;B", me));
+
+    struct stat st;
+    ASSERT_EQ(::stat(SandboxExtensionKeyPath().c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 0777, 0600u);
+    EXPECT_EQ(st.st_size, 32);
+
+    // A new boot (the key gone) invalidates old tokens.
+    fs::remove(SandboxExtensionKeyPath());
+    EXPECT_FALSE(SandboxExtensionVerify(*token, kSandboxExtensionClassContainer, "/c/A;B", me));
+
+    EXPECT_FALSE(SandboxExtensionIssueFile("bad;class", "/p", me, &error));
+    EXPECT_EQ(error, EINVAL);
+    EXPECT_FALSE(SandboxExtensionIssueFile(kSandboxExtensionClassContainer, "", me, &error));
+}
+
+}  // namespace
+}  // namespace tarn

@@ -1,0 +1,376 @@
+#include "Daemon/TarnContainerCache.h"
+
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+
+#include "Daemon/TarnFileManager.h"
+#include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnUserIdentityCache.h"
+#include "Daemon/TarnWhitelist.h"
+#include "Platform/ContainerLibrary.h"
+#include "Platform/Notifications.h"
+#include "Platform/PersonaRoster.h"
+#include "Platform/SandboxUserState.h"
+#include "support/ScratchRoot.h"
+
+namespace tarn {
+namespace {
+
+// The file-backed state with set calls that can be made to fail.
+class FaultySandboxUserState : public FileSandboxUserState {
+public:
+    using FileSandboxUserState::FileSandboxUserState;
+    int setUserStateItemWithPersona(uint32_t uid, uint32_t personaID, uint64_t itemType,
+                                    const char* identifier, const char* path) override {
+        ++sets;
+        if (failSets) return EIO;
+        return FileSandboxUserState::setUserStateItemWithPersona(uid, personaID, itemType, identifier,
+                                                                 path);
+    }
+    bool failSets = false;
+    int sets = 0;
+};
+
+// Every (type, identifier, persona) -> path of one user.
+std::map<std::string, std::string> itemsOf(SandboxUserState& state, uint32_t uid) {
+    std::map<std::string, std::string> items;
+    state.iterateUserStateItems(uid, [&](uint64_t type, const SandboxUserStateItem* item) {
+        items[std::to_string(type) + ":" + item->identifier + ":" + std::to_string(item->personaID)] =
+            item->path.value_or("");
+    });
+    return items;
+}
+
+class TarnContainerCacheTest : public test::ScratchRootTest {
+protected:
+    void SetUp() override {
+        TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
+        PlatformLogSetQuiet(true);
+        state_ = std::make_unique<FaultySandboxUserState>(FileSandboxUserState::defaultDirectory());
+        cache_ = makeCache();
+    }
+    void TearDown() override {
+        PlatformLogSetQuiet(false);
+        TarnUserIdentityCache::TEST_setPersonasAreSupported(std::nullopt);
+    }
+
+    std::shared_ptr<TarnContainerCache> makeCache() {
+        return TarnContainerCache::initWithUserIdentityCache(TarnUserIdentitySharedCache::sharedInstance(),
+                                                             nullptr, *state_);
+    }
+
+    TarnUserIdentityRef mobile() { return TarnUserIdentityCache::defaultUserIdentity(); }
+
+    FileURL base(TarnContainerClass c, bool transient = false,
+                 const TarnUserIdentityRef& user = nullptr) {
+        return *TarnGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
+            user ? user : mobile(), c, transient);
+    }
+
+    // Writes a container of `identifier` on disk under `name` (a new UUID by default).
+    TarnMetadataRef makeContainer(TarnContainerClass c, const std::string& identifier,
+                                  bool transient = false, std::string name = "",
+                                  const TarnUserIdentityRef& user = nullptr) {
+        Uuid uuid = Uuid::generate();
+        if (name.empty()) name = uuid.string();
+        FileURL dir = PathJoin(base(c, transient, user), name);
+        std::filesystem::create_directories(dir);
+        auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
+            uuid, user ? user : mobile(), identifier, c, nullptr);
+        auto m = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir, std::nullopt);
+        TarnErrorRef error;
+        EXPECT_TRUE(m->writeMetadataToDiskWithError(&error)) << (error ? error->description() : "");
+        return m;
+    }
+
+    TarnContainerIdentityRef identity(TarnContainerClass c, const std::string& identifier,
+                                      const TarnUserIdentityRef& user = nullptr) {
+        return TarnContainerIdentity::containerIdentityWithUserIdentity(user ? user : mobile(),
+                                                                        identifier, c, nullptr);
+    }
+
+    TarnMetadataRef lookup(TarnContainerClass c, const std::string& identifier, uint64_t* code,
+                           bool transient = false) {
+        TarnErrorRef error;
+        auto m = cache_->containerForContainerIdentity(identity(c, identifier), transient, true, &error);
+        *code = m ? TarnSuccess : (error ? error->code() : 0);
+        return m;
+    }
+
+    std::unique_ptr<FaultySandboxUserState> state_;
+    std::shared_ptr<TarnContainerCache> cache_;
+};
+
+TEST_F(TarnContainerCacheTest, MetadataDeletedBehindTheDaemonGives44ThenNotFound) {
+    auto made = makeContainer(2, "com.ostrea.notes");
+    uint64_t code = 0;
+    auto found = lookup(2, "com.ostrea.notes", &code);
+    ASSERT_TRUE(found) << code;
+    EXPECT_EQ(found->url(), made->url());
+    EXPECT_EQ(found->uuid(), made->uuid());
+    EXPECT_EQ(cache_->TEST_rebuildCount(), 1u);
+
+    std::filesystem::remove(PathJoin(made->url(), kTarnMetadataFileName));
+    EXPECT_FALSE(lookup(2, "com.ostrea.notes", &code));
+    EXPECT_EQ(code, TarnErrorCacheInconsistent);
+    EXPECT_FALSE(lookup(2, "com.ostrea.notes", &code));
+    EXPECT_EQ(code, TarnErrorNotFound);
+    EXPECT_EQ(cache_->TEST_rebuildCount(), 1u) << "the key's dictionary stays; nothing is rescanned";
+    EXPECT_TRUE(itemsOf(*state_, 501).empty()) << "the stale mapping is withdrawn";
+}
+
+TEST_F(TarnContainerCacheTest, RebuildKeepsTheLastOfTwoDirectoriesClaimingOneIdentifier) {
+    makeContainer(2, "com.ostrea.twice");
+    makeContainer(2, "com.ostrea.twice");
+    auto listing = TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(base(2), nullptr);
+    ASSERT_TRUE(listing && listing->size() == 2);
+    uint64_t code = 0;
+    auto found = lookup(2, "com.ostrea.twice", &code);
+    ASSERT_TRUE(found) << code;
+    EXPECT_EQ(found->url(), listing->back());
+    EXPECT_EQ(itemsOf(*state_, 501).at("1:com.ostrea.twice:501"), listing->back());
+}
+
+TEST_F(TarnContainerCacheTest, OnlyUUIDNamesCountExceptWellKnownSystemContainers) {
+    makeContainer(2, "com.ostrea.badname", false, "NotAUUID");
+    makeContainer(2, "com.ostrea.good");
+    uint64_t code = 0;
+    EXPECT_FALSE(lookup(2, "com.ostrea.badname", &code));
+    EXPECT_EQ(code, TarnErrorNotFound);
+    EXPECT_TRUE(lookup(2, "com.ostrea.good", &code));
+
+    EXPECT_FALSE(cache_->containerURL("/x/com.ostrea.random", 12));
+    auto wellKnown = TarnWhitelist::sharedWhitelist().wellknownSystemContainers();
+    if (wellKnown.empty()) GTEST_SKIP() << "the well-known list names no system container";
+    const std::string id = wellKnown.front();
+    EXPECT_TRUE(cache_->containerURL("/x/" + id, 12));
+    EXPECT_FALSE(cache_->containerURL("/x/" + id, 2)) << "well-known names count for system classes only";
+    makeContainer(12, id, false, id);
+    auto found = lookup(12, id, &code);
+    ASSERT_TRUE(found) << code;
+    EXPECT_EQ(PathLastComponent(found->url()), id);
+    EXPECT_EQ(itemsOf(*state_, 0).count("4:" + id + ":501"), 1u) << "system containers are filed under user 0";
+}
+
+TEST_F(TarnContainerCacheTest, AddBeforeTheClassWasBuiltRecordsNothing) {
+    auto made = makeContainer(2, "com.ostrea.early");
+    TarnErrorRef error;
+    EXPECT_TRUE(cache_->addContainerMetadata(made, made->url(), false, false, &error));
+    EXPECT_EQ(cache_->TEST_rebuildCount(), 0u);
+    EXPECT_EQ(state_->sets, 0);
+    // The next lookup finds it on disk.
+    uint64_t code = 0;
+    EXPECT_TRUE(lookup(2, "com.ostrea.early", &code));
+    EXPECT_EQ(cache_->TEST_rebuildCount(), 1u);
+
+    // Bad input is refused with 47, never recorded.
+    EXPECT_FALSE(cache_->addContainerMetadata(made, "relative/path", false, true, &error));
+    EXPECT_EQ(error->code(), TarnErrorCacheInvalidInput);
+    EXPECT_FALSE(cache_->removeContainerForUserIdentity(mobile(), 14, "x", false, &error));
+    EXPECT_EQ(error->code(), TarnErrorCacheInvalidInput);
+    EXPECT_FALSE(cache_->allContainersForUserIdentity(mobile(), 0, false, &error));
+    EXPECT_EQ(error->code(), TarnErrorCacheInvalidInput);
+}
+
+TEST_F(TarnContainerCacheTest, TransientContainersAreNeverPushed) {
+    makeContainer(2, "com.ostrea.temp", true);
+    uint64_t code = 0;
+    ASSERT_TRUE(lookup(2, "com.ostrea.temp", &code, true)) << code;
+    auto extra = makeContainer(2, "com.ostrea.temp2", true);
+    TarnErrorRef error;
+    ASSERT_TRUE(cache_->addContainerMetadata(extra, extra->url(), true, true, &error));
+    ASSERT_TRUE(cache_->removeContainerForUserIdentity(mobile(), 2, "com.ostrea.temp", true, &error));
+    EXPECT_EQ(state_->sets, 0);
+    EXPECT_FALSE(lookup(2, "com.ostrea.temp", &code, false)) << "live and transient are apart";
+}
+
+TEST_F(TarnContainerCacheTest, RestartAnswersFromTheSandboxStateWithoutARescan) {
+    auto made = makeContainer(2, "com.ostrea.mail");
+    makeContainer(2, "com.ostrea.other");
+    uint64_t code = 0;
+    ASSERT_TRUE(lookup(2, "com.ostrea.mail", &code));
+
+    // A new daemon: fresh state object over the same files, fresh cache.
+    state_ = std::make_unique<FaultySandboxUserState>(FileSandboxUserState::defaultDirectory());
+    cache_ = makeCache();
+    auto found = lookup(2, "com.ostrea.mail", &code);
+    ASSERT_TRUE(found) << code;
+    EXPECT_EQ(found->url(), made->url());
+    EXPECT_EQ(cache_->TEST_rebuildCount(), 0u);
+    EXPECT_EQ(cache_->TEST_kernelHitCount(), 1u);
+
+    // Transient lookups and lookups without kernel access scan.
+    TarnErrorRef error;
+    EXPECT_TRUE(cache_->containerForContainerIdentity(identity(2, "com.ostrea.mail"), false, true,
+                                                      false, &error));
+    EXPECT_EQ(cache_->TEST_rebuildCount(), 1u);
+}
+
+TEST_F(TarnContainerCacheTest, ASandboxPathThatNoLongerHoldsTheContainerIsNotTrusted) {
+    auto made = makeContainer(2, "com.ostrea.moved");
+    auto decoy = makeContainer(2, "com.ostrea.decoy");
+    // The state claims the decoy's directory for "moved".
+    ASSERT_EQ(state_->setUserStateItemWithPersona(501, 501, 1, "com.ostrea.moved", decoy->url().c_str()), 0);
+    uint64_t code = 0;
+    auto found = lookup(2, "com.ostrea.moved", &code);
+    ASSERT_TRUE(found) << code;
+    EXPECT_EQ(found->url(), made->url()) << "a mismatching sandbox answer falls back to a scan";
+    EXPECT_EQ(cache_->TEST_kernelHitCount(), 0u);
+    EXPECT_EQ(cache_->TEST_rebuildCount(), 1u);
+}
+
+TEST_F(TarnContainerCacheTest, PushFailuresKeepTheContainer) {
+    makeContainer(2, "com.ostrea.pushfail");
+    state_->failSets = true;
+    uint64_t code = 0;
+    EXPECT_TRUE(lookup(2, "com.ostrea.pushfail", &code)) << code;
+    EXPECT_GT(state_->sets, 0);
+    EXPECT_FALSE(cache_->setSandboxContainerMappingForUserIdentity(mobile(), "x", 2, "/p"));
+    EXPECT_TRUE(cache_->setSandboxContainerMappingForUserIdentity(mobile(), "x", 1, "/p"))
+        << "bundle classes are never pushed";
+    EXPECT_FALSE(cache_->setSandboxContainerMappingForUserIdentity(mobile(), "x", 14, "/p"));
+}
+
+TEST_F(TarnContainerCacheTest, AllContainersDropsEntriesWhoseMetadataIsGone) {
+    auto a = makeContainer(4, "com.ostrea.a.ext");
+    makeContainer(4, "com.ostrea.b.ext");
+    TarnErrorRef error;
+    auto all = cache_->allContainersForUserIdentity(mobile(), 4, false, &error);
+    ASSERT_TRUE(all);
+    EXPECT_EQ(all->size(), 2u);
+    std::filesystem::remove(PathJoin(a->url(), kTarnMetadataFileName));
+    all = cache_->allContainersForUserIdentity(mobile(), 4, false, &error);
+    ASSERT_TRUE(all);
+    ASSERT_EQ(all->size(), 1u);
+    EXPECT_EQ(all->front()->identifier(), "com.ostrea.b.ext");
+    uint64_t code = 0;
+    EXPECT_FALSE(lookup(4, "com.ostrea.a.ext", &code));
+    EXPECT_EQ(code, TarnErrorNotFound);
+}
+
+TEST_F(TarnContainerCacheTest, ConcreteLookupMatchesTheUUIDAndMarksTransience) {
+    auto live = makeContainer(2, "com.ostrea.c");
+    auto transient = makeContainer(2, "com.ostrea.c", true);
+    auto concrete = [&](const TarnMetadataRef& m) {
+        return TarnConcreteContainerIdentity::containerIdentityWithUUID(m->uuid(), mobile(),
+                                                                        "com.ostrea.c", 2, nullptr);
+    };
+    auto a = cache_->containerForContainerIdentity(concrete(live));
+    ASSERT_TRUE(a);
+    EXPECT_FALSE(a->transient());
+    auto b = cache_->containerForContainerIdentity(concrete(transient));
+    ASSERT_TRUE(b);
+    EXPECT_TRUE(b->transient());
+    EXPECT_EQ(b->url(), transient->url());
+    auto other = TarnConcreteContainerIdentity::containerIdentityWithUUID(Uuid::generate(), mobile(),
+                                                                          "com.ostrea.c", 2, nullptr);
+    EXPECT_FALSE(cache_->containerForContainerIdentity(other));
+}
+
+TEST_F(TarnContainerCacheTest, InvalidationWithdrawsMappingsAndPosts) {
+    makeContainer(2, "com.ostrea.inv");
+    uint64_t code = 0;
+    ASSERT_TRUE(lookup(2, "com.ostrea.inv", &code));
+    ASSERT_EQ(itemsOf(*state_, 501).size(), 1u);
+    int posts = 0;
+    int token = NotifyRegister(CONTAINER_NOTIFY_USER_INVALIDATED, [&] { ++posts; });
+    cache_->invalidateUserIdentity(mobile());
+    NotifyCancel(token);
+    EXPECT_EQ(posts, 1);
+    EXPECT_TRUE(itemsOf(*state_, 501).empty());
+    ASSERT_TRUE(lookup(2, "com.ostrea.inv", &code));
+    EXPECT_EQ(cache_->TEST_rebuildCount(), 2u) << "the dictionary was dropped";
+}
+
+// ---- The registration rule, with personas ----
+
+using Kind = PersonaAttributes::Kind;
+
+PersonaAttributesRef persona(Kind kind, std::optional<std::string> unique, uint32_t id,
+                             std::vector<std::string> bundles = {}) {
+    auto p = std::make_shared<PersonaAttributes>();
+    p->kind = kind;
+    p->uniqueString = std::move(unique);
+    p->personaID = id;
+    p->bundleIDs = std::move(bundles);
+    return p;
+}
+
+class TarnContainerCacheRegistrationTest : public test::ScratchRootTest {
+protected:
+    void SetUp() override {
+        TarnUserIdentityCache::TEST_setPersonasAreSupported(true);
+        PlatformLogSetQuiet(true);
+        roster_.setList(PersonaAttributesList{
+            persona(Kind::Personal, "P-1", 1000),
+            persona(Kind::Universal, "U-1", 1001, {"com.ostrea.shared"}),
+            persona(Kind::Enterprise, "E-1", 1002, {"com.corp.mail"}),
+        });
+        identities_ = std::make_unique<TarnUserIdentityCache>(roster_);
+        identities_->TEST_setRetryDelay(std::chrono::milliseconds(0));
+        state_ = std::make_unique<FileSandboxUserState>(FileSandboxUserState::defaultDirectory());
+        cache_ = TarnContainerCache::initWithUserIdentityCache(*identities_, nullptr, *state_);
+        personal_ = identities_->userIdentityForPersonalPersona();
+        enterprise_ = identities_->userIdentityForCurrentUserWithPersonaUniqueString("E-1");
+        ASSERT_TRUE(personal_ && enterprise_);
+    }
+    void TearDown() override {
+        PlatformLogSetQuiet(false);
+        TarnUserIdentityCache::TEST_setPersonasAreSupported(std::nullopt);
+    }
+
+    bool rule(const TarnUserIdentityRef& u, const std::string& id, TarnContainerClass c) {
+        return cache_->shouldRegisterSandboxMappingWithUserIdentity(u, id, c);
+    }
+
+    MemoryPersonaRoster roster_;
+    std::unique_ptr<TarnUserIdentityCache> identities_;
+    std::unique_ptr<FileSandboxUserState> state_;
+    std::shared_ptr<TarnContainerCache> cache_;
+    TarnUserIdentityRef personal_, enterprise_;
+};
+
+TEST_F(TarnContainerCacheRegistrationTest, DecisionsByClassAndPersona) {
+    for (TarnContainerClass c : {1, 3, 5, 8, 12, 13}) {
+        EXPECT_FALSE(rule(enterprise_, "com.any", c)) << c;
+        EXPECT_TRUE(rule(personal_, "com.any", c)) << c;
+    }
+    EXPECT_TRUE(rule(enterprise_, "group.any", 7));
+    EXPECT_TRUE(rule(personal_, "group.any", 7));
+
+    // Listed only by the enterprise persona.
+    EXPECT_FALSE(rule(personal_, "com.corp.mail", 2));
+    EXPECT_TRUE(rule(enterprise_, "com.corp.mail", 2));
+    // Listed by a universal persona: everyone owns it, only the personal side registers.
+    EXPECT_TRUE(rule(personal_, "com.ostrea.shared", 2));
+    EXPECT_FALSE(rule(enterprise_, "com.ostrea.shared", 2));
+    // Listed nowhere: the personal identity's.
+    EXPECT_TRUE(rule(personal_, "com.unlisted", 10));
+    EXPECT_FALSE(rule(enterprise_, "com.unlisted", 10));
+}
+
+TEST_F(TarnContainerCacheRegistrationTest, EnterpriseGroupIsPushedUnderItsPersona) {
+    auto dir = PathJoin(*TarnGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
+                            enterprise_, 7, false),
+                        Uuid::generate().string());
+    std::filesystem::create_directories(dir);
+    auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
+        Uuid::generate(), enterprise_, "group.corp", 7, nullptr);
+    auto m = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir, std::nullopt);
+    TarnErrorRef error;
+    ASSERT_TRUE(cache_->addContainerMetadata(m, dir, false, true, &error))
+        << (error ? error->description() : "");
+    auto items = itemsOf(*state_, enterprise_->posixUID());
+    EXPECT_EQ(items.at("2:group.corp:" + std::to_string(enterprise_->kernelPersonaID())), dir);
+
+    // An enterprise flush drops the identity's dictionaries through the observer.
+    identities_->flush();
+    (void)identities_->userIdentityForPersonalPersona();  // rebuilds, which reports the dropped identities
+    cache_->TEST_drainInvalidations();
+    EXPECT_TRUE(itemsOf(*state_, enterprise_->posixUID()).empty());
+}
+
+}  // namespace
+}  // namespace tarn
