@@ -3,6 +3,7 @@
 
 #include "Platform/PlatformLog.h"
 #include "Tools/tarnctl/Maintenance.h"
+#include "Tools/tarnctl/SandboxItems.h"
 #include "Tools/tarnctl/Subcommands.h"
 
 namespace tarnctl {
@@ -14,6 +15,7 @@ constexpr SubcommandSetup kSubcommands[] = {
     SetupLockCommands,
     SetupWaitNotificationCommand,
     SetupSimulateRebootCommand,
+    SetupSandboxItemsCommand,
 };
 
 constexpr const char* kFooter = R"(JSON mapping (both ways):
