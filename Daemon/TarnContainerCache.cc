@@ -264,7 +264,9 @@ bool TarnContainerCache::setSandboxContainerMappingForUserIdentity(
     const uint64_t itemType = TarnContainerClassSandboxItemType(containerClass);
     const char* path = url ? url->c_str() : "(null)";
 
-    // Clearing first drops any earlier path of this identifier.
+    // Clearing first drops any earlier path of this identifier; one batch makes
+    // the pair one durable change.
+    SandboxUserState::Batch batch(sandboxUserState_);
     int result = sandboxUserState_.setUserStateItemWithPersona(user, persona, itemType,
                                                                identifier.c_str(), nullptr);
     if (result != 0) {

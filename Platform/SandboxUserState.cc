@@ -101,7 +101,10 @@ FileSandboxUserState::Table& FileSandboxUserState::_lock_tableForUID(uint32_t ui
     std::vector<uint8_t> bytes;
     const FileURL file = fileForUID(uid);
     int err = readAll(file, kMaxStateFileBytes, &bytes);
-    if (err == ENOENT) return table;
+    if (err == ENOENT) {
+        persisted_[uid] = table;
+        return table;
+    }
     if (err != 0) {
         PlatformLog("sandbox", PlatformLogType::Error, "Cannot read sandbox state %s: %s", file,
                     std::strerror(err));
@@ -130,6 +133,7 @@ FileSandboxUserState::Table& FileSandboxUserState::_lock_tableForUID(uint32_t ui
         }
         table[Key{*t, *identifier->asString(), static_cast<uint32_t>(*p)}] = *path->asString();
     }
+    persisted_[uid] = table;
     return table;
 }
 
@@ -163,6 +167,7 @@ int FileSandboxUserState::_lock_writeTable(uint32_t uid) {
         (void)::unlink(tmp.c_str());  // best effort: a leftover temp file is harmless
         return err;
     }
+    persisted_[uid] = table;
     int dirFd = ::open(directory_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
     if (dirFd >= 0) {
         if (::fsync(dirFd) != 0) err = errno;
@@ -220,6 +225,9 @@ int FileSandboxUserState::endBatch() {
     if (batchDepth_ == 0 || --batchDepth_ > 0) return 0;
     int first = 0;
     for (uint32_t uid : dirty_) {
+        // Pushing what is already recorded (a rebuild after a restart) costs no write.
+        auto persisted = persisted_.find(uid);
+        if (persisted != persisted_.end() && persisted->second == tables_[uid]) continue;
         int err = _lock_writeTable(uid);
         if (err != 0) {
             PlatformLog("sandbox", PlatformLogType::Error,

@@ -17,8 +17,9 @@
 //
 // Durability batching: while a Batch is open on the instance, changes stay in
 // memory and the touched users' files are written once when the last Batch
-// closes. The container cache opens one around a class rebuild, which pushes
-// thousands of items.
+// closes, and not at all when the batch left a table as its file has it. The
+// container cache opens one around a class rebuild, which pushes thousands
+// of items, and around each clear-then-set pair of one push.
 //
 // Thread-safe: one mutex per instance guards the tables; callbacks of
 // iterateUserStateItems run with it released on a snapshot.
@@ -116,6 +117,8 @@ private:
 
     Mutex mu_;
     std::map<uint32_t, Table> tables_ GUARDED_BY(mu_);
+    // What each user's file holds, so a batch that changed nothing on balance writes nothing.
+    std::map<uint32_t, Table> persisted_ GUARDED_BY(mu_);
     int batchDepth_ GUARDED_BY(mu_) = 0;
     std::set<uint32_t> dirty_ GUARDED_BY(mu_);
 };

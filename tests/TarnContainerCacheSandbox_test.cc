@@ -61,6 +61,17 @@ TEST_F(SandboxUserStateTest, ABatchWritesOnceAtItsEnd) {
     }
     FileSandboxUserState restarted(dir());
     EXPECT_EQ(items(restarted, 501).size(), 100u);
+
+    // Re-pushing what is recorded (clear, then set the same path) writes nothing.
+    struct stat before, after;
+    ASSERT_EQ(::stat(state.fileForUID(501).c_str(), &before), 0);
+    {
+        SandboxUserState::Batch batch(restarted);
+        ASSERT_EQ(restarted.setUserStateItemWithPersona(501, 501, 1, "com.b7", nullptr), 0);
+        ASSERT_EQ(restarted.setUserStateItemWithPersona(501, 501, 1, "com.b7", "/p"), 0);
+    }
+    ASSERT_EQ(::stat(state.fileForUID(501).c_str(), &after), 0);
+    EXPECT_EQ(before.st_ino, after.st_ino);
 }
 
 TEST_F(SandboxUserStateTest, MalformedStateFilesCountAsEmpty) {
