@@ -5,7 +5,9 @@
 #include <filesystem>
 #include <fstream>
 
+#include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnFileManager.h"
+#include "Daemon/TarnSQLiteDB.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Daemon/TarnWhitelist.h"
@@ -282,6 +284,24 @@ TEST_F(TarnContainerCacheTest, InvalidationWithdrawsMappingsAndPosts) {
     EXPECT_TRUE(itemsOf(*state_, 501).empty());
     ASSERT_TRUE(lookup(2, "com.ostrea.inv", &code));
     EXPECT_EQ(cache_->TEST_rebuildCount(), 2u) << "the dictionary was dropped";
+}
+
+TEST_F(TarnContainerCacheTest, PublicOperationsOnTheMappingQueueStopTheProcess) {
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    root_.mkdirs("/private/var/root/Library/TarnKeeper");
+    auto mapping = std::make_unique<TarnCodeSigningMapping>(
+        nullptr, DispatchQueue::createSerial("com.ostrea.TarnKeeper.EntitlementQueue"),
+        TarnSQLiteDB::initWithParentDirectoryURL(root_.at("/private/var/root/Library/TarnKeeper")));
+    auto cache = TarnContainerCache::initWithUserIdentityCache(
+        TarnUserIdentitySharedCache::sharedInstance(), mapping.get(), *state_);
+    // Off the queue everything works.
+    TarnErrorRef error;
+    EXPECT_TRUE(cache->allContainersForUserIdentity(mobile(), 2, false, &error));
+    // On it, the rule would wait for the queue it runs on.
+    EXPECT_DEATH(mapping->queue()->sync([&] {
+        (void)cache->shouldRegisterSandboxMappingWithUserIdentity(mobile(), "com.x", 2);
+    }), "");
+    EXPECT_DEATH(mapping->queue()->sync([&] { cache->invalidateUserIdentity(mobile()); }), "");
 }
 
 // ---- The registration rule, with personas ----
