@@ -27,8 +27,9 @@ TarnApplicationTerminationAssertion::initWithBundleIdentifier(const std::string&
     auto self = std::make_unique<TarnApplicationTerminationAssertion>(PrivateTag{});
     TarnApplicationLifecycleService* service = lifecycleService();
     if (!service) {
-        TarnLog(kLogError, __func__,
-                "Attempted to use termination assertions without the application-lifecycle service");
+        TarnLog(
+            kLogError, __func__,
+            "Attempted to use termination assertions without the application-lifecycle service");
         return self;
     }
     // Shared with the callback, which may outlive a failed construction.

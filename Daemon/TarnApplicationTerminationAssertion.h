@@ -28,13 +28,13 @@ enum TarnTerminationReason : int64_t {
 
 // An assertion the service made; acquisition completes asynchronously.
 class TarnTerminationAssertionHandle {
-public:
+  public:
     virtual ~TarnTerminationAssertionHandle() = default;
     virtual void invalidate() = 0;
 };
 
 class TarnApplicationLifecycleService {
-public:
+  public:
     virtual ~TarnApplicationLifecycleService() = default;
     // Makes an assertion for `bundleIdentifier`, or nullptr. `acquired` is
     // called exactly once for a made assertion, on any thread, with nullopt on
@@ -47,7 +47,7 @@ public:
 class TarnApplicationTerminationAssertion {
     struct PrivateTag {};
 
-public:
+  public:
     // The platform's service; nullptr on Linux.
     static TarnApplicationLifecycleService* lifecycleService();
     // Tests: replaces the service (nullptr: not present).
@@ -61,7 +61,8 @@ public:
     explicit TarnApplicationTerminationAssertion(PrivateTag) {}
     ~TarnApplicationTerminationAssertion();
     TarnApplicationTerminationAssertion(const TarnApplicationTerminationAssertion&) = delete;
-    TarnApplicationTerminationAssertion& operator=(const TarnApplicationTerminationAssertion&) = delete;
+    TarnApplicationTerminationAssertion& operator=(const TarnApplicationTerminationAssertion&) =
+        delete;
 
     void invalidate();
     TarnTerminationAssertionHandle* termAssertion() const { return termAssertion_.get(); }
@@ -69,7 +70,7 @@ public:
         termAssertion_ = std::move(termAssertion);
     }
 
-private:
+  private:
     std::unique_ptr<TarnTerminationAssertionHandle> termAssertion_;
 };
 

@@ -31,23 +31,24 @@ TarnClientConnection::TarnClientConnection(TarnClientIdentityRef clientIdentity,
 
 TarnClientConnection::TarnClientConnection()
     : TarnClientConnection(TarnClientIdentity::anonymousPrivilegedClientIdentity(), true, false,
-                           true, std::nullopt, std::nullopt,
-                           std::make_shared<TarnCommandQueue>()) {}
+                           true, std::nullopt, std::nullopt, std::make_shared<TarnCommandQueue>()) {
+}
 
 std::shared_ptr<TarnClientConnection> TarnClientConnection::initWithClientIdentity(
-    TarnClientIdentityRef clientIdentity, bool entitled, bool allowOtherIdLookup,
-    bool unrestricted, std::optional<PlistValue> lookup,
-    std::optional<PlistValue> entitledWipeIdentifiers,
+    TarnClientIdentityRef clientIdentity, bool entitled, bool allowOtherIdLookup, bool unrestricted,
+    std::optional<PlistValue> lookup, std::optional<PlistValue> entitledWipeIdentifiers,
     std::shared_ptr<TarnCommandQueue> commandQueue) {
     return std::make_shared<TarnClientConnection>(
         std::move(clientIdentity), entitled, allowOtherIdLookup, unrestricted, std::move(lookup),
         std::move(entitledWipeIdentifiers), std::move(commandQueue));
 }
 
-std::shared_ptr<TarnClientConnection> TarnClientConnection::privilegedClientConnectionWithUserIdentity(
+std::shared_ptr<TarnClientConnection>
+TarnClientConnection::privilegedClientConnectionWithUserIdentity(
     std::shared_ptr<const TarnUserIdentity> userIdentity, bool kernel) {
     return std::make_shared<TarnClientConnection>(
-        TarnClientIdentity::privilegedClientIdentityWithUserIdentity(std::move(userIdentity), kernel),
+        TarnClientIdentity::privilegedClientIdentityWithUserIdentity(std::move(userIdentity),
+                                                                     kernel),
         true, true, true, std::nullopt, std::nullopt, std::make_shared<TarnCommandQueue>());
 }
 
@@ -57,10 +58,10 @@ namespace {
 
 // Keys of the lookup entitlement, by class number.
 const char* lookupKeyForContainerClass(TarnContainerClass containerClass) {
-    static const char* const kKeys[] = {nullptr,     "app",        "appData",        "plugin",
-                                        "pluginData", "vpn",       "vpnData",        "appGroup",
-                                        "framework", "conduitService", "daemon",     "tempDir",
-                                        "systemData", "systemGroup"};
+    static const char* const kKeys[] = {
+        nullptr,  "app",     "appData",    "plugin",     "pluginData",
+        "vpn",    "vpnData", "appGroup",   "framework",  "conduitService",
+        "daemon", "tempDir", "systemData", "systemGroup"};
     return containerClass < std::size(kKeys) ? kKeys[containerClass] : nullptr;
 }
 
@@ -107,7 +108,8 @@ bool TarnClientConnection::_lookupRuleCommon(TarnContainerClass containerClass,
     const std::string bundleIdentifier = clientBundleIdentifier();
     if (identifier == bundleIdentifier) return true;
     if (allowOtherIdLookup_) return true;
-    if (withGroupRule && TarnContainerClassIsGroup(containerClass) && allowGroupIdLookup_) return true;
+    if (withGroupRule && TarnContainerClassIsGroup(containerClass) && allowGroupIdLookup_)
+        return true;
     if (unrestricted_) return true;
     if (isEntitledForLookupWithClass(containerClass, identifier)) return true;
     return TarnWhitelist::sharedWhitelist().isLookupWhitelistedFromCodeSignIdentifier(
@@ -119,9 +121,10 @@ bool TarnClientConnection::_passesLookupRuleForContainerClass(TarnContainerClass
                                                               TarnErrorRef* error) {
     if (_lookupRuleCommon(containerClass, identifier, true)) return true;
     if (error)
-        *error = TARN_ERROR(TarnErrorNotEntitled, nullptr,
-                            "%@ not entitled to retrieve container class %ld with identifier %@",
-                            clientBundleIdentifier(), static_cast<int64_t>(containerClass), identifier);
+        *error =
+            TARN_ERROR(TarnErrorNotEntitled, nullptr,
+                       "%@ not entitled to retrieve container class %ld with identifier %@",
+                       clientBundleIdentifier(), static_cast<int64_t>(containerClass), identifier);
     return false;
 }
 
@@ -137,7 +140,8 @@ bool TarnClientConnection::_passesSystemDataGateForContainerClass(TarnContainerC
         return true;
     // Only a client whose signature asks for a system container gets its own.
     TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance();
-    if (mapping && identifier == bundleIdentifier && mapping->identifierHasSystemContainer(identifier))
+    if (mapping && identifier == bundleIdentifier &&
+        mapping->identifierHasSystemContainer(identifier))
         return true;
     if (error)
         *error = TARN_ERROR(TarnErrorNotEntitled, nullptr,
@@ -146,15 +150,15 @@ bool TarnClientConnection::_passesSystemDataGateForContainerClass(TarnContainerC
     return false;
 }
 
-bool TarnClientConnection::_passesGroupOwnerRuleForContainerClass(TarnContainerClass groupContainerClass,
-                                                                  const std::string& ownerIdentifier,
-                                                                  TarnErrorRef* error) {
+bool TarnClientConnection::_passesGroupOwnerRuleForContainerClass(
+    TarnContainerClass groupContainerClass, const std::string& ownerIdentifier,
+    TarnErrorRef* error) {
     if (_lookupRuleCommon(groupContainerClass, ownerIdentifier, false)) return true;
     if (error)
-        *error = TARN_ERROR(TarnErrorNotEntitled, nullptr,
-                            "%@ not entitled to retrieve group container class %ld with identifier %@",
-                            clientBundleIdentifier(), static_cast<int64_t>(groupContainerClass),
-                            ownerIdentifier);
+        *error = TARN_ERROR(
+            TarnErrorNotEntitled, nullptr,
+            "%@ not entitled to retrieve group container class %ld with identifier %@",
+            clientBundleIdentifier(), static_cast<int64_t>(groupContainerClass), ownerIdentifier);
     return false;
 }
 
@@ -194,13 +198,14 @@ void TarnClientConnection::deleteContainersOnDeathRowWithCompletion(
     transactionAsync(TarnDeathRowQueue(), [completion = std::move(completion)] {
         const FileURL deathRow = TarnGlobalConfiguration::sharedInstance().deathrowDirectory();
         TarnErrorRef listError;
-        auto items = TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow, &listError);
+        auto items =
+            TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow, &listError);
         uint64_t result = TarnSuccess;
         if (!items) {
             if (!(listError && listError->posixCode() == ENOENT)) {
-                TarnErrorRef e = TARN_ERROR(TarnErrorDeleteFailed, listError,
-                                            "Failed to get items for deletion: %@ : %@", deathRow,
-                                            listError);
+                TarnErrorRef e =
+                    TARN_ERROR(TarnErrorDeleteFailed, listError,
+                               "Failed to get items for deletion: %@ : %@", deathRow, listError);
                 result = e->code();
             }
         } else {
@@ -220,14 +225,17 @@ void TarnClientConnection::deleteContainersOnDeathRowWithCompletion(
 bool TarnClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& url, TarnErrorRef* error) {
     auto& fm = TarnFileManager::defaultManager();
     TarnErrorRef removeError;
-    if (fm.removeItemAtURL(url, &removeError) || (removeError && removeError->posixCode() == ENOENT))
+    if (fm.removeItemAtURL(url, &removeError) ||
+        (removeError && removeError->posixCode() == ENOENT))
         return true;
-    TarnLog(kLogDebug, __func__, "Couldn't remove, so moving item to /tmp: %@ : %@", url, removeError);
+    TarnLog(kLogDebug, __func__, "Couldn't remove, so moving item to /tmp: %@ : %@", url,
+            removeError);
 
     const FileURL tmp = RootPath("/tmp");
     TarnErrorRef moveError;
     if (fm.itemDoesNotExistAtURL(tmp))
-        (void)fm.createDirectoryAtURL(tmp, true, 01777, &moveError);  // the move reports any failure
+        (void)fm.createDirectoryAtURL(tmp, true, 01777,
+                                      &moveError);  // the move reports any failure
     FileURL destination = PathJoin(tmp, PathLastComponent(url));
     // Never replace something already in /tmp: a taken name goes into a fresh directory.
     if (!fm.itemDoesNotExistAtURL(destination)) {
@@ -237,8 +245,8 @@ bool TarnClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& url, Tarn
     if (!fm.moveItemAtURL(url, destination, &moveError)) {
         if (moveError && moveError->posixCode() == ENOENT) return true;
         if (error)
-            *error = TARN_ERROR(TarnErrorMoveFailed, moveError, "Failed to move dir: %@ to: %@", url,
-                                "/tmp");
+            *error = TARN_ERROR(TarnErrorMoveFailed, moveError, "Failed to move dir: %@ to: %@",
+                                url, "/tmp");
         return false;
     }
     return true;

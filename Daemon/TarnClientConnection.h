@@ -29,8 +29,8 @@
 #include "Daemon/TarnCommandQueue.h"
 #include "Daemon/TarnContainerClass.h"
 #include "Daemon/TarnError.h"
-#include "Platform/Path.h"
 #include "Platform/Dispatch.h"
+#include "Platform/Path.h"
 #include "Platform/PropertyList.h"
 #include "Platform/ThreadAnnotations.h"
 
@@ -42,7 +42,7 @@ class TarnUserIdentitySharedCache;
 using TarnLookupSet = std::shared_ptr<const std::set<std::string>>;
 
 class TarnClientConnection {
-public:
+  public:
     TarnClientConnection(TarnClientIdentityRef clientIdentity, bool entitled,
                          bool allowOtherIdLookup, bool unrestricted,
                          std::optional<PlistValue> lookup,
@@ -91,7 +91,8 @@ public:
     // when there is no entitlement or the class has no key (0, 14 and up).
     // A value that is not an array grants nothing (an empty set).
     TarnLookupSet _lookupForContainerClass(TarnContainerClass containerClass);
-    bool isEntitledForLookupWithClass(TarnContainerClass containerClass, const std::string& identifier);
+    bool isEntitledForLookupWithClass(TarnContainerClass containerClass,
+                                      const std::string& identifier);
     // The string members of the array; others are dropped.
     static std::set<std::string> _setOfStringsFromArray(const PlistArray& array);
 
@@ -133,7 +134,7 @@ public:
 
     static DispatchQueueRef _sharedBackgroundQueue();
 
-private:
+  private:
     // The lookup entitlement's value for a class key, or nullptr.
     const PlistValue* lookupValueForKey(const std::string& key) const;
     bool _lookupRuleCommon(TarnContainerClass containerClass, const std::string& identifier,

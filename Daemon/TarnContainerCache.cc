@@ -35,9 +35,9 @@ uint32_t sandboxUserForClass(const TarnUserIdentityRef& userIdentity, TarnContai
 }
 
 TarnErrorRef exceptionError(const char* function, int line, const std::exception* e) {
-    return TarnErrorMake(function, line, TarnErrorException, nullptr, true,
-                         Format("Got exception: %@ : %@", e ? e->what() : "unknown exception",
-                                "(no call stack)"));
+    return TarnErrorMake(
+        function, line, TarnErrorException, nullptr, true,
+        Format("Got exception: %@ : %@", e ? e->what() : "unknown exception", "(no call stack)"));
 }
 
 }  // namespace
@@ -130,7 +130,8 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
 
     TarnLog(kLogNotice, __func__, "Rebuilding container class cache: %@%@", key,
             transientMarker(transient));
-    SignpostInterval interval("cache", "RebuildingCache", {{"class", std::to_string(contentClass)}});
+    SignpostInterval interval("cache", "RebuildingCache",
+                              {{"class", std::to_string(contentClass)}});
     TarnTestLocks::sharedInstance().waitOnLock(kCacheTestGate);
     rebuildCount_.fetch_add(1);
 
@@ -143,7 +144,8 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
         return nullptr;
     }
     TarnErrorRef listError;
-    auto entries = TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(*directory, &listError);
+    auto entries =
+        TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(*directory, &listError);
     if (!entries) {
         if (error) *error = listError;
         return nullptr;
@@ -172,7 +174,8 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
         }
     }
     dictionaries[key] = dictionary;
-    interval.end({{"class", std::to_string(contentClass)}, {"count", std::to_string(dictionary->size())}});
+    interval.end(
+        {{"class", std::to_string(contentClass)}, {"count", std::to_string(dictionary->size())}});
     return dictionary;
 }
 
@@ -189,7 +192,8 @@ bool TarnContainerCache::shouldRegisterSandboxMappingWithUserIdentity(
     TarnContainerClass containerClass) {
     assertNotOnMappingQueue();
     MutexLock lock(cacheLock_);
-    return _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, containerClass);
+    return _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier,
+                                                              containerClass);
 }
 
 bool TarnContainerCache::_lock_shouldRegisterSandboxMappingWithUserIdentity(
@@ -223,7 +227,8 @@ bool TarnContainerCache::_shouldRegister(const TarnUserIdentityRef& userIdentity
                     owner = p;
                 }
             }
-            TarnUserIdentitySet owners = userIdentityCache_.userIdentitiesForBundleIdentifier(owner);
+            TarnUserIdentitySet owners =
+                userIdentityCache_.userIdentitiesForBundleIdentifier(owner);
             TarnUserIdentityRef personal = userIdentityCache_.userIdentityForPersonalPersona();
             if (owners.size() >= 2 && personal && owners.count(personal)) {
                 isMulti = true;
@@ -256,7 +261,8 @@ bool TarnContainerCache::setSandboxContainerMappingForUserIdentity(
     if (TarnContainerClassIsBundle(containerClass)) return true;
     if (!TarnContainerClassIsValid(containerClass) || !userIdentity) {
         PlatformLog("sandbox", PlatformLogType::Error,
-                    "Unsupported class for setting sandbox container mapping: %llu", containerClass);
+                    "Unsupported class for setting sandbox container mapping: %llu",
+                    containerClass);
         return false;
     }
     const uint32_t user = sandboxUserForClass(userIdentity, containerClass);
@@ -287,9 +293,10 @@ bool TarnContainerCache::setSandboxContainerMappingForUserIdentity(
             return false;
         }
     }
-    PlatformLog("sandbox", PlatformLogType::Default,
-                "Pushed user: %u, itemType: %llu, identifier %s, class: %llu, persona id: %d, path: %s",
-                user, itemType, identifier, containerClass, persona, path);
+    PlatformLog(
+        "sandbox", PlatformLogType::Default,
+        "Pushed user: %u, itemType: %llu, identifier %s, class: %llu, persona id: %d, path: %s",
+        user, itemType, identifier, containerClass, persona, path);
     return true;
 }
 
@@ -311,16 +318,18 @@ TarnMetadataRef TarnContainerCache::_lock_metadataFromSandboxForContainerIdentit
         user, [&](uint64_t itemType, const SandboxUserStateItem* item) {
             ++count;
             if (!item) {
-                PlatformLog("sandbox", PlatformLogType::Debug,
-                            "Sandbox kernel: Got an item iteration with no item struct; itemType = %llu",
-                            itemType);
+                PlatformLog(
+                    "sandbox", PlatformLogType::Debug,
+                    "Sandbox kernel: Got an item iteration with no item struct; itemType = %llu",
+                    itemType);
                 return;
             }
             if (itemType != wantedType) return;
             if (item->identifier.empty() || !item->path) {
-                PlatformLog("sandbox", PlatformLogType::Debug,
-                            "Sandbox kernel: Got an item with no identifier or path; itemType = %llu",
-                            itemType);
+                PlatformLog(
+                    "sandbox", PlatformLogType::Debug,
+                    "Sandbox kernel: Got an item with no identifier or path; itemType = %llu",
+                    itemType);
                 return;
             }
             if (containerClass == TarnContainerClassAppGroup &&
@@ -330,12 +339,10 @@ TarnMetadataRef TarnContainerCache::_lock_metadataFromSandboxForContainerIdentit
                              kSandboxIdentifierCompareLimit) == 0)
                 foundPath = item->path;
         });
-    auto endInterval = [&] {
-        interval.end({{"count", "<private>"}, {"identifier", "<private>"}});
-    };
+    auto endInterval = [&] { interval.end({{"count", "<private>"}, {"identifier", "<private>"}}); };
     if (result != 0) {
-        PlatformLog("sandbox", PlatformLogType::Error, "Failed to read back sandbox cache; result = %d",
-                    result);
+        PlatformLog("sandbox", PlatformLogType::Error,
+                    "Failed to read back sandbox cache; result = %d", result);
         endInterval();
         return nullptr;
     }
@@ -348,14 +355,16 @@ TarnMetadataRef TarnContainerCache::_lock_metadataFromSandboxForContainerIdentit
         TarnMetadata::readAndValidateMetadataAtUrl(*foundPath, userIdentity, true, &readError);
     TarnMetadataRef answer;
     if (!metadata) {
-        TarnLog(kLogError, __func__, "Could not validate container from Sandbox-provided path [%@]; error = %@",
+        TarnLog(kLogError, __func__,
+                "Could not validate container from Sandbox-provided path [%@]; error = %@",
                 *foundPath, readError);
     } else if (metadata->containerClass() != containerClass || metadata->identifier() != wanted) {
-        TarnLog(kLogError, __func__,
-                "Attempted to fetch container from Sandbox-provided path [%@] that was not what was "
-                "expected; expected class: %llu, expected identifier: [%@], actual class: %llu, actual "
-                "identifier: [%@]",
-                *foundPath, containerClass, wanted, metadata->containerClass(), metadata->identifier());
+        TarnLog(
+            kLogError, __func__,
+            "Attempted to fetch container from Sandbox-provided path [%@] that was not what was "
+            "expected; expected class: %llu, expected identifier: [%@], actual class: %llu, actual "
+            "identifier: [%@]",
+            *foundPath, containerClass, wanted, metadata->containerClass(), metadata->identifier());
     } else {
         TarnLog(kLogNotice, __func__, "Using container from sandbox kernel cache: %@", metadata);
         kernelHitCount_.fetch_add(1);
@@ -368,7 +377,8 @@ TarnMetadataRef TarnContainerCache::_lock_metadataFromSandboxForContainerIdentit
 // ---- Lookups ----
 
 TarnMetadataRef TarnContainerCache::containerForContainerIdentity(
-    const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox, TarnErrorRef* error) {
+    const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox,
+    TarnErrorRef* error) {
     return containerForContainerIdentity(identity, transient, updateSandbox, true, error);
 }
 
@@ -443,15 +453,17 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
     if (metadata->url().empty() || metadata->url()[0] != '/') {
         if (error)
             *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr,
-                                "Cache: %@%@: Invalid URL path string: %@", key, marker, metadata->url());
+                                "Cache: %@%@: Invalid URL path string: %@", key, marker,
+                                metadata->url());
         return nullptr;
     }
     const FileURL metadataFile = PathJoin(metadata->url(), kTarnMetadataFileName);
     if (!TarnFileManager::defaultManager().itemExistsAtURL(metadataFile)) {
         if (error)
-            *error = TARN_ERROR(TarnErrorCacheInconsistent, nullptr,
-                                "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu",
-                                key, marker, metadataFile, identifier, containerClass);
+            *error =
+                TARN_ERROR(TarnErrorCacheInconsistent, nullptr,
+                           "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu",
+                           key, marker, metadataFile, identifier, containerClass);
         TarnErrorRef removeError;
         if (!removeContainerForUserIdentity(userIdentity, containerClass, identifier, transient,
                                             &removeError)) {
@@ -512,14 +524,15 @@ std::optional<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersFor
         std::unordered_set<const TarnContainerClassCache*> seen;
         for (const auto& identity : identities) {
             TarnErrorRef buildError;
-            auto dictionary = _lock_getCacheForUserIdentity(identity, contentClass, transient,
-                                                            populateSandboxCache, true, &buildError);
+            auto dictionary = _lock_getCacheForUserIdentity(
+                identity, contentClass, transient, populateSandboxCache, true, &buildError);
             if (!dictionary) {
                 const char* relative = TarnContainerClassRelativeDirectory(contentClass);
                 if (error)
-                    *error = TARN_ERROR(TarnErrorCacheRebuildFailed, buildError,
-                                        "Cache: [%@]-%@%@: Failed to rebuild",
-                                        identity ? identity->identifier() : "(null)", relative, marker);
+                    *error =
+                        TARN_ERROR(TarnErrorCacheRebuildFailed, buildError,
+                                   "Cache: [%@]-%@%@: Failed to rebuild",
+                                   identity ? identity->identifier() : "(null)", relative, marker);
                 return std::nullopt;
             }
             // Global classes answer one dictionary for every identity.
@@ -548,10 +561,11 @@ std::optional<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersFor
             TarnErrorRef removeError;
             if (!removeContainerForUserIdentity(metadata->userIdentity(), contentClass,
                                                 metadata->identifier(), transient, &removeError)) {
-                TarnLog(kLogError, __func__,
-                        "Failed to remove from cache user: %@, id: %@, class: %llu, transient: %d : %@",
-                        metadata->userIdentity(), metadata->identifier(), contentClass, transient,
-                        removeError);
+                TarnLog(
+                    kLogError, __func__,
+                    "Failed to remove from cache user: %@, id: %@, class: %llu, transient: %d : %@",
+                    metadata->userIdentity(), metadata->identifier(), contentClass, transient,
+                    removeError);
             }
             continue;
         }
@@ -565,19 +579,20 @@ std::optional<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersFor
 // ---- Changes ----
 
 bool TarnContainerCache::addContainerMetadata(const TarnMetadataRef& metadata, const FileURL& url,
-                                              bool transient, bool updateSandbox, TarnErrorRef* error) {
+                                              bool transient, bool updateSandbox,
+                                              TarnErrorRef* error) {
     assertNotOnMappingQueue();
     if (!metadata || !TarnContainerClassIsValid(metadata->containerClass())) {
         if (error)
-            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr,
-                                "Invalid Metadata Content Class: %lld",
-                                metadata ? static_cast<int64_t>(metadata->containerClass()) : int64_t{0});
+            *error = TARN_ERROR(
+                TarnErrorCacheInvalidInput, nullptr, "Invalid Metadata Content Class: %lld",
+                metadata ? static_cast<int64_t>(metadata->containerClass()) : int64_t{0});
         return false;
     }
     if (metadata->identifier().empty()) {
         if (error)
-            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid metadata Identifier: %@",
-                                metadata->identifier());
+            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr,
+                                "Invalid metadata Identifier: %@", metadata->identifier());
         return false;
     }
     if (url.empty() || url[0] != '/') {
@@ -609,8 +624,8 @@ bool TarnContainerCache::addContainerMetadata(const TarnMetadataRef& metadata, c
         stored->setUrl(url);
         (*dictionary)[identifier] = stored;
         if (updateSandbox)
-            shouldRegister =
-                _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, containerClass);
+            shouldRegister = _lock_shouldRegisterSandboxMappingWithUserIdentity(
+                userIdentity, identifier, containerClass);
     }
     if (updateSandbox && !transient && shouldRegister &&
         !setSandboxContainerMappingForUserIdentity(userIdentity, identifier, containerClass, url)) {
@@ -625,8 +640,8 @@ bool TarnContainerCache::addContainerMetadata(const TarnMetadataRef& metadata, c
 
 bool TarnContainerCache::removeContainerForUserIdentity(const TarnUserIdentityRef& userIdentity,
                                                         TarnContainerClass contentClass,
-                                                        const std::string& identifier, bool transient,
-                                                        TarnErrorRef* error) {
+                                                        const std::string& identifier,
+                                                        bool transient, TarnErrorRef* error) {
     assertNotOnMappingQueue();
     if (!TarnContainerClassIsValid(contentClass)) {
         if (error)
@@ -636,26 +651,27 @@ bool TarnContainerCache::removeContainerForUserIdentity(const TarnUserIdentityRe
     }
     if (identifier.empty()) {
         if (error)
-            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Identifier: %@", identifier);
+            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Identifier: %@",
+                                identifier);
         return false;
     }
     bool shouldRegister = false;
     {
         MutexLock lock(cacheLock_);
         TarnErrorRef buildError;
-        auto dictionary = _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, &buildError);
+        auto dictionary =
+            _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, &buildError);
         if (!dictionary) {
             if (error)
-                *error = TARN_ERROR(TarnErrorCacheRebuildFailed, buildError,
-                                    "Cache: [%@]-%@%@: Failed to rebuild",
-                                    userIdentity ? userIdentity->identifier() : "(null)",
-                                    TarnContainerClassRelativeDirectory(contentClass),
-                                    transientMarker(transient));
+                *error = TARN_ERROR(
+                    TarnErrorCacheRebuildFailed, buildError, "Cache: [%@]-%@%@: Failed to rebuild",
+                    userIdentity ? userIdentity->identifier() : "(null)",
+                    TarnContainerClassRelativeDirectory(contentClass), transientMarker(transient));
             return false;
         }
         dictionary->erase(identifier);
-        shouldRegister =
-            _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, contentClass);
+        shouldRegister = _lock_shouldRegisterSandboxMappingWithUserIdentity(
+            userIdentity, identifier, contentClass);
     }
     if (shouldRegister && !transient &&
         !setSandboxContainerMappingForUserIdentity(userIdentity, identifier, contentClass,

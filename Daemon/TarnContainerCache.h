@@ -63,7 +63,7 @@ class TarnContainerCache : public TarnUserIdentityCacheObserver,
                            public std::enable_shared_from_this<TarnContainerCache> {
     struct PrivateTag {};
 
-public:
+  public:
     // Over TarnUserIdentitySharedCache, the shared code-signing mapping (which
     // may be absent: then no parent identifiers are used) and the shared
     // sandbox state. One per root prefix.
@@ -79,7 +79,8 @@ public:
         SandboxUserState& sandboxUserState);
 
     TarnContainerCache(PrivateTag, TarnUserIdentityCache& userIdentityCache,
-                       TarnCodeSigningMapping* codeSigningMapping, SandboxUserState& sandboxUserState);
+                       TarnCodeSigningMapping* codeSigningMapping,
+                       SandboxUserState& sandboxUserState);
     ~TarnContainerCache() override;
     TarnContainerCache(const TarnContainerCache&) = delete;
     TarnContainerCache& operator=(const TarnContainerCache&) = delete;
@@ -162,16 +163,13 @@ public:
     // Waits for invalidations queued by observer callbacks.
     void TEST_drainInvalidations();
 
-private:
-    TarnContainerClassCacheRef _lock_getCacheForUserIdentity(const TarnUserIdentityRef& userIdentity,
-                                                             TarnContainerClass contentClass,
-                                                             bool transient, bool populateSandboxCache,
-                                                             bool buildCache, TarnErrorRef* error)
-        REQUIRES(cacheLock_);
-    TarnContainerClassCacheRef _lock_getCacheForUserIdentity(const TarnUserIdentityRef& userIdentity,
-                                                             TarnContainerClass contentClass,
-                                                             bool transient, TarnErrorRef* error)
-        REQUIRES(cacheLock_);
+  private:
+    TarnContainerClassCacheRef _lock_getCacheForUserIdentity(
+        const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
+        bool populateSandboxCache, bool buildCache, TarnErrorRef* error) REQUIRES(cacheLock_);
+    TarnContainerClassCacheRef _lock_getCacheForUserIdentity(
+        const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
+        TarnErrorRef* error) REQUIRES(cacheLock_);
     TarnMetadataRef _lock_metadataFromSandboxForContainerIdentity(
         const TarnContainerIdentityRef& identity) REQUIRES(cacheLock_);
     void _lock_forEachContainerInContainerCache(

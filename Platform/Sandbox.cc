@@ -74,7 +74,7 @@ int bootKey(std::array<uint8_t, kKeyBytes>* key) {
     if (!err && ::fsync(fd) != 0) err = errno;
     ::close(fd);
     if (!err && ::link(tmp.c_str(), path.c_str()) != 0) err = errno;
-    (void)::unlink(tmp.c_str());  // the name under `path` is what counts
+    (void)::unlink(tmp.c_str());                   // the name under `path` is what counts
     if (err == EEXIST) return readKey(path, key);  // another user made it first
     return err;
 }

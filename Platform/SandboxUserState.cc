@@ -80,7 +80,8 @@ SandboxUserState& SandboxUserState::sharedInstance() {
     static auto& made = *new std::vector<std::unique_ptr<FileSandboxUserState>>();
     std::lock_guard<std::mutex> guard(lock);
     if (made.empty() || root != RootPrefix()) {
-        made.push_back(std::make_unique<FileSandboxUserState>(FileSandboxUserState::defaultDirectory()));
+        made.push_back(
+            std::make_unique<FileSandboxUserState>(FileSandboxUserState::defaultDirectory()));
         root = RootPrefix();
     }
     return *made.back();
@@ -112,11 +113,11 @@ FileSandboxUserState::Table& FileSandboxUserState::_lock_tableForUID(uint32_t ui
     }
     std::string why;
     auto root = PlistValue::fromBytes(bytes.data(), bytes.size(), &why);
-    const PlistArray* items = root ? (root->find("Items") ? root->find("Items")->asArray() : nullptr)
-                                   : nullptr;
+    const PlistArray* items =
+        root ? (root->find("Items") ? root->find("Items")->asArray() : nullptr) : nullptr;
     if (!items) {
-        PlatformLog("sandbox", PlatformLogType::Error, "Ignoring malformed sandbox state %s: %s", file,
-                    why.empty() ? std::string("no item list") : why);
+        PlatformLog("sandbox", PlatformLogType::Error, "Ignoring malformed sandbox state %s: %s",
+                    file, why.empty() ? std::string("no item list") : why);
         return table;
     }
     for (const PlistValue& item : *items) {
@@ -128,7 +129,8 @@ FileSandboxUserState::Table& FileSandboxUserState::_lock_tableForUID(uint32_t ui
         auto p = persona ? persona->asUInt64() : std::nullopt;
         if (!t || !p || *p > UINT32_MAX || !identifier || !identifier->asString() || !path ||
             !path->asString() || identifier->asString()->empty()) {
-            PlatformLog("sandbox", PlatformLogType::Error, "Skipping malformed sandbox item in %s", file);
+            PlatformLog("sandbox", PlatformLogType::Error, "Skipping malformed sandbox item in %s",
+                        file);
             continue;
         }
         table[Key{*t, *identifier->asString(), static_cast<uint32_t>(*p)}] = *path->asString();

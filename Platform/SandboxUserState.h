@@ -54,7 +54,7 @@ struct SandboxUserStateItem {
 };
 
 class SandboxUserState {
-public:
+  public:
     // Called once per item; `item` may be null (the kernel may report a
     // slot without an item struct).
     using ItemCallback = std::function<void(uint64_t itemType, const SandboxUserStateItem* item)>;
@@ -78,19 +78,19 @@ public:
     virtual int endBatch() { return 0; }
 
     class Batch {
-    public:
+      public:
         explicit Batch(SandboxUserState& state) : state_(state) { state_.beginBatch(); }
         ~Batch() { (void)state_.endBatch(); }  // failures are logged by the state itself
         Batch(const Batch&) = delete;
         Batch& operator=(const Batch&) = delete;
 
-    private:
+      private:
         SandboxUserState& state_;
     };
 };
 
 class FileSandboxUserState : public SandboxUserState {
-public:
+  public:
     // `directory`: where the per-user files live (created on first write).
     explicit FileSandboxUserState(FileURL directory);
     // DIR/run/tarnkeeper/sandbox below the current root prefix.
@@ -105,9 +105,9 @@ public:
     const FileURL& directory() const { return directory_; }
     FileURL fileForUID(uint32_t uid) const;
 
-private:
+  private:
     using Key = std::tuple<uint64_t, std::string, uint32_t>;  // type, identifier, persona
-    using Table = std::map<Key, std::string>;                   // -> path
+    using Table = std::map<Key, std::string>;                 // -> path
 
     Table& _lock_tableForUID(uint32_t uid) REQUIRES(mu_);
     int _lock_writeTable(uint32_t uid) REQUIRES(mu_);

@@ -91,7 +91,8 @@ int main(int argc, char** argv) {
 
     auto user = tarn::TarnUserIdentityCache::defaultUserIdentity();
     const std::string base =
-        *tarn::TarnGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(user, 2, false);
+        *tarn::TarnGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
+            user, 2, false);
     std::vector<std::string> identifiers;
     std::vector<std::string> metadataFiles;
     for (int i = 0; i < containers; ++i) {
@@ -101,7 +102,8 @@ int main(int argc, char** argv) {
         std::string identifier = "com.bench.app" + std::to_string(i);
         auto identity = tarn::TarnConcreteContainerIdentity::containerIdentityWithUUID(
             uuid, user, identifier, 2, nullptr);
-        auto m = tarn::TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir, std::nullopt);
+        auto m = tarn::TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir,
+                                                               std::nullopt);
         if (!m->writeMetadataToDiskWithError(nullptr)) return 1;
         identifiers.push_back(identifier);
         metadataFiles.push_back(dir + "/" + tarn::kTarnMetadataFileName);
@@ -150,8 +152,8 @@ int main(int argc, char** argv) {
         auto t0 = Clock::now();
         for (int i = 0; i < chunk; ++i) {
             tarn::TarnErrorRef error;
-            hits += cache->containerForContainerIdentity(probes[(done + i) % containers], false, true,
-                                                         &error) != nullptr;
+            hits += cache->containerForContainerIdentity(probes[(done + i) % containers], false,
+                                                         true, &error) != nullptr;
         }
         auto t1 = Clock::now();
         for (int i = 0; i < chunk; ++i) {
@@ -173,15 +175,18 @@ int main(int argc, char** argv) {
         auto t1 = Clock::now();
         std::vector<tarn::TarnMetadataRef> read;
         for (const auto& url : *urls)
-            read.push_back(tarn::TarnMetadata::readAndValidateMetadataAtUrl(url, user, true, nullptr));
+            read.push_back(
+                tarn::TarnMetadata::readAndValidateMetadataAtUrl(url, user, true, nullptr));
         auto t2 = Clock::now();
         size_t yes = 0;
-        for (const auto& m : read) yes += cache->shouldRegisterSandboxMappingWithUserIdentity(user, m->identifier(), 2);
+        for (const auto& m : read)
+            yes += cache->shouldRegisterSandboxMappingWithUserIdentity(user, m->identifier(), 2);
         auto t3 = Clock::now();
         {
             tarn::SandboxUserState::Batch batch(state);
             for (const auto& m : read)
-                cache->setSandboxContainerMappingForUserIdentity(user, m->identifier(), 2, m->url());
+                cache->setSandboxContainerMappingForUserIdentity(user, m->identifier(), 2,
+                                                                 m->url());
         }
         auto t4 = Clock::now();
         listMs = ms(t1 - t0), readMs = ms(t2 - t1), ruleMs = ms(t3 - t2), pushMs = ms(t4 - t3);
@@ -196,8 +201,9 @@ int main(int argc, char** argv) {
     std::printf("readdir + open/read   : %9.3f ms  (%zu bytes)\n", bare, bareBytes);
     std::printf("ratio rebuild/bare    : %.2f %s\n", rebuild / bare,
                 rebuild / bare <= 1.5 ? "(target 1.5 met)" : "(target 1.5 MISSED)");
-    std::printf("  of which: listing %.1f ms, metadata reads %.1f ms, rule %.1f ms, pushes %.1f ms\n",
-                listMs, readMs, ruleMs, pushMs);
+    std::printf(
+        "  of which: listing %.1f ms, metadata reads %.1f ms, rule %.1f ms, pushes %.1f ms\n",
+        listMs, readMs, ruleMs, pushMs);
     std::printf("cached lookup         : %9.1f ns\n", lookup);
     std::printf("map + lstat           : %9.1f ns\n", bareLookup);
     std::printf("ratio lookup/bare     : %.2f %s\n", lookup / bareLookup,

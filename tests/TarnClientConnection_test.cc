@@ -12,7 +12,7 @@ namespace tarn {
 namespace {
 
 class TarnClientConnectionTest : public test::ScratchRootTest {
-protected:
+  protected:
     void SetUp() override { TarnUserIdentityCache::TEST_setPersonasAreSupported(false); }
     void TearDown() override { TarnUserIdentityCache::TEST_setPersonasAreSupported(std::nullopt); }
 
@@ -49,7 +49,8 @@ TEST_F(TarnClientConnectionTest, LookupEntitlementTakesOnlyArraysOfStrings) {
     EXPECT_TRUE(c->isEntitledForLookupWithClass(4, "com.b.ext"));
     EXPECT_FALSE(c->isEntitledForLookupWithClass(4, "7"));
 
-    for (TarnContainerClass c0 : {0ull, 14ull, 99ull}) EXPECT_FALSE(c->_lookupForContainerClass(c0)) << c0;
+    for (TarnContainerClass c0 : {0ull, 14ull, 99ull})
+        EXPECT_FALSE(c->_lookupForContainerClass(c0)) << c0;
     EXPECT_FALSE(caller("com.client")->_lookupForContainerClass(2)) << "no entitlement, no set";
 
     // Concurrent first use of one key hands every thread the same set.
@@ -63,10 +64,13 @@ TEST_F(TarnClientConnectionTest, LookupEntitlementTakesOnlyArraysOfStrings) {
 }
 
 TEST_F(TarnClientConnectionTest, LookupRuleGrantsInOrderAndRefusesWith55) {
-    auto c = caller("com.client", PlistValue(PlistDict{{"appGroup", PlistValue(PlistArray{PlistValue("group.a")})}}));
+    auto c =
+        caller("com.client",
+               PlistValue(PlistDict{{"appGroup", PlistValue(PlistArray{PlistValue("group.a")})}}));
     TarnErrorRef error;
     EXPECT_TRUE(c->_passesLookupRuleForContainerClass(2, "com.client", &error)) << "own identifier";
-    EXPECT_TRUE(c->_passesLookupRuleForContainerClass(7, "group.a", &error)) << "lookup entitlement";
+    EXPECT_TRUE(c->_passesLookupRuleForContainerClass(7, "group.a", &error))
+        << "lookup entitlement";
     EXPECT_FALSE(c->_passesLookupRuleForContainerClass(2, "com.other", &error));
     EXPECT_EQ(codeOf(error), TarnErrorNotEntitled);
     EXPECT_EQ(error->localizedDescription(),
@@ -79,8 +83,9 @@ TEST_F(TarnClientConnectionTest, LookupRuleGrantsInOrderAndRefusesWith55) {
     EXPECT_TRUE(c->_passesLookupRuleForContainerClass(7, "group.b", &error));
     EXPECT_FALSE(c->_passesLookupRuleForContainerClass(2, "com.other", &error));
     EXPECT_FALSE(c->_passesGroupOwnerRuleForContainerClass(7, "com.owner", &error));
-    EXPECT_EQ(error->localizedDescription(),
-              "com.client not entitled to retrieve group container class 7 with identifier com.owner");
+    EXPECT_EQ(
+        error->localizedDescription(),
+        "com.client not entitled to retrieve group container class 7 with identifier com.owner");
     EXPECT_TRUE(c->_passesGroupOwnerRuleForContainerClass(7, "com.client", &error));
 
     c->setAllowOtherIdLookup(true);
@@ -105,12 +110,14 @@ TEST_F(TarnClientConnectionTest, OwnSystemContainerNeedsTheSignatureOrTheList) {
     EXPECT_FALSE(c->_passesSystemDataGateForContainerClass(12, "com.ostrea.daemonish", &error));
     EXPECT_EQ(codeOf(error), TarnErrorNotEntitled);
     EXPECT_EQ(error->localizedDescription(),
-              "com.ostrea.daemonish not entitled for system container with identifier com.ostrea.daemonish");
+              "com.ostrea.daemonish not entitled for system container with identifier "
+              "com.ostrea.daemonish");
     EXPECT_TRUE(c->_passesSystemDataGateForContainerClass(2, "com.ostrea.daemonish", &error))
         << "only class 12 has the second gate";
 
-    auto entitled = caller("com.client", PlistValue(PlistDict{
-                                             {"systemData", PlistValue(PlistArray{PlistValue("com.sys")})}}));
+    auto entitled = caller(
+        "com.client",
+        PlistValue(PlistDict{{"systemData", PlistValue(PlistArray{PlistValue("com.sys")})}}));
     EXPECT_TRUE(entitled->_passesSystemDataGateForContainerClass(12, "com.sys", &error));
 }
 

@@ -18,15 +18,19 @@ namespace fs = std::filesystem;
 
 std::vector<std::string> items(SandboxUserState& state, uint32_t uid) {
     std::vector<std::string> out;
-    EXPECT_EQ(state.iterateUserStateItems(uid, [&](uint64_t type, const SandboxUserStateItem* item) {
-        out.push_back(std::to_string(type) + ":" + item->identifier + ":" +
-                      std::to_string(item->personaID) + "=" + item->path.value_or("-"));
-    }), 0);
+    EXPECT_EQ(state.iterateUserStateItems(uid,
+                                          [&](uint64_t type, const SandboxUserStateItem* item) {
+                                              out.push_back(std::to_string(type) + ":" +
+                                                            item->identifier + ":" +
+                                                            std::to_string(item->personaID) + "=" +
+                                                            item->path.value_or("-"));
+                                          }),
+              0);
     return out;
 }
 
 class SandboxUserStateTest : public test::ScratchRootTest {
-protected:
+  protected:
     void SetUp() override { PlatformLogSetQuiet(true); }
     void TearDown() override { PlatformLogSetQuiet(false); }
     FileURL dir() const { return FileSandboxUserState::defaultDirectory(); }
@@ -44,7 +48,8 @@ TEST_F(SandboxUserStateTest, ItemsSurviveANewInstanceAndClearsAreDurable) {
         EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "", "/x"), EINVAL);
     }
     FileSandboxUserState restarted(dir());
-    EXPECT_EQ(items(restarted, 501), (std::vector<std::string>{"1:com.a:900=/e/A", "2:group.g:501=/c/G"}));
+    EXPECT_EQ(items(restarted, 501),
+              (std::vector<std::string>{"1:com.a:900=/e/A", "2:group.g:501=/c/G"}));
     EXPECT_EQ(items(restarted, 0), (std::vector<std::string>{"4:com.sys:501=/s"}));
     EXPECT_TRUE(items(restarted, 777).empty());
     EXPECT_TRUE(fs::exists(dir())) << "state lives below the root's run directory";
@@ -55,7 +60,9 @@ TEST_F(SandboxUserStateTest, ABatchWritesOnceAtItsEnd) {
     {
         SandboxUserState::Batch batch(state);
         for (int i = 0; i < 100; ++i)
-            ASSERT_EQ(state.setUserStateItemWithPersona(501, 501, 1, ("com.b" + std::to_string(i)).c_str(), "/p"), 0);
+            ASSERT_EQ(state.setUserStateItemWithPersona(
+                          501, 501, 1, ("com.b" + std::to_string(i)).c_str(), "/p"),
+                      0);
         EXPECT_FALSE(fs::exists(state.fileForUID(501))) << "nothing written inside the batch";
         EXPECT_EQ(items(state, 501).size(), 100u) << "but visible at once";
     }
@@ -97,7 +104,8 @@ TEST_F(SandboxExtensionTest, TokensBindClassPathAndProcess) {
     ASSERT_TRUE(token) << error;
     EXPECT_EQ(token->rfind("1;com.ostrea.sandbox.container;", 0), 0u);
     EXPECT_TRUE(SandboxExtensionVerify(*token, kSandboxExtensionClassContainer, "/c/A;B", me));
-    EXPECT_FALSE(SandboxExtensionVerify(*token, kSandboxExtensionClassApplicationGroup, "/c/A;B", me));
+    EXPECT_FALSE(
+        SandboxExtensionVerify(*token, kSandboxExtensionClassApplicationGroup, "/c/A;B", me));
     EXPECT_FALSE(SandboxExtensionVerify(*token, kSandboxExtensionClassContainer, "/c/A", me));
     EXPECT_FALSE(SandboxExtensionVerify(*token, kSandboxExtensionClassContainer, "/c/A;B", other));
     std::string forged = *token;

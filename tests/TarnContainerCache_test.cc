@@ -7,8 +7,8 @@
 
 #include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnFileManager.h"
-#include "Daemon/TarnSQLiteDB.h"
 #include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnSQLiteDB.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Daemon/TarnWhitelist.h"
 #include "Platform/ContainerLibrary.h"
@@ -22,14 +22,14 @@ namespace {
 
 // The file-backed state with set calls that can be made to fail.
 class FaultySandboxUserState : public FileSandboxUserState {
-public:
+  public:
     using FileSandboxUserState::FileSandboxUserState;
     int setUserStateItemWithPersona(uint32_t uid, uint32_t personaID, uint64_t itemType,
                                     const char* identifier, const char* path) override {
         ++sets;
         if (failSets) return EIO;
-        return FileSandboxUserState::setUserStateItemWithPersona(uid, personaID, itemType, identifier,
-                                                                 path);
+        return FileSandboxUserState::setUserStateItemWithPersona(uid, personaID, itemType,
+                                                                 identifier, path);
     }
     bool failSets = false;
     int sets = 0;
@@ -39,14 +39,14 @@ public:
 std::map<std::string, std::string> itemsOf(SandboxUserState& state, uint32_t uid) {
     std::map<std::string, std::string> items;
     state.iterateUserStateItems(uid, [&](uint64_t type, const SandboxUserStateItem* item) {
-        items[std::to_string(type) + ":" + item->identifier + ":" + std::to_string(item->personaID)] =
-            item->path.value_or("");
+        items[std::to_string(type) + ":" + item->identifier + ":" +
+              std::to_string(item->personaID)] = item->path.value_or("");
     });
     return items;
 }
 
 class TarnContainerCacheTest : public test::ScratchRootTest {
-protected:
+  protected:
     void SetUp() override {
         TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
         PlatformLogSetQuiet(true);
@@ -59,8 +59,8 @@ protected:
     }
 
     std::shared_ptr<TarnContainerCache> makeCache() {
-        return TarnContainerCache::initWithUserIdentityCache(TarnUserIdentitySharedCache::sharedInstance(),
-                                                             nullptr, *state_);
+        return TarnContainerCache::initWithUserIdentityCache(
+            TarnUserIdentitySharedCache::sharedInstance(), nullptr, *state_);
     }
 
     TarnUserIdentityRef mobile() { return TarnUserIdentityCache::defaultUserIdentity(); }
@@ -96,7 +96,8 @@ protected:
     TarnMetadataRef lookup(TarnContainerClass c, const std::string& identifier, uint64_t* code,
                            bool transient = false) {
         TarnErrorRef error;
-        auto m = cache_->containerForContainerIdentity(identity(c, identifier), transient, true, &error);
+        auto m =
+            cache_->containerForContainerIdentity(identity(c, identifier), transient, true, &error);
         *code = m ? TarnSuccess : (error ? error->code() : 0);
         return m;
     }
@@ -119,7 +120,8 @@ TEST_F(TarnContainerCacheTest, MetadataDeletedBehindTheDaemonGives44ThenNotFound
     EXPECT_EQ(code, TarnErrorCacheInconsistent);
     EXPECT_FALSE(lookup(2, "com.ostrea.notes", &code));
     EXPECT_EQ(code, TarnErrorNotFound);
-    EXPECT_EQ(cache_->TEST_rebuildCount(), 1u) << "the key's dictionary stays; nothing is rescanned";
+    EXPECT_EQ(cache_->TEST_rebuildCount(), 1u)
+        << "the key's dictionary stays; nothing is rescanned";
     EXPECT_TRUE(itemsOf(*state_, 501).empty()) << "the stale mapping is withdrawn";
 }
 
@@ -148,12 +150,14 @@ TEST_F(TarnContainerCacheTest, OnlyUUIDNamesCountExceptWellKnownSystemContainers
     if (wellKnown.empty()) GTEST_SKIP() << "the well-known list names no system container";
     const std::string id = wellKnown.front();
     EXPECT_TRUE(cache_->containerURL("/x/" + id, 12));
-    EXPECT_FALSE(cache_->containerURL("/x/" + id, 2)) << "well-known names count for system classes only";
+    EXPECT_FALSE(cache_->containerURL("/x/" + id, 2))
+        << "well-known names count for system classes only";
     makeContainer(12, id, false, id);
     auto found = lookup(12, id, &code);
     ASSERT_TRUE(found) << code;
     EXPECT_EQ(PathLastComponent(found->url()), id);
-    EXPECT_EQ(itemsOf(*state_, 0).count("4:" + id + ":501"), 1u) << "system containers are filed under user 0";
+    EXPECT_EQ(itemsOf(*state_, 0).count("4:" + id + ":501"), 1u)
+        << "system containers are filed under user 0";
 }
 
 TEST_F(TarnContainerCacheTest, AddBeforeTheClassWasBuiltRecordsNothing) {
@@ -183,7 +187,8 @@ TEST_F(TarnContainerCacheTest, TransientContainersAreNeverPushed) {
     auto extra = makeContainer(2, "com.ostrea.temp2", true);
     TarnErrorRef error;
     ASSERT_TRUE(cache_->addContainerMetadata(extra, extra->url(), true, true, &error));
-    ASSERT_TRUE(cache_->removeContainerForUserIdentity(mobile(), 2, "com.ostrea.temp", true, &error));
+    ASSERT_TRUE(
+        cache_->removeContainerForUserIdentity(mobile(), 2, "com.ostrea.temp", true, &error));
     EXPECT_EQ(state_->sets, 0);
     EXPECT_FALSE(lookup(2, "com.ostrea.temp", &code, false)) << "live and transient are apart";
 }
@@ -214,7 +219,9 @@ TEST_F(TarnContainerCacheTest, ASandboxPathThatNoLongerHoldsTheContainerIsNotTru
     auto made = makeContainer(2, "com.ostrea.moved");
     auto decoy = makeContainer(2, "com.ostrea.decoy");
     // The state claims the decoy's directory for "moved".
-    ASSERT_EQ(state_->setUserStateItemWithPersona(501, 501, 1, "com.ostrea.moved", decoy->url().c_str()), 0);
+    ASSERT_EQ(
+        state_->setUserStateItemWithPersona(501, 501, 1, "com.ostrea.moved", decoy->url().c_str()),
+        0);
     uint64_t code = 0;
     auto found = lookup(2, "com.ostrea.moved", &code);
     ASSERT_TRUE(found) << code;
@@ -266,8 +273,8 @@ TEST_F(TarnContainerCacheTest, ConcreteLookupMatchesTheUUIDAndMarksTransience) {
     ASSERT_TRUE(b);
     EXPECT_TRUE(b->transient());
     EXPECT_EQ(b->url(), transient->url());
-    auto other = TarnConcreteContainerIdentity::containerIdentityWithUUID(Uuid::generate(), mobile(),
-                                                                          "com.ostrea.c", 2, nullptr);
+    auto other = TarnConcreteContainerIdentity::containerIdentityWithUUID(
+        Uuid::generate(), mobile(), "com.ostrea.c", 2, nullptr);
     EXPECT_FALSE(cache_->containerForContainerIdentity(other));
 }
 
@@ -300,7 +307,8 @@ TEST_F(TarnContainerCacheTest, PublicOperationsOnTheMappingQueueStopTheProcess) 
     // On it, the rule would wait for the queue it runs on.
     EXPECT_DEATH(mapping->queue()->sync([&] {
         (void)cache->shouldRegisterSandboxMappingWithUserIdentity(mobile(), "com.x", 2);
-    }), "");
+    }),
+                 "");
     EXPECT_DEATH(mapping->queue()->sync([&] { cache->invalidateUserIdentity(mobile()); }), "");
 }
 
@@ -319,7 +327,7 @@ PersonaAttributesRef persona(Kind kind, std::optional<std::string> unique, uint3
 }
 
 class TarnContainerCacheRegistrationTest : public test::ScratchRootTest {
-protected:
+  protected:
     void SetUp() override {
         TarnUserIdentityCache::TEST_setPersonasAreSupported(true);
         PlatformLogSetQuiet(true);
@@ -372,9 +380,10 @@ TEST_F(TarnContainerCacheRegistrationTest, DecisionsByClassAndPersona) {
 }
 
 TEST_F(TarnContainerCacheRegistrationTest, EnterpriseGroupIsPushedUnderItsPersona) {
-    auto dir = PathJoin(*TarnGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
-                            enterprise_, 7, false),
-                        Uuid::generate().string());
+    auto dir =
+        PathJoin(*TarnGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
+                     enterprise_, 7, false),
+                 Uuid::generate().string());
     std::filesystem::create_directories(dir);
     auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
         Uuid::generate(), enterprise_, "group.corp", 7, nullptr);
@@ -387,7 +396,8 @@ TEST_F(TarnContainerCacheRegistrationTest, EnterpriseGroupIsPushedUnderItsPerson
 
     // An enterprise flush drops the identity's dictionaries through the observer.
     identities_->flush();
-    (void)identities_->userIdentityForPersonalPersona();  // rebuilds, which reports the dropped identities
+    (void)identities_
+        ->userIdentityForPersonalPersona();  // rebuilds, which reports the dropped identities
     cache_->TEST_drainInvalidations();
     EXPECT_TRUE(itemsOf(*state_, enterprise_->posixUID()).empty());
 }

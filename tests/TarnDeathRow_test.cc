@@ -18,7 +18,7 @@ namespace {
 namespace fs = std::filesystem;
 
 class TarnDeathRowTest : public test::ScratchRootTest {
-protected:
+  protected:
     void SetUp() override {
         TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
         deathRow_ = TarnGlobalConfiguration::sharedInstance().deathrowDirectory();
@@ -50,7 +50,8 @@ protected:
     }
 
     size_t deathRowCount() {
-        return static_cast<size_t>(std::distance(fs::directory_iterator(deathRow_), fs::directory_iterator()));
+        return static_cast<size_t>(
+            std::distance(fs::directory_iterator(deathRow_), fs::directory_iterator()));
     }
 
     TarnClientConnection connection_;
@@ -133,7 +134,7 @@ TEST_F(TarnDeathRowTest, PassesRunOneAfterAnotherUnderATransaction) {
 // ---- Termination assertions ----
 
 class FakeLifecycle : public TarnApplicationLifecycleService {
-public:
+  public:
     struct Handle : TarnTerminationAssertionHandle {
         explicit Handle(int* invalidations) : invalidations(invalidations) {}
         void invalidate() override { ++*invalidations; }

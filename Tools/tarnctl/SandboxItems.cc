@@ -14,8 +14,8 @@
 namespace tarnctl {
 
 void SetupSandboxItemsCommand(CLI::App& app, Options& options) {
-    auto* cmd = app.add_subcommand("sandbox-items",
-                                   "Print the sandbox container items of user U as JSON");
+    auto* cmd =
+        app.add_subcommand("sandbox-items", "Print the sandbox container items of user U as JSON");
     static uint32_t uid = 0;
     cmd->add_option("--uid", uid, "User id")->required();
     cmd->callback([&options] {
