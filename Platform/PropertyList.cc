@@ -3,6 +3,7 @@
 #include <plist/plist.h>
 #include <uuid/uuid.h>
 
+#include <algorithm>
 #include <cmath>
 #include <cstring>
 
@@ -223,6 +224,34 @@ void describe(const PlistValue& v, std::string& out, int indent, bool top) {
 
 constexpr int kMaxDepth = 256;
 
+// Strings the daemon keeps must be valid UTF-8: they are written back to files
+// and sent over IPC, and neither can carry broken text.
+bool validUtf8(const std::string& s) {
+    size_t i = 0, n = s.size();
+    while (i < n) {
+        unsigned char c = static_cast<unsigned char>(s[i]);
+        size_t extra;
+        if (c < 0x80) extra = 0;
+        else if ((c >> 5) == 0x6) extra = 1;
+        else if ((c >> 4) == 0xE) extra = 2;
+        else if ((c >> 3) == 0x1E) extra = 3;
+        else return false;
+        if (extra > n - i - 1) return false;
+        uint32_t cp = extra == 0 ? c : c & (0x3F >> extra);
+        for (size_t k = 1; k <= extra; ++k) {
+            unsigned char d = static_cast<unsigned char>(s[i + k]);
+            if ((d >> 6) != 0x2) return false;
+            cp = (cp << 6) | (d & 0x3F);
+        }
+        // Overlong forms, surrogates and values past the last code point.
+        if ((extra == 1 && cp < 0x80) || (extra == 2 && cp < 0x800) ||
+            (extra == 3 && cp < 0x10000) || (cp >= 0xD800 && cp <= 0xDFFF) || cp > 0x10FFFF)
+            return false;
+        i += extra + 1;
+    }
+    return true;
+}
+
 plist_t toNode(const PlistValue& v, int depth) {
     if (depth > kMaxDepth) return nullptr;
     switch (v.type()) {
@@ -232,14 +261,20 @@ plist_t toNode(const PlistValue& v, int depth) {
         // Binary plists store negative integers as 8-byte two's complement.
         case PlistValue::Type::Int: return plist_new_uint(static_cast<uint64_t>(*v.asInt64()));
         case PlistValue::Type::Real: return plist_new_real(*v.asReal());
-        case PlistValue::Type::String: return plist_new_string(v.asString()->c_str());
+        // The file format's library cuts strings at a NUL: refuse rather than lose text.
+        case PlistValue::Type::String:
+            if (v.asString()->find('\0') != std::string::npos) return nullptr;
+            return plist_new_string(v.asString()->c_str());
         case PlistValue::Type::Uuid: return plist_new_string(v.asUuid()->string().c_str());
         case PlistValue::Type::Data: {
             const auto& d = *v.asData();
             return plist_new_data(reinterpret_cast<const char*>(d.data()), d.size());
         }
         case PlistValue::Type::Date: {
+            // The file format holds 32-bit seconds; clamp rather than overflow.
             double s = v.asDate()->seconds;
+            if (!std::isfinite(s)) s = 0;
+            s = std::clamp(s, static_cast<double>(INT32_MIN), static_cast<double>(INT32_MAX));
             double whole = std::floor(s);
             return plist_new_date(static_cast<int32_t>(whole),
                                   static_cast<int32_t>((s - whole) * 1e6));
@@ -259,7 +294,7 @@ plist_t toNode(const PlistValue& v, int depth) {
         case PlistValue::Type::Dict: {
             plist_t d = plist_new_dict();
             for (const auto& [k, item] : *v.asDict()) {
-                plist_t n = toNode(item, depth + 1);
+                plist_t n = k.find('\0') == std::string::npos ? toNode(item, depth + 1) : nullptr;
                 if (!n) {
                     plist_free(d);
                     return nullptr;
@@ -303,6 +338,7 @@ std::optional<PlistValue> fromNode(plist_t node, int depth) {
             plist_get_string_val(node, &s);
             std::string out = s ? s : "";
             free(s);
+            if (!validUtf8(out)) return std::nullopt;
             return PlistValue(std::move(out));
         }
         case PLIST_DATA: {
@@ -344,7 +380,7 @@ std::optional<PlistValue> fromNode(plist_t node, int depth) {
                 auto item = fromNode(val, depth + 1);
                 std::string k = key ? key : "";
                 free(key);
-                if (!item) {
+                if (!item || !validUtf8(k)) {
                     free(it);
                     return std::nullopt;
                 }
@@ -355,6 +391,63 @@ std::optional<PlistValue> fromNode(plist_t node, int depth) {
         }
         default: return std::nullopt;
     }
+}
+
+// The property-list library asserts (and so aborts the process) when a string
+// holds a NUL character. Such input is refused before it reaches the library.
+bool binaryHasNulInStrings(const uint8_t* p, size_t n) {
+    if (n < 8 + 32) return false;  // the library refuses it on its own
+    const uint8_t* trailer = p + n - 32;
+    auto be = [](const uint8_t* q, size_t width) {
+        uint64_t v = 0;
+        for (size_t i = 0; i < width; ++i) v = (v << 8) | q[i];
+        return v;
+    };
+    size_t offsetSize = trailer[6];
+    uint64_t count = be(trailer + 8, 8);
+    uint64_t tableAt = be(trailer + 24, 8);
+    if (offsetSize == 0 || offsetSize > 8 || tableAt >= n || count > (n - tableAt) / offsetSize)
+        return false;  // malformed: the library refuses it
+    for (uint64_t i = 0; i < count; ++i) {
+        uint64_t at = be(p + tableAt + i * offsetSize, offsetSize);
+        if (at >= n) continue;
+        uint8_t marker = p[at];
+        uint8_t kind = marker >> 4;
+        if (kind != 0x5 && kind != 0x6 && kind != 0x7) continue;
+        uint64_t length = marker & 0xF;
+        uint64_t start = at + 1;
+        if (length == 0xF) {
+            if (start >= n || (p[start] >> 4) != 0x1) continue;
+            size_t width = size_t{1} << (p[start] & 0xF);
+            if (width > 8 || start + 1 + width > n) continue;
+            length = be(p + start + 1, width);
+            start += 1 + width;
+        }
+        size_t unit = kind == 0x6 ? 2 : 1;
+        if (start > n || length > (n - start) / unit) continue;
+        for (uint64_t k = 0; k < length; ++k) {
+            const uint8_t* c = p + start + k * unit;
+            if (unit == 1 ? c[0] == 0 : (c[0] == 0 && c[1] == 0)) return true;
+        }
+    }
+    return false;
+}
+
+// XML can spell a NUL as a character reference.
+bool xmlHasNulReference(const char* p, size_t n) {
+    for (size_t i = 0; i + 2 < n; ++i) {
+        if (p[i] == '\0') return true;
+        if (p[i] != '&' || p[i + 1] != '#') continue;
+        size_t j = i + 2;
+        bool hex = j < n && (p[j] == 'x' || p[j] == 'X');
+        if (hex) ++j;
+        size_t digits = 0;
+        bool nonZero = false;
+        for (; j < n && std::isxdigit(static_cast<unsigned char>(p[j])); ++j, ++digits)
+            if (p[j] != '0') nonZero = true;
+        if (digits > 0 && !nonZero && j < n && p[j] == ';') return true;
+    }
+    return false;
 }
 
 }  // namespace
@@ -395,8 +488,15 @@ std::optional<PlistValue> PlistValue::fromBytes(const void* bytes, size_t length
         if (why) *why = length == 0 ? "empty property list" : "property list too large";
         return std::nullopt;
     }
+    const char* text = static_cast<const char*>(bytes);
+    bool binary = length >= 8 && std::memcmp(text, "bplist00", 8) == 0;
+    if (binary ? binaryHasNulInStrings(static_cast<const uint8_t*>(bytes), length)
+               : xmlHasNulReference(text, length)) {
+        if (why) *why = "property list holds a string with a NUL character";
+        return std::nullopt;
+    }
     plist_t node = nullptr;
-    plist_from_memory(static_cast<const char*>(bytes), static_cast<uint32_t>(length), &node);
+    plist_from_memory(text, static_cast<uint32_t>(length), &node);
     if (!node) {
         if (why) *why = "malformed property list";
         return std::nullopt;

@@ -108,7 +108,8 @@ public:
     // strings bare at the top level, dictionaries as { key = value; }.
     std::string description() const;
 
-    // Binary property list; a Null root cannot be written (returns empty).
+    // Binary property list. Returns empty when the tree cannot be written: a
+    // Null anywhere, a string or key holding a NUL, nesting deeper than 256.
     // Uuid values are written as their canonical string.
     std::vector<uint8_t> toBinary() const;
     std::string toXml() const;

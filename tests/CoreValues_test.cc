@@ -67,6 +67,23 @@ TEST(PropertyList, MalformedInputIsRefusedWithAReason) {
     EXPECT_FALSE(PlistValue::fromBytes(deep.data(), deep.size()));
 }
 
+TEST(PropertyList, TextTheDaemonCouldNotWriteBackIsRefused) {
+    // A NUL inside a string would abort the file library; broken UTF-8 could
+    // not be written back. Both are refused as malformed input.
+    const std::string withNul = "<plist><string>a&#0;b</string></plist>";
+    const std::string withHexNul = "<plist><dict><key>k&#x00;</key><true/></dict></plist>";
+    const std::string badUtf8 = "<plist><string>\xC3\x28</string></plist>";
+    for (const auto& c : {withNul, withHexNul, badUtf8}) {
+        std::string why;
+        EXPECT_FALSE(PlistValue::fromBytes(c.data(), c.size(), &why)) << c;
+    }
+    PlistValue d{PlistDict{}};
+    d.set("s", std::string("a\0b", 3));
+    EXPECT_TRUE(d.toBinary().empty());  // not silently cut at the NUL
+    const std::string fine = "<plist><string>caf\xC3\xA9 &#233;</string></plist>";
+    EXPECT_TRUE(PlistValue::fromBytes(fine.data(), fine.size()));
+}
+
 TEST(Format, PrintfConversionsAndDescriptions) {
     EXPECT_EQ(Format("command=%llu, client=%@, error=%llu", uint64_t{3}, std::string("x"),
                      uint64_t{49}),
