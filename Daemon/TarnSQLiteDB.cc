@@ -337,6 +337,16 @@ TarnErrorRef TarnSQLiteDB::rollbackAfter(TarnErrorRef cause) {
     return TARN_ERROR(TarnErrorDatabase, cause, "failed _sqliteExec rollback");
 }
 
+TarnErrorRef TarnSQLiteDB::commitTransaction() {
+    TarnErrorRef execError;
+    if (_sqliteExec("COMMIT;", &execError)) return nullptr;
+    TarnErrorRef e = TARN_ERROR(TarnErrorDatabase, execError, "failed _sqliteExec commit");
+    // A failed COMMIT can leave the transaction open; close it so the next
+    // BEGIN does not fail too.
+    if (db_ && !sqlite3_get_autocommit(db_)) e = rollbackAfter(e);
+    return e;
+}
+
 TarnErrorRef TarnSQLiteDB::handleTransactionException(const std::string& what) {
     TarnErrorRef e = TARN_ERROR(TarnErrorException, nullptr, "Got exception: %@ : %@", what, "()");
     if (isInternalBuild()) fatalExceptionReport(what);
@@ -382,12 +392,7 @@ bool TarnSQLiteDB::addCodeSigningEntry(const TarnCodeSigningEntryRef& codeSignin
                     (void)_insertChildIdentifier(child, withIdentifier, &childError);
                 }
                 runStoreStepHook("commit");
-                if (!_sqliteExec("COMMIT;", &execError)) {
-                    e = TARN_ERROR(TarnErrorDatabase, execError, "failed _sqliteExec commit");
-                    // A failed COMMIT can leave the transaction open; close it so
-                    // the next BEGIN does not fail too.
-                    if (db_ && !sqlite3_get_autocommit(db_)) e = rollbackAfter(e);
-                }
+                e = commitTransaction();
             }
         }
     } catch (const std::exception& ex) {
@@ -660,10 +665,7 @@ bool TarnSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::s
             }
         }
         runStoreStepHook("commit");
-        if (!_sqliteExec("COMMIT;", &execError)) {
-            e = TARN_ERROR(TarnErrorDatabase, execError, "failed _sqliteExec commit");
-            if (db_ && !sqlite3_get_autocommit(db_)) e = rollbackAfter(e);
-        }
+        e = commitTransaction();
     } catch (const std::exception& ex) {
         e = handleTransactionException(ex.what());
     } catch (...) {

@@ -119,6 +119,8 @@ private:
 
     // Rolls back after `cause`; the rollback's own failure wraps `cause`.
     TarnErrorRef rollbackAfter(TarnErrorRef cause);
+    // COMMIT; on failure rolls back whatever is still open. Null on success.
+    TarnErrorRef commitTransaction();
     // Turns an exception caught inside a transaction into error 40 (after a
     // rollback); on an internal build the process stops instead.
     TarnErrorRef handleTransactionException(const std::string& what);
