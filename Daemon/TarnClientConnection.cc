@@ -261,6 +261,25 @@ std::string TarnClientConnection::clientBundleIdentifier() const {
     return clientIdentity_ ? clientIdentity_->bundleIdentifier() : std::string();
 }
 
+// ---- Create or look up, deletion (being written) ----
+
+TarnMetadataRef TarnClientConnection::createOrLookupContainerWithContainerIdentity(
+    const TarnContainerIdentityRef&, bool, bool, bool, uint64_t* error) {
+    TarnSetError(error, TarnErrorInvalidCommand);
+    return nullptr;
+}
+
+std::optional<std::vector<TarnMetadataRef>> TarnClientConnection::containersWithClass(
+    TarnContainerClass, bool, uint64_t* error) {
+    TarnSetError(error, TarnErrorInvalidCommand);
+    return std::nullopt;
+}
+
+void TarnClientConnection::deleteContainerWithContainerIdentity(const TarnContainerIdentityRef&,
+                                                                bool, uint64_t* error) {
+    TarnSetError(error, TarnErrorInvalidCommand);
+}
+
 bool TarnClientConnection::completeWithError(uint64_t* error) {
     return commandQueue_->executeAllUntilExhaustedOrError(error);
 }

@@ -24,10 +24,13 @@
 #include <optional>
 #include <set>
 #include <string>
+#include <vector>
 
 #include "Daemon/TarnClientIdentity.h"
 #include "Daemon/TarnCommandQueue.h"
 #include "Daemon/TarnContainerClass.h"
+#include "Daemon/TarnContainerIdentity.h"
+#include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnError.h"
 #include "Platform/Dispatch.h"
 #include "Platform/Path.h"
@@ -122,6 +125,51 @@ class TarnClientConnection {
     // directory under the root prefix (into a fresh unique directory there
     // when its name is taken). Errors: 4.
     static bool _removeItemOrMoveToTempAtURL(const FileURL& url, TarnErrorRef* error);
+
+    // ---- Create or look up ----
+
+    // The container's metadata, created (staged, then renamed into place)
+    // when missing and `createIfNecessary`. `existed()` of the result tells a
+    // found container from a new one. With `useLocking` a lookup holds the
+    // global read lock and a creation the global write lock; callers that
+    // already hold the write lock pass false. Failure: nullptr, code in *error.
+    TarnMetadataRef createOrLookupContainerWithContainerIdentity(
+        const TarnContainerIdentityRef& identity, bool createIfNecessary, bool transient,
+        bool useLocking, uint64_t* error);
+    // Every container of the class for the client's user identity.
+    std::optional<std::vector<TarnMetadataRef>> containersWithClass(
+        TarnContainerClass containerClass, bool transient, uint64_t* error);
+    bool _createTopLevelContainerDirectory(const FileURL& url, TarnContainerClass containerClass,
+                                           uint32_t owner, TarnErrorRef* error);
+    bool _createSubDirectories(const FileURL& url, const TarnMetadataRef& containerMetadata,
+                               TarnErrorRef* error);
+    static int _dataProtectionClassForContainerMetadata(const TarnMetadataRef& containerMetadata);
+
+    // ---- Deletion ----
+
+    // Looks the container up and queues its staged deletion on the command
+    // queue; *error always receives a code, 1 when queued.
+    void deleteContainerWithContainerIdentity(const TarnContainerIdentityRef& identity,
+                                              bool transient, uint64_t* error);
+
+    // ---- Per-container operations (TarnClientConnectionOperations.cc) ----
+
+    TarnMetadataRef metadataWithContainerIdentity(const TarnConcreteContainerIdentityRef& identity,
+                                                  uint64_t* error);
+    // `key` empty: the key was missing or not a string (error 38).
+    std::optional<PlistValue> infoValueForKey(const std::optional<std::string>& key,
+                                              const TarnConcreteContainerIdentityRef& containerIdentity,
+                                              bool useLocking, uint64_t* error);
+    // An empty `value` removes the key.
+    void setInfoValue(const std::optional<PlistValue>& value, const std::optional<std::string>& forKey,
+                      const TarnConcreteContainerIdentityRef& containerIdentity, bool useLocking,
+                      uint64_t* error);
+    uint64_t diskUsageWithContainerIdentity(const TarnConcreteContainerIdentityRef& identity,
+                                            uint64_t* error);
+    void recreateDefaultStructureWithContainerIdentity(
+        const TarnConcreteContainerIdentityRef& identity, uint64_t* error);
+    void regenerateDirectoryUUIDWithContainerIdentity(
+        const TarnConcreteContainerIdentityRef& identity, uint64_t* error);
 
     // Runs the command queue until it is exhausted or a command fails.
     bool completeWithError(uint64_t* error);
