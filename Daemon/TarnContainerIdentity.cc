@@ -9,10 +9,8 @@ namespace tarn {
 
 namespace {
 
-constexpr const char* kInitTag =
-    "-[TarnContainerIdentity initWithUserIdentity:identifier:containerClass:error:]";
-constexpr const char* kConcreteInitTag =
-    "-[TarnConcreteContainerIdentity initWithUUID:userIdentity:identifier:containerClass:error:]";
+constexpr const char* kInitTag = "initWithUserIdentity";
+constexpr const char* kConcreteInitTag = "initWithUUID";
 
 std::optional<PlistValue> identifierValue(const std::optional<std::string>& identifier) {
     if (!identifier) return std::nullopt;

@@ -38,7 +38,7 @@ TarnGlobalConfiguration& TarnGlobalConfiguration::sharedInstance() {
 
 TarnGlobalConfiguration::TarnGlobalConfiguration()
     : rootPrefix_(RootPrefix()), homeDirectory_(RootPath(kHome)) {
-    const char* tag = "-[TarnGlobalConfiguration init]";
+    const char* tag = "init";
     if (auto mobile = AccountUserByName("mobile")) {
         currentMobileUserId_ = mobile->uid;
         currentMobileGroupId_ = mobile->gid;
@@ -61,7 +61,7 @@ FileURL TarnGlobalConfiguration::directoryGetter(std::optional<FileURL>* slot,
     if (!TarnFileManager::defaultManager().createDirectoryAtURL(
             **slot, true, kDirectoryMode, owner,
             static_cast<TarnDataProtectionClass>(protectionClass), &error)) {
-        TarnLog(kLogError, "-[TarnGlobalConfiguration directory]", failureFormat, **slot, error);
+        TarnLog(kLogError, "directory", failureFormat, **slot, error);
     }
     return **slot;
 }
@@ -110,7 +110,7 @@ FileURL TarnGlobalConfiguration::logDirectory() {
     TarnErrorRef error;
     if (!TarnFileManager::defaultManager().createDirectoryAtURL(url, true, kDirectoryMode,
                                                                 kTarnDataProtectionClassD, &error)) {
-        TarnLog(kLogError, "-[TarnGlobalConfiguration logDirectory]",
+        TarnLog(kLogError, "logDirectory",
                 "Failed to create log directory at \"%@\": %@", url, error);
     }
     return url;
@@ -174,7 +174,7 @@ std::optional<FileURL> TarnGlobalConfiguration::containerDirectoryURLForUserIden
         if (!TarnFileManager::defaultManager().createDirectoryAtURL(url, true, kDirectoryMode, owner,
                                                                     &error)) {
             TarnLog(kLogError,
-                    "-[TarnGlobalConfiguration containerDirectoryURLForUserIdentity:contentClass:transient:]",
+                    "containerDirectoryURLForUserIdentity",
                     "Failed to create container dir at \"%@\": %@", url, error);
         }
         return url;

@@ -32,7 +32,7 @@ FileURL TarnPerUserConfiguration::directoryGetter(std::optional<FileURL>* slot, 
     const uid_t owner = userIdentity_ ? userIdentity_->posixUID() : 0;
     if (!TarnFileManager::defaultManager().createDirectoryAtURL(**slot, true, kDirectoryMode, owner,
                                                                 &error)) {
-        TarnLog(kLogError, "-[TarnPerUserConfiguration directory]", failureFormat, **slot, error);
+        TarnLog(kLogError, "directory", failureFormat, **slot, error);
     }
     return **slot;
 }
@@ -77,7 +77,7 @@ FileURL TarnPerUserConfiguration::oldLoggingPath() const {
 
 std::optional<FileURL> TarnPerUserConfiguration::containerDirectoryURLForContentClass(
     TarnContainerClass contentClass, bool transient) {
-    const char* tag = "-[TarnPerUserConfiguration containerDirectoryURLForContentClass:transient:]";
+    const char* tag = "containerDirectoryURLForContentClass";
     if (!TarnContainerClassIsPerUser(contentClass)) {
         TarnLog(kLogError, tag, "Invalid class for a per user container directory: %llu",
                 contentClass);

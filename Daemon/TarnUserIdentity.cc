@@ -49,7 +49,7 @@ bool readNumber(const PlistValue& plist, const char* key, uint32_t* out, uint64_
     const PlistValue* v = plist.find(key);
     auto n = storedUInt32(v);
     if (!n) {
-        TarnLog(kLogError, "-[TarnUserIdentity initWithPlist:cache:error:]",
+        TarnLog(kLogError, "initWithPlist",
                 "Invalid user identity plist data. Expected number for %@, got %@. Data: %@", key,
                 valueKindName(v), plist);
         TarnSetError(error, TarnErrorInvalidUserIdentityData);
@@ -77,7 +77,7 @@ TarnUserIdentityRef TarnUserIdentity::initWithUID(uint32_t uid, uint32_t GID,
                                                   std::optional<std::string> personaUniqueString,
                                                   uint32_t personaType, uint32_t kernelPersonaID) {
     if (uid < kFirstNonRoleUID) {
-        TarnLog(kLogError, "-[TarnUserIdentity initWithUID:GID:homeDirectoryURL:personaUniqueString:personaType:kernelPersonaID:]",
+        TarnLog(kLogError, "initWithUID",
                 "Attempt to create a TarnUserIdentity object with a role user uid is not allowed: "
                 "uid = %u, gid = %u",
                 uid, GID);
@@ -157,7 +157,7 @@ TarnUserIdentityRef TarnUserIdentity::initWithPlist(const PlistValue& plist,
     }
     // Neither reader applies (not a dictionary, or an unknown or non-string
     // version): the data is not a stored identity we can trust.
-    TarnLog(kLogError, "-[TarnUserIdentity initWithPlist:cache:error:]",
+    TarnLog(kLogError, "initWithPlist",
             "Invalid user identity plist data. Unknown version %@. Data: %@",
             valueDescription(version), plist);
     TarnSetError(error, TarnErrorInvalidUserIdentityData);
@@ -173,7 +173,7 @@ TarnUserIdentityRef TarnUserIdentity::initWithVersion2PlistDictionary(const Plis
         return nullptr;
     }
     if (type > TarnPersonaTypeUnspecific) {
-        TarnLog(kLogError, "-[TarnUserIdentity initWithVersion2PlistDictionary:cache:error:]",
+        TarnLog(kLogError, "initWithVersion2PlistDictionary",
                 "Invalid user identity plist data. Expected persona type for %@, got %@. Data: %@",
                 "type", valueDescription(plist.find("type")), plist);
         TarnSetError(error, TarnErrorInvalidUserIdentityData);
@@ -185,7 +185,7 @@ TarnUserIdentityRef TarnUserIdentity::initWithVersion2PlistDictionary(const Plis
     if (type == TarnPersonaTypeEnterprise && uniqueString) {
         result = cache.userIdentityForPersonaUniqueString(*uniqueString, uid, gid);
         if (result && !result->isEnterprise()) {
-            TarnLog(kLogError, "-[TarnUserIdentity initWithVersion2PlistDictionary:cache:error:]",
+            TarnLog(kLogError, "initWithVersion2PlistDictionary",
                     "Invalid user identity plist data. Expected %@ to be enterprise, but it was "
                     "not. Data: %@",
                     result, plist);

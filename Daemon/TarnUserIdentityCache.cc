@@ -63,14 +63,14 @@ public:
         std::lock_guard<std::mutex> guard(lock_);
         if (!cache_) return;
         if (error) {
-            TarnLog(kLogError, "-[TarnUserIdentityCache init]",
+            TarnLog(kLogError, "init",
                     "Failed to register for persona list updates: %@", *error);
             PlatformLog(kCategory, PlatformLogType::Fault,
                         "Failed to register for persona list updates: %@", *error);
             return;
         }
         cache_->registered_ = true;
-        TarnLog(kLogNotice, "-[TarnUserIdentityCache init]", "Registered for persona list updates.");
+        TarnLog(kLogNotice, "init", "Registered for persona list updates.");
     }
     void detach() {
         std::lock_guard<std::mutex> guard(lock_);
@@ -190,7 +190,7 @@ TarnUserIdentityRef TarnUserIdentityCache::_updateUserIdentity(
 // ---- Rebuilding ----
 
 void TarnUserIdentityCache::crashForMissingPersonas() {
-    TarnLog(kLogError, "-[TarnUserIdentityCache _lock_resync]",
+    TarnLog(kLogError, "_lock_resync",
             "Could not obtain persona attributes after exhausting retries, crashing");
     PlatformLog(kCategory, PlatformLogType::Fault,
                 "Could not obtain persona attributes after exhausting retries.");
@@ -211,7 +211,7 @@ void TarnUserIdentityCache::_lock_resync() {
         const bool empty = !list || list->empty();
         if (!empty && _lock_resync_fromUserPersonaAttributes(*list)) break;
         if (empty && attempt == 0) {
-            TarnLog(kLogError, "-[TarnUserIdentityCache _lock_resync]",
+            TarnLog(kLogError, "_lock_resync",
                     "Did not receive any persona attributes: %@", PersonaListDescription(list));
             PlatformLog(kCategory, PlatformLogType::Fault, "Did not receive any persona attributes.");
         } else if (attempt == kMaxResyncTry) {
@@ -225,7 +225,7 @@ void TarnUserIdentityCache::_lock_resync() {
 }
 
 bool TarnUserIdentityCache::_lock_resync_fromUserPersonaAttributes(const PersonaAttributesList& list) {
-    const char* tag = "-[TarnUserIdentityCache _lock_resync_fromUserPersonaAttributes:]";
+    const char* tag = "_lock_resync_fromUserPersonaAttributes";
     const std::string listText = PersonaListDescription(list);
     const PersonaAttributes* personal = nullptr;
     for (const auto& p : list) {
@@ -485,7 +485,7 @@ void TarnUserIdentityCache::forEachAccessibleUserIdentitySynchronouslyExecuteBlo
     }
     if (identities.empty()) {
         TarnLog(kLogError,
-                "-[TarnUserIdentityCache forEachAccessibleUserIdentitySynchronouslyExecuteBlock:]",
+                "forEachAccessibleUserIdentitySynchronouslyExecuteBlock",
                 "Expected to find at least one persona; self = %p, personaAttributeList = %@",
                 static_cast<const void*>(this), listText);
         block(defaultUserIdentity());
@@ -547,11 +547,11 @@ void TarnUserIdentityCache::unregister() { registered_ = false; }
 bool TarnUserIdentityCache::registered() const { return registered_; }
 
 void TarnUserIdentityCache::personaListDidUpdate() {
-    TarnLog(kLogNotice, "-[TarnUserIdentityCache personaListDidUpdate]",
+    TarnLog(kLogNotice, "personaListDidUpdate",
             "Got persona list update from PR.");
     Transaction::begin();
     flushQueue_->async([this] {
-        TarnLog(kLogNotice, "-[TarnUserIdentityCache personaListDidUpdate]_block_invoke",
+        TarnLog(kLogNotice, "personaListDidUpdate",
                 "Flushing cache from PR persona list update.");
         flush();
         Transaction::end();
