@@ -1,15 +1,18 @@
 #include "Daemon/TarnClientConnection.h"
 
+#include <algorithm>
 #include <mutex>
 
 #include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnDaemon.h"
+#include "Daemon/TarnDataProtectionManager.h"
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnFileManager.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnLog.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Daemon/TarnWhitelist.h"
+#include "Platform/ContainerLibrary.h"
 #include "Platform/RootPrefix.h"
 
 namespace tarn {
@@ -259,6 +262,98 @@ TarnClientConnection& TarnClientConnection::sharedClientConnection() {
 
 std::string TarnClientConnection::clientBundleIdentifier() const {
     return clientIdentity_ ? clientIdentity_->bundleIdentifier() : std::string();
+}
+
+// ---- Create or look up: directories ----
+
+namespace {
+
+// Owner and mode of a new container's subdirectories. System containers'
+// contents belong to the system user and are reached through the ACL alone.
+uint32_t subdirectoryOwnerForMetadata(const TarnMetadata& metadata) {
+    const TarnContainerClass c = metadata.containerClass();
+    if (TarnContainerClassIsBundle(c)) return CONTAINER_INSTALLATION_UID;
+    if (TarnContainerClassIsSystem(c)) return CONTAINER_SYSTEM_UID;
+    return metadata.userIdentity() ? metadata.userIdentity()->posixUIDForContainerClass(c) : 0;
+}
+
+mode_t subdirectoryModeForClass(TarnContainerClass c) {
+    return TarnContainerClassIsSystem(c) ? 0 : 0755;
+}
+
+}  // namespace
+
+bool TarnClientConnection::_createTopLevelContainerDirectory(const FileURL& url,
+                                                             TarnContainerClass containerClass,
+                                                             uint32_t owner, TarnErrorRef* error) {
+    // System containers keep the daemon as owner (0 leaves it alone); bundles
+    // always go to the installer.
+    uint32_t topLevelOwner = owner;
+    if (TarnContainerClassIsBundle(containerClass)) topLevelOwner = CONTAINER_INSTALLATION_UID;
+    if (TarnContainerClassIsSystem(containerClass)) topLevelOwner = 0;
+    return TarnFileManager::defaultManager().createDirectoryAtURL(
+        url, true, 0755, topLevelOwner, kTarnDataProtectionClassNone, error);
+}
+
+bool TarnClientConnection::_createSubDirectories(const FileURL& url,
+                                                 const TarnMetadataRef& containerMetadata,
+                                                 TarnErrorRef* error) {
+    const TarnContainerClass containerClass = containerMetadata->containerClass();
+    std::vector<std::string> names;
+    uint64_t libraryCode = kContainerLibraryErrorNoSubdirectories;
+    if (!ContainerLibrarySubdirectoriesForClass(containerClass, &names, &libraryCode)) {
+        TarnErrorRef e = TARN_ERROR(libraryCode, nullptr,
+                                    "Failed to get subdirectory names for %llu : %llu",
+                                    containerClass, libraryCode);
+        if (error) *error = e;
+        return false;
+    }
+
+    const int32_t protectionClass = _dataProtectionClassForContainerMetadata(containerMetadata);
+    TarnLog(kLogDebug, __func__, "Creating subdirectories for [%llu:%@] at [%@]", containerClass,
+            containerMetadata->identifier(), url);
+
+    const std::vector<std::string>& excluded =
+        TarnGlobalConfiguration::sharedInstance().excludedFromAppUserData();
+    const uint32_t owner = subdirectoryOwnerForMetadata(*containerMetadata);
+    const mode_t mode = subdirectoryModeForClass(containerClass);
+    auto& fm = TarnFileManager::defaultManager();
+    for (const std::string& name : names) {
+        const FileURL subdirectory = PathJoin(url, name);
+        int32_t subdirectoryClass = protectionClass;
+        if (TarnContainerClassIsPerUser(containerClass) &&
+            std::find(excluded.begin(), excluded.end(), name) != excluded.end())
+            subdirectoryClass = kTarnDataProtectionClassNone;
+        TarnErrorRef underlying;
+        if (!fm.createDirectoryAtURL(subdirectory, true, mode, owner,
+                                     static_cast<TarnDataProtectionClass>(subdirectoryClass),
+                                     &underlying)) {
+            TarnErrorRef e = TARN_ERROR(TarnErrorCreateDirectoryFailed, underlying,
+                                        "Failed to create sub-dir for %@ at %@ (protClass: %d)",
+                                        containerMetadata->identifier(), subdirectory,
+                                        subdirectoryClass);
+            if (error) *error = e;
+            return false;
+        }
+    }
+    return true;
+}
+
+int TarnClientConnection::_dataProtectionClassForContainerMetadata(
+    const TarnMetadataRef& containerMetadata) {
+    if (!containerMetadata || !TarnContainerClassIsPerUser(containerMetadata->containerClass()))
+        return kTarnDataProtectionClassNone;
+    // A class recorded by an earlier change wins over what the entitlements ask for.
+    if (const std::optional<PlistValue>& info = containerMetadata->info()) {
+        const PlistValue* recorded = info->find(kTarnInfoContentProtectionClassKey);
+        if (recorded && recorded->isNumber()) {
+            if (auto i = recorded->asInt64()) return static_cast<int>(*i);
+            if (auto d = recorded->asReal()) return static_cast<int>(*d);
+        }
+    }
+    return TarnDataProtectionManager::defaultManager()
+        .intendedDataProtectionClassBasedOnEntitlementsForIdentifier(
+            containerMetadata->identifier());
 }
 
 // ---- Create or look up, deletion (being written) ----
