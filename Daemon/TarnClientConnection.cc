@@ -4,15 +4,21 @@
 #include <mutex>
 
 #include "Daemon/TarnCodeSigningMapping.h"
+#include "Daemon/TarnCommandStageForDelete.h"
+#include "Daemon/TarnContainerCache.h"
 #include "Daemon/TarnDaemon.h"
 #include "Daemon/TarnDataProtectionManager.h"
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnFileManager.h"
 #include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnLocks.h"
 #include "Daemon/TarnLog.h"
+#include "Daemon/TarnRequestProcessor.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Daemon/TarnWhitelist.h"
 #include "Platform/ContainerLibrary.h"
+#include "Platform/HostConfiguration.h"
+#include "Platform/PlatformLog.h"
 #include "Platform/RootPrefix.h"
 
 namespace tarn {
@@ -356,23 +362,289 @@ int TarnClientConnection::_dataProtectionClassForContainerMetadata(
             containerMetadata->identifier());
 }
 
-// ---- Create or look up, deletion (being written) ----
+// ---- Create or look up ----
 
-TarnMetadataRef TarnClientConnection::createOrLookupContainerWithContainerIdentity(
-    const TarnContainerIdentityRef&, bool, bool, bool, uint64_t* error) {
-    TarnSetError(error, TarnErrorInvalidCommand);
-    return nullptr;
+namespace {
+
+// Holds one global identifier lock (read or write) until released or destroyed,
+// so that no return path or exception leaves it taken.
+class GlobalLockHolder {
+  public:
+    GlobalLockHolder() = default;
+    ~GlobalLockHolder() { release(); }
+    GlobalLockHolder(const GlobalLockHolder&) = delete;
+    GlobalLockHolder& operator=(const GlobalLockHolder&) = delete;
+
+    void readLock() {
+        gTarnLocks.read_lock_all_identifiers();
+        held_ = true;
+    }
+    void writeLock() {
+        gTarnLocks.write_lock_all_identifiers();
+        held_ = true;
+    }
+    void release() {
+        if (held_) gTarnLocks.unlock_all_identifiers();
+        held_ = false;
+    }
+
+  private:
+    bool held_ = false;
+};
+
+bool isNotFound(const TarnErrorRef& e) { return e && e->isTarn() && e->code() == TarnErrorNotFound; }
+
+
+// The live directory name of a new container: system containers on the
+// well-known list keep a fixed name, everything else is named by a UUID.
+std::string liveDirectoryName(const std::string& identifier, TarnContainerClass containerClass,
+                              const std::string& uuidName) {
+    std::optional<std::string> wellKnown;
+    if (containerClass == TarnContainerClassSystemGroup)
+        wellKnown = TarnWhitelist::sharedWhitelist().wellknownSystemGroupContainerForId(identifier);
+    else if (containerClass == TarnContainerClassSystemData)
+        wellKnown = TarnWhitelist::sharedWhitelist().wellknownSystemContainerForId(identifier);
+    return wellKnown ? *wellKnown : uuidName;
 }
 
+// Builds a new container in the staging directory and renames it into place.
+// The caller holds the global write lock (or has taken it over).
+TarnMetadataRef createContainer(TarnClientConnection& connection,
+                                const TarnContainerIdentityRef& identity, bool transient,
+                                TarnErrorRef* error) {
+    const std::string& identifier = identity->identifier();
+    const TarnContainerClass containerClass = identity->containerClass();
+    const TarnUserIdentityRef& userIdentity = identity->userIdentity();
+    auto& configuration = TarnGlobalConfiguration::sharedInstance();
+    auto& fm = TarnFileManager::defaultManager();
+
+    const std::string directoryName = Uuid::generate().string();
+    {
+        SignpostInterval event("unspecified", "CreatingContainer",
+                               {{"uuid", directoryName},
+                                {"identifier", identifier},
+                                {"class", std::to_string(containerClass)}});
+        event.end();
+    }
+
+    const FileURL stagingURL = PathJoin(
+        configuration.stagingDirectoryURLForUserIdentity(userIdentity, containerClass),
+        directoryName);
+    TarnErrorRef underlying;
+    if (!connection._createTopLevelContainerDirectory(
+            stagingURL, containerClass, userIdentity->posixUIDForContainerClass(containerClass),
+            &underlying)) {
+        *error = TARN_ERROR(TarnErrorCreateStagingFailed, underlying,
+                            "Failed to create staging dir at %@ : %@", stagingURL, underlying);
+        return nullptr;
+    }
+
+    // From here on a failure leaves a staging directory that must go to death row.
+    TarnErrorRef failure;
+    TarnMutableMetadataRef metadata;
+    FileURL liveURL;
+    [&] {
+        // The metadata's UUID is independent of the directory's name, so that
+        // neither can be derived from the other.
+        uint64_t identityCode = TarnSuccess;
+        TarnConcreteContainerIdentityRef concrete =
+            TarnConcreteContainerIdentity::containerIdentityWithUUID(
+                Uuid::generate(), userIdentity, identifier, containerClass, &identityCode);
+        if (!concrete) {
+            failure = TARN_ERROR_CODE(identityCode, nullptr);
+            return;
+        }
+        metadata = TarnMetadata::initWithContainerIdentity(concrete, std::nullopt, stagingURL,
+                                                           std::nullopt);
+        metadata->setTransient(transient);
+        if (!metadata->writeMetadataToDiskWithError(&failure)) return;
+        if (TarnContainerClassIsSystem(containerClass) &&
+            !fm.setTopLevelSystemContainerACLAtURL(stagingURL, &failure))
+            return;
+        if (!connection._createSubDirectories(stagingURL, metadata, &failure)) return;
+
+        std::optional<FileURL> liveParent =
+            configuration.containerDirectoryURLForUserIdentity(userIdentity, containerClass,
+                                                               transient);
+        liveURL = PathJoin(liveParent.value_or(FileURL()),
+                           liveDirectoryName(identifier, containerClass, directoryName));
+        TarnErrorRef moveError;
+        if (!liveParent || !fm.moveItemAtURL(stagingURL, liveURL, &moveError))
+            failure = TARN_ERROR(TarnErrorMoveStagingFailed, moveError,
+                                 "Failed to move staging dir: %@ to live dir: %@", stagingURL,
+                                 liveURL);
+    }();
+
+    if (failure) {
+        TarnErrorRef cleanupError;
+        if (!connection._moveItemAtURLToDeathRow(stagingURL, true, true, &cleanupError))
+            failure = TARN_ERROR(TarnErrorRemoveStagingFailed, cleanupError,
+                                 "Failed to remove staging dir: %@", stagingURL);
+        *error = failure;
+        return nullptr;
+    }
+
+    if (HostConfiguration::shared().featureEnabled("fast_container_sizing"))
+        (void)fm.fastDiskUsageForURL(liveURL);  // warms the size cache only
+
+    metadata->setUrl(liveURL);
+    metadata->setExisted(false);
+    TarnErrorRef cacheError;
+    if (!TarnContainerCache::sharedInstance().addContainerMetadata(metadata, liveURL, transient,
+                                                                   true, &cacheError)) {
+        *error = TARN_ERROR(TarnErrorCacheAddFailed, cacheError,
+                            "Failed to add to cache : %@, url: %@, transient: %d",
+                            metadata->description(), liveURL, transient);
+        return nullptr;
+    }
+    return metadata;
+}
+
+// Copies a cached record and marks it as found.
+TarnMetadataRef foundContainer(const TarnMetadataRef& cached) {
+    TarnMutableMetadataRef found = cached->copy();
+    found->setExisted(true);
+    return found;
+}
+
+TarnMetadataRef createOrLookup(TarnClientConnection& connection,
+                               const TarnContainerIdentityRef& identity, bool createIfNecessary,
+                               bool transient, bool useLocking, GlobalLockHolder& globalLock,
+                               TarnErrorRef* error) {
+    PlatformLog("unspecified", PlatformLogType::Debug,
+                "createOrLookup; identity: %@, createIfNecessary: %d, transient: %d, "
+                "allowOtherIdLookup: %d, unrestricted: %d, clientBundleIdentifier: %@",
+                identity, createIfNecessary, transient, connection.allowOtherIdLookup(),
+                connection.unrestricted(), connection.clientBundleIdentifier());
+    if (!identity) {
+        *error = TARN_ERROR(TarnErrorBadInput, nullptr, "Cannot lookup a nil container identity.");
+        return nullptr;
+    }
+    const std::string& identifier = identity->identifier();
+    const TarnContainerClass containerClass = identity->containerClass();
+    if (!connection._passesLookupRuleForContainerClass(containerClass, identifier, error) ||
+        !connection._passesSystemDataGateForContainerClass(containerClass, identifier, error))
+        return nullptr;
+
+    auto& cache = TarnContainerCache::sharedInstance();
+    const bool allowKernelLookup =
+        !(connection.clientIdentity() && connection.clientIdentity()->isKernel());
+    if (!transient) {
+        if (useLocking) globalLock.readLock();
+        TarnErrorRef lookupError;
+        TarnMetadataRef cached = cache.containerForContainerIdentity(identity, false, true,
+                                                                     allowKernelLookup, &lookupError);
+        globalLock.release();
+        if (cached) return foundContainer(cached);
+        if (!isNotFound(lookupError)) {
+            *error = lookupError;
+            return nullptr;
+        }
+    }
+
+    if (!createIfNecessary) {
+        *error = TARN_ERROR_SILENT(TarnErrorNotFound, nullptr,
+                                   "Container with identifier: \"%@\" Not Found", identifier);
+        return nullptr;
+    }
+
+    // Look again under the write lock: another request may have created it
+    // since the read lock was let go.
+    if (useLocking) globalLock.writeLock();
+    TarnErrorRef lookupError;
+    TarnMetadataRef cached = cache.containerForContainerIdentity(identity, transient, true,
+                                                                 allowKernelLookup, &lookupError);
+    if (cached && !transient) return foundContainer(cached);
+    if (cached) {
+        // A transient container is made anew on every request.
+        TarnErrorRef moveError;
+        if (!connection._moveItemAtURLToDeathRow(cached->url(), true, true, &moveError)) {
+            *error = TARN_ERROR(TarnErrorRemoveTransientFailed, moveError,
+                                "Failed to remove transient container at %@", cached->url());
+            return nullptr;
+        }
+    } else if (!isNotFound(lookupError)) {
+        *error = lookupError;
+        return nullptr;
+    }
+    return createContainer(connection, identity, transient, error);
+}
+
+}  // namespace
+
+TarnMetadataRef TarnClientConnection::createOrLookupContainerWithContainerIdentity(
+    const TarnContainerIdentityRef& identity, bool createIfNecessary, bool transient,
+    bool useLocking, uint64_t* error) {
+    GlobalLockHolder globalLock;
+    TarnErrorRef failure;
+    TarnMetadataRef result;
+    try {
+        result = createOrLookup(*this, identity, createIfNecessary, transient, useLocking,
+                                globalLock, &failure);
+    } catch (const std::exception& e) {
+        globalLock.release();
+        TarnSetError(error, TarnHandleCaughtException(__func__, &e));
+        return nullptr;
+    } catch (...) {
+        globalLock.release();
+        TarnSetError(error, TarnHandleCaughtException(__func__, nullptr));
+        return nullptr;
+    }
+    globalLock.release();
+    if (!result) TarnSetError(error, TarnErrorCodeOf(failure, TarnErrorInvalidArgument));
+    return result;
+}
 std::optional<std::vector<TarnMetadataRef>> TarnClientConnection::containersWithClass(
-    TarnContainerClass, bool, uint64_t* error) {
-    TarnSetError(error, TarnErrorInvalidCommand);
+    TarnContainerClass containerClass, bool transient, uint64_t* error) {
+    if (!TarnContainerClassIsValid(containerClass)) {
+        TarnErrorRef e = TARN_ERROR(TarnErrorInvalidArgument, nullptr,
+                                    "Can't act on an invalid container class: %ld",
+                                    static_cast<int64_t>(containerClass));
+        TarnSetError(error, e->code());
+        return std::nullopt;
+    }
+    GlobalLockHolder globalLock;
+    try {
+        TarnUserIdentityRef userIdentity =
+            clientIdentity_ ? clientIdentity_->userIdentity() : nullptr;
+        if (!userIdentity) userIdentity = TarnUserIdentityCache::defaultUserIdentity();
+        globalLock.readLock();
+        TarnErrorRef cacheError;
+        auto containers = TarnContainerCache::sharedInstance().allContainersForUserIdentity(
+            userIdentity, containerClass, transient, &cacheError);
+        globalLock.release();
+        if (!containers)
+            TarnSetError(error, TarnErrorCodeOf(cacheError, TarnErrorInvalidArgument));
+        return containers;
+    } catch (const std::exception& e) {
+        globalLock.release();
+        TarnSetError(error, TarnHandleCaughtException(__func__, &e));
+    } catch (...) {
+        globalLock.release();
+        TarnSetError(error, TarnHandleCaughtException(__func__, nullptr));
+    }
     return std::nullopt;
 }
 
-void TarnClientConnection::deleteContainerWithContainerIdentity(const TarnContainerIdentityRef&,
-                                                                bool, uint64_t* error) {
-    TarnSetError(error, TarnErrorInvalidCommand);
+// ---- Deletion ----
+
+void TarnClientConnection::deleteContainerWithContainerIdentity(
+    const TarnContainerIdentityRef& identity, bool transient, uint64_t* error) {
+    uint64_t code = TarnSuccess;
+    TarnMetadataRef metadata =
+        createOrLookupContainerWithContainerIdentity(identity, false, transient, true, &code);
+    TarnConcreteContainerIdentityRef concrete = metadata ? metadata->containerIdentity() : nullptr;
+    if (!concrete) {
+        TarnLog(kLogError, __func__,
+                "Failed to lookup existing container to delete-identity: %@, transient: %d",
+                identity, transient);
+        TarnSetError(error, code == TarnSuccess ? TarnErrorInvalidArgument : code);
+        return;
+    }
+    commandQueue_->insertCommand(
+        TarnCommandStageForDelete::commandForStageForDeleteWithContainerIdentities({concrete}, true,
+                                                                                  nullptr));
+    TarnSetError(error, TarnSuccess);
 }
 
 bool TarnClientConnection::completeWithError(uint64_t* error) {

@@ -487,6 +487,30 @@ bool TarnCodeSigningMapping::invalidateCodeSigningInfoForIdentifier(const std::s
     return ok;
 }
 
+void TarnCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChildren(
+    const std::string& identifier, TarnCommandQueue* commandQueue) {
+    // Group clean-up (reference counts, staged deletion of unused groups on
+    // `commandQueue`) joins here once the mapping's write side lands; until
+    // then only the records themselves go.
+    (void)commandQueue;
+    if (identifier.empty()) return;
+    runOnQueue([&] {
+        std::vector<std::string> identifiers = _onQueue_childBundleIdentifiersForParentIdentifier(identifier);
+        identifiers.push_back(identifier);
+        for (const std::string& each : identifiers) {
+            TarnErrorRef e;
+            // An unreadable record is still deleted; only a missing one is skipped.
+            const bool stored = _onQueue_codeSigningEntryForIdentifier(each, &e) ||
+                                !(e && e->code() == TarnErrorDatabaseNotFound);
+            if (!stored) continue;
+            e = nullptr;
+            if (codeSigningMappingDB_->deleteCodeSigningEntryWithIdentifier(each, &e)) continue;
+            TarnLog(kLogError, "removeCodeSigningDictionariesForIdentifierAndItsChildren",
+                    "Failed to clear entitlements for %@ : %llu", each, TarnErrorCodeOf(e, TarnErrorDatabase));
+        }
+    });
+}
+
 bool TarnCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
                                                                                   TarnErrorRef* withError) {
     bool ok = false;

@@ -122,6 +122,12 @@ public:
     bool invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
                                                               TarnErrorRef* withError);
     bool removeAllAdvanceCopiesWithError(TarnErrorRef* error);
+    // Deletes the stored records of the identifier's children, then of the
+    // identifier itself; an identifier without a record is skipped. A failure
+    // is logged and the others are still removed. `commandQueue` receives the
+    // follow-up work of group clean-up.
+    void removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier,
+                                                                  TarnCommandQueue* commandQueue);
     // A connecting client's own entitlements. Registration (with its group
     // clean-up) is not done yet: this answers success without storing.
     uint64_t processCallerRegisteredEntitlements(const PlistDict& entitlements,

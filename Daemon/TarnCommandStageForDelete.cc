@@ -1,0 +1,135 @@
+#include "Daemon/TarnCommandStageForDelete.h"
+
+#include <exception>
+
+#include "Daemon/TarnCodeSigningMapping.h"
+#include "Daemon/TarnContainerCache.h"
+#include "Daemon/TarnError.h"
+#include "Daemon/TarnFileManager.h"
+#include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnLocks.h"
+#include "Daemon/TarnLog.h"
+#include "Daemon/TarnRequestProcessor.h"
+#include "Platform/PlatformLog.h"
+
+namespace tarn {
+
+namespace {
+
+// The cached record of one identity to stage, or nullptr when it is gone.
+TarnMetadataRef cachedContainerForIdentity(TarnContainerCache& cache,
+                                           const TarnContainerIdentityRef& identity) {
+    if (auto concrete = std::dynamic_pointer_cast<const TarnConcreteContainerIdentity>(identity))
+        return cache.containerForContainerIdentity(concrete);
+    TarnErrorRef lookupError;  // not found: nothing to stage
+    return cache.containerForContainerIdentity(identity, false, true, &lookupError);
+}
+
+// A transient bundle shares its identifier's code-signing records with the
+// permanent bundle, if there is one; those records must stay.
+bool keepsCodeSigningRecords(TarnContainerCache& cache, const TarnMetadata& container) {
+    if (!container.transient()) return false;
+    uint64_t code = TarnSuccess;
+    TarnContainerIdentityRef permanent = TarnContainerIdentity::containerIdentityWithIdentifier(
+        container.identifier(), container.containerClass(), &code);
+    if (!permanent) {
+        TarnLog(kLogError, "fromQueue",
+                "Could not construct container identity from %@ to check for permanent copy: %llu",
+                container.identifier(), code);
+        return false;
+    }
+    TarnErrorRef lookupError;
+    if (!cache.containerForContainerIdentity(permanent, false, false, &lookupError)) return false;
+    PlatformLog("unspecified", PlatformLogType::Default,
+                "Skipping removal of code sign mapping since container to be deleted [%@] is "
+                "transient and there's a permanent one; error = %@",
+                container.description(), lookupError);
+    return true;
+}
+
+}  // namespace
+
+std::shared_ptr<TarnCommandStageForDelete>
+TarnCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+    std::vector<TarnContainerIdentityRef> containerIdentities, bool useLocking,
+    ErrorCallback onError) {
+    return std::make_shared<TarnCommandStageForDelete>(std::move(containerIdentities), useLocking,
+                                                       std::move(onError));
+}
+
+TarnCommandStageForDelete::TarnCommandStageForDelete(
+    std::vector<TarnContainerIdentityRef> containerIdentities, bool useLocking,
+    ErrorCallback onError)
+    : useLocking_(useLocking),
+      containerIdentities_(std::move(containerIdentities)),
+      onError_(std::move(onError)) {}
+
+bool TarnCommandStageForDelete::fromQueue(TarnCommandQueue* queue, uint64_t* error) {
+    if (useLocking_) gTarnLocks.write_lock_all_identifiers();
+    uint64_t code = TarnSuccess;
+    bool ok = false;
+    try {
+        ok = stageAll(queue, &code);
+    } catch (const std::exception& e) {
+        code = TarnHandleCaughtException(__func__, &e);
+    } catch (...) {
+        code = TarnHandleCaughtException(__func__, nullptr);
+    }
+    if (useLocking_) gTarnLocks.unlock_all_identifiers();
+    if (ok) return true;
+    if (onError_) onError_(code);
+    TarnSetError(error, code);
+    return false;
+}
+
+bool TarnCommandStageForDelete::stageAll(TarnCommandQueue* queue, uint64_t* error) {
+    auto& cache = TarnContainerCache::sharedInstance();
+    auto& fm = TarnFileManager::defaultManager();
+    const FileURL deathRow = TarnGlobalConfiguration::sharedInstance().deathrowDirectory();
+
+    for (const TarnContainerIdentityRef& identity : containerIdentities_) {
+        if (!identity) continue;
+        TarnMetadataRef container = cachedContainerForIdentity(cache, identity);
+        if (!container) continue;
+
+        const FileURL& url = container->url();
+        const FileURL deathRowURL = PathJoin(deathRow, PathLastComponent(url));
+
+        if (TarnContainerClassIsBundle(container->containerClass()) &&
+            !keepsCodeSigningRecords(cache, *container)) {
+            if (TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance())
+                mapping->removeCodeSigningDictionariesForIdentifierAndItsChildren(
+                    container->identifier(), queue);
+        }
+
+        TarnErrorRef moveError;
+        if (!fm.moveItemAtURL(url, deathRowURL, &moveError)) {
+            TarnLog(kLogDebug, "fromQueue", "Couldn't stage for deletion from %@ to %@: %@", url,
+                    deathRowURL, moveError);
+            TarnErrorRef removeError;
+            if (!fm.removeItemAtURL(url, &removeError)) {
+                // Logged only: the container stays live and cached, the others go on.
+                (void)TARN_ERROR(TarnErrorDeleteFailed, removeError,
+                                 "Failed to delete container at %@: %@", url, removeError);
+                continue;
+            }
+        }
+
+        TarnErrorRef cacheError;
+        if (!cache.removeContainerForUserIdentity(container->userIdentity(),
+                                                  container->containerClass(),
+                                                  container->identifier(), container->transient(),
+                                                  &cacheError)) {
+            TarnErrorRef e = TARN_ERROR(
+                TarnErrorCacheRemoveFailed, cacheError,
+                "Failed to remove from cache id: %@, class: %ld, transient: %d",
+                container->identifier(), static_cast<int64_t>(container->containerClass()),
+                container->transient());
+            TarnSetError(error, e->code());
+            return false;
+        }
+    }
+    return true;
+}
+
+}  // namespace tarn
