@@ -1,0 +1,413 @@
+#include "Daemon/TarnContainerCommands.h"
+
+#include <functional>
+#include <memory>
+#include <utility>
+#include <vector>
+
+#include "Daemon/TarnClientConnection.h"
+#include "Daemon/TarnClientIdentity.h"
+#include "Daemon/TarnCodeSigningMapping.h"
+#include "Daemon/TarnCommandStageForDelete.h"
+#include "Daemon/TarnCommandTable.h"
+#include "Daemon/TarnContainerCache.h"
+#include "Daemon/TarnError.h"
+#include "Daemon/TarnLog.h"
+#include "Daemon/TarnUserIdentityCache.h"
+#include "Platform/HostConfiguration.h"
+#include "Platform/PlatformLog.h"
+#include "Platform/Sandbox.h"
+
+namespace tarn {
+
+namespace {
+
+// Platform-log category of the decoding lines: they belong to request handling.
+constexpr const char* kDecodingCategory = "conduit";
+
+// Shared-device mode: every request acts for the caller's own user.
+constexpr uint64_t kMultiUserSharedDeviceBit = 1ull << 31;
+
+std::string describe(const TarnUserIdentitySet& identities) {
+    std::string text = "(";
+    for (const auto& identity : identities) {
+        if (text.size() > 1) text += ", ";
+        text += identity ? identity->description() : std::string("(null)");
+    }
+    return text + ")";
+}
+
+TarnUserIdentityRef clientUserIdentity(const TarnClientConnection& connection) {
+    const auto& client = connection.clientIdentity();
+    return client ? client->userIdentity() : nullptr;
+}
+
+const PlistArray* arrayForKey(const PlistValue& request, std::string_view key) {
+    const PlistValue* value = request.find(key);
+    return value ? value->asArray() : nullptr;
+}
+
+}  // namespace
+
+// ---- Request decoding ----
+
+std::optional<std::string> stringForKey(const PlistValue& request, std::string_view key) {
+    const PlistValue* value = request.find(key);
+    if (!value) return std::nullopt;
+    if (const std::string* s = value->asString()) return *s;
+    return std::nullopt;
+}
+
+std::optional<PlistValue> plistForKey(const PlistValue& request, std::string_view key) {
+    const PlistValue* value = request.find(key);
+    if (!value || value->isNull()) return std::nullopt;
+    return *value;
+}
+
+uint64_t uint64ForKey(const PlistValue& request, std::string_view key) {
+    const PlistValue* value = request.find(key);
+    return value ? value->asUInt64().value_or(0) : 0;
+}
+
+bool boolForKey(const PlistValue& request, std::string_view key) {
+    const PlistValue* value = request.find(key);
+    return value ? value->asBool().value_or(false) : false;
+}
+
+std::optional<std::string> identifierWithDefault(const PlistValue& request,
+                                                 const TarnClientConnection& connection) {
+    if (request.find("Identifier")) return stringForKey(request, "Identifier");
+    std::string own = connection.clientBundleIdentifier();
+    if (own.empty()) return std::nullopt;  // an anonymous caller has no container of its own
+    return own;
+}
+
+TarnUserIdentityRef userIdentityForContainerIdentifier(const TarnClientConnection& connection,
+                                                       const std::optional<std::string>& identifier,
+                                                       TarnContainerClass containerClass,
+                                                       uint64_t* error) {
+    TarnUserIdentityRef own = clientUserIdentity(connection);
+    TarnUserIdentitySet candidates;
+    if (own) candidates.insert(own);
+
+    // A caller without a specific persona acts for whichever persona the
+    // application belongs to; global containers have no persona to choose.
+    if (own && own->isNoSpecificPersona() && TarnContainerClassIsPerUser(containerClass)) {
+        std::optional<std::string> bundleIdentifier = identifier;
+        if (containerClass == TarnContainerClassPluginData ||
+            containerClass == TarnContainerClassVPNPluginData) {
+            // Plug-ins live in their application's persona.
+            std::string parent;
+            if (TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance())
+                parent = mapping->parentIdentifierForChildIdentifier(identifier.value_or(""));
+            bundleIdentifier = parent.empty() ? std::nullopt : std::optional<std::string>(parent);
+        }
+        candidates = TarnContainerCache::sharedInstance().userIdentityCache().userIdentitiesForBundleIdentifier(
+            bundleIdentifier.value_or(""));
+        PlatformLog(kDecodingCategory, PlatformLogType::Debug,
+                    "Chose bundleIdentifier: %@, userIdentities: %@ for identifier: %@, class: %llu",
+                    bundleIdentifier, describe(candidates), identifier, containerClass);
+    }
+
+    if (candidates.size() == 1) return *candidates.begin();
+    if (candidates.size() > 1) {
+        if (candidates.count(own)) return own;
+        PlatformLog(kDecodingCategory, PlatformLogType::Fault,
+                    "Ambiguous user identity from [%@]. Expected one of [%@], got %@",
+                    connection.clientBundleIdentifier(), describe(candidates), own);
+    } else {
+        TarnLog(kLogError, __func__, "%@ trying to look up persona for %llu:%@",
+                connection.clientBundleIdentifier(), containerClass, identifier);
+    }
+    TarnSetError(error, TarnErrorPersonaMismatch);
+    return nullptr;
+}
+
+TarnUserIdentityRef userIdentityForPersonaUniqueString(const TarnClientConnection& connection,
+                                                       const std::optional<std::string>& personaUniqueString,
+                                                       uint64_t* error) {
+    TarnUserIdentityRef own = clientUserIdentity(connection);
+    const auto& flags = HostConfiguration::shared().multiUserFlags;
+    if (flags && (*flags & kMultiUserSharedDeviceBit)) {
+        if (!own) TarnSetError(error, TarnErrorPersonaMismatch);
+        return own;
+    }
+    TarnUserIdentityRef found =
+        connection.userIdentityCache().userIdentityForCurrentUserWithPersonaUniqueString(
+            personaUniqueString);
+    if (!found) {
+        PlatformLog(kDecodingCategory, PlatformLogType::Error,
+                    "Cannot reconstitute a user identity from provided persona unique string; "
+                    "client = [%@], personaUniqueString = [%@]",
+                    connection.clientBundleIdentifier(), personaUniqueString);
+        TarnSetError(error, TarnErrorPersonaMismatch);
+        return nullptr;
+    }
+    if (own && (own->isNoSpecificPersona() || own->isEqualToUserIdentity(*found))) return found;
+    PlatformLog(kDecodingCategory, PlatformLogType::Error,
+                "Persona unique string is not valid for this client; client = [%@], "
+                "personaUniqueString = [%@]",
+                connection.clientBundleIdentifier(), personaUniqueString);
+    TarnSetError(error, TarnErrorPersonaMismatch);
+    return nullptr;
+}
+
+TarnContainerIdentityRef validatedContainerIdentity(const PlistValue& request,
+                                                    const TarnClientConnection& connection,
+                                                    const char* identifierKey,
+                                                    const char* classKey, uint64_t* error) {
+    std::optional<std::string> identifier = identifierKey ? stringForKey(request, identifierKey)
+                                                          : identifierWithDefault(request, connection);
+    if (!identifier) {
+        TarnSetError(error, TarnErrorMissingIdentifier);
+        return nullptr;
+    }
+    const TarnContainerClass containerClass = uint64ForKey(request, classKey ? classKey : "ContainerClass");
+    if (!TarnContainerClassIsValid(containerClass)) {
+        TarnSetError(error, TarnErrorInvalidContainerClass);
+        return nullptr;
+    }
+    TarnUserIdentityRef user =
+        userIdentityForContainerIdentifier(connection, identifier, containerClass, error);
+    if (!user) return nullptr;
+    return TarnContainerIdentity::containerIdentityWithUserIdentity(user, identifier, containerClass,
+                                                                   error);
+}
+
+TarnConcreteContainerIdentityRef concreteContainerIdentity(const PlistValue& request,
+                                                           const TarnClientConnection& connection,
+                                                           const TarnConcreteIdentityKeys& keys,
+                                                           uint64_t* error) {
+    const PlistValue* identifier = request.find(keys.identifier);
+    if (!identifier || identifier->isNull()) {
+        TarnSetError(error, TarnErrorMissingIdentifier);
+        return nullptr;
+    }
+    // Out-of-range classes are refused by the identity itself (11), not here.
+    const TarnContainerClass containerClass = uint64ForKey(request, keys.containerClass);
+    TarnUserIdentityRef user;
+    if (TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
+        user = userIdentityForPersonaUniqueString(
+            connection, stringForKey(request, keys.personaUniqueString), error);
+        if (!user) return nullptr;
+    } else {
+        user = clientUserIdentity(connection);
+    }
+    return TarnConcreteContainerIdentity::containerIdentityWithUUID(request.find(keys.uuid), user,
+                                                                   identifier, containerClass, error);
+}
+
+const char* sandboxExtensionClassForContainer(TarnContainerClass containerClass,
+                                              const TarnUserIdentity* userIdentity) {
+    if (!userIdentity || !userIdentity->isEnterprise()) return nullptr;
+    switch (containerClass) {
+        case TarnContainerClassAppData:
+        case TarnContainerClassPluginData:
+        case TarnContainerClassVPNPluginData:
+        case TarnContainerClassDaemonData:
+            return kSandboxExtensionClassContainer;
+        case TarnContainerClassAppGroup:
+            return kSandboxExtensionClassApplicationGroup;
+        default:
+            return nullptr;
+    }
+}
+
+void issueSandboxExtension(PlistValue& reply, const char* replyKey, const TarnMetadata& container,
+                           const TarnClientIdentity* clientIdentity) {
+    if (!clientIdentity || !clientIdentity->isSandboxed()) return;
+    const TarnUserIdentity* owner = container.userIdentity().get();
+    const bool enterprise = owner && owner->isEnterprise();
+    const std::string& path = container.url();
+    const char* extensionClass =
+        sandboxExtensionClassForContainer(container.containerClass(), owner);
+    if (!extensionClass) {
+        PlatformLog("sandbox", PlatformLogType::Info,
+                    "%@ is sandboxed and container (type: %llu) is enterprise: %d. NOT issuing "
+                    "token for path: %s",
+                    clientIdentity->bundleIdentifier(), container.containerClass(), enterprise,
+                    path);
+        return;
+    }
+    PlatformLog("sandbox", PlatformLogType::Default,
+                "%@ is sandboxed and container (type: %llu) is enterprise: %d. Issuing token for "
+                "path: %s",
+                clientIdentity->bundleIdentifier(), container.containerClass(), enterprise, path);
+    int err = 0;
+    std::optional<std::string> token =
+        SandboxExtensionIssueFile(extensionClass, path, clientIdentity->auditToken(), &err);
+    if (!token) {
+        TarnLog(kLogError, __func__, "sandbox_extension_issue_file failed for %@ at path %s: %d",
+                clientIdentity->bundleIdentifier(), path, err);
+        return;
+    }
+    reply.set(replyKey, std::move(*token));
+}
+
+// ---- Handlers ----
+
+void TarnHandleCreateOrLookupCommand(const PlistValue& request, PlistValue& reply,
+                                     TarnClientConnection* connection, uint64_t* error) {
+    TarnContainerIdentityRef identity =
+        validatedContainerIdentity(request, *connection, nullptr, "ContainerClass", error);
+    if (!identity) return;
+    TarnMetadataRef container = connection->createOrLookupContainerWithContainerIdentity(
+        identity, boolForKey(request, "CreateIfNecessary"), boolForKey(request, "Transient"),
+        /*useLocking=*/true, error);
+    if (!container) return;
+    reply.set("ReplyUUID", container->uuid());
+    reply.set("ReplyExisted", container->existed());
+    reply.set("ReplyPath", container->url());
+    reply.set("ReplyIdentifier", container->identifier());
+    if (container->userIdentity() && container->userIdentity()->personaUniqueString())
+        reply.set("ReplyPersonaUniqueString", *container->userIdentity()->personaUniqueString());
+    issueSandboxExtension(reply, "ReplySandboxToken", *container,
+                          connection->clientIdentity().get());
+}
+
+void TarnHandleContainersWithClassCommand(const PlistValue& request, PlistValue& reply,
+                                          TarnClientConnection* connection, uint64_t* error) {
+    std::optional<std::vector<TarnMetadataRef>> containers = connection->containersWithClass(
+        uint64ForKey(request, "ContainerClass"), boolForKey(request, "Transient"), error);
+    if (!containers) return;
+    PlistArray identifiers, uuids, personas;
+    identifiers.reserve(containers->size());
+    uuids.reserve(containers->size());
+    personas.reserve(containers->size());
+    for (const TarnMetadataRef& container : *containers) {
+        if (!container) continue;  // keeps the three arrays parallel
+        identifiers.emplace_back(container->identifier());
+        uuids.emplace_back(container->uuid());
+        const auto& owner = container->userIdentity();
+        personas.emplace_back(owner && owner->personaUniqueString() ? *owner->personaUniqueString()
+                                                                    : std::string());
+    }
+    reply.set("ReplyIdsArray", std::move(identifiers));
+    reply.set("ReplyUUIDsArray", std::move(uuids));
+    reply.set("ReplyPersonaUniqueStringsArray", std::move(personas));
+}
+
+void TarnHandleStageForDeleteCommand(const PlistValue& request, PlistValue& reply,
+                                     TarnClientConnection* connection, uint64_t* error) {
+    static const PlistArray kNone;
+    const PlistArray* classes = arrayForKey(request, "ContainerClassesArray");
+    const PlistArray* uuids = arrayForKey(request, "UUIDsArray");
+    const PlistArray* identifiers = arrayForKey(request, "IdentifiersArray");
+    const PlistArray* personas = arrayForKey(request, "PersonaUniqueStringsArray");
+    if (!classes) classes = &kNone;
+    if (!uuids) uuids = &kNone;
+    if (!identifiers) identifiers = &kNone;
+    if (!personas) personas = &kNone;
+    const size_t count = classes->size();
+    if (count != uuids->size() || count != identifiers->size() || count != personas->size()) {
+        TarnLog(kLogError, "stageContainerForDelete",
+                "Can't act on an invalid input: UUID count: %ld, class count: %ld, ID count: %lu, "
+                "persona string count: %lu",
+                static_cast<long>(uuids->size()), static_cast<long>(count), identifiers->size(),
+                personas->size());
+        TarnSetError(error, TarnErrorBadInput);
+        return;
+    }
+
+    std::vector<TarnContainerIdentityRef> identities;
+    identities.reserve(count);
+    for (size_t i = 0; i < count; ++i) {
+        const TarnContainerClass containerClass = (*classes)[i].asUInt64().value_or(0);
+        TarnUserIdentityRef user;
+        if (TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
+            const std::string* persona = (*personas)[i].asString();
+            user = userIdentityForPersonaUniqueString(
+                *connection, persona ? std::optional<std::string>(*persona) : std::nullopt, error);
+        } else {
+            user = connection->userIdentityCache().userIdentityForCurrentContext();
+        }
+        // One container of someone else's persona spoils the whole request.
+        if (!user) {
+            if (*error == TarnSuccess) TarnSetError(error, TarnErrorPersonaMismatch);
+            return;
+        }
+        // A malformed entry is skipped; its code stays in the slot.
+        TarnConcreteContainerIdentityRef identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
+            &(*uuids)[i], user, &(*identifiers)[i], containerClass, error);
+        if (identity) identities.push_back(std::move(identity));
+    }
+    connection->commandQueue()->insertCommand(
+        TarnCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+            std::move(identities), /*useLocking=*/true, nullptr));
+}
+
+void TarnHandleDeleteDeathRowCommand(const PlistValue& request, PlistValue& reply,
+                                     TarnClientConnection* connection, uint64_t* error) {
+    std::shared_ptr<TarnDeferredReply> deferred = TarnTakeDeferredReply();
+    if (!deferred) {
+        // Called outside a request (no reply to keep): just start the pass.
+        connection->deleteContainersOnDeathRowWithCompletion(nullptr);
+        return;
+    }
+    connection->deleteContainersOnDeathRowWithCompletion(
+        [deferred](uint64_t code) { deferred->send(code); });
+}
+
+void TarnHandleSetInfoValueCommand(const PlistValue& request, PlistValue& reply,
+                                   TarnClientConnection* connection, uint64_t* error) {
+    TarnConcreteContainerIdentityRef identity = concreteContainerIdentity(request, *connection, {}, error);
+    if (!identity) return;
+    connection->setInfoValue(plistForKey(request, "Value"), stringForKey(request, "Key"), identity,
+                             /*useLocking=*/true, error);
+}
+
+void TarnHandleInfoValueCommand(const PlistValue& request, PlistValue& reply,
+                                TarnClientConnection* connection, uint64_t* error) {
+    TarnConcreteContainerIdentityRef identity = concreteContainerIdentity(request, *connection, {}, error);
+    if (!identity) return;
+    std::optional<PlistValue> value =
+        connection->infoValueForKey(stringForKey(request, "Key"), identity, /*useLocking=*/true, error);
+    if (value) reply.set("ReplyInfoValue", std::move(*value));
+}
+
+void TarnHandleMetadataCommand(const PlistValue& request, PlistValue& reply,
+                               TarnClientConnection* connection, uint64_t* error) {
+    TarnConcreteContainerIdentityRef identity = concreteContainerIdentity(request, *connection, {}, error);
+    if (!identity) return;
+    TarnMetadataRef container = connection->metadataWithContainerIdentity(identity, error);
+    if (!container) return;
+    reply.set("ReplyPath", container->url());
+    reply.set("ReplyTransient", container->transient());
+    if (boolForKey(request, "InfoDictRequested") && container->info())
+        reply.set("ReplyInfoDictionary", *container->info());
+    issueSandboxExtension(reply, "ReplySandboxToken", *container,
+                          connection->clientIdentity().get());
+    if (container->userIdentity() && container->userIdentity()->personaUniqueString())
+        reply.set("ReplyPersonaUniqueString", *container->userIdentity()->personaUniqueString());
+}
+
+void TarnHandleRecreateStructureCommand(const PlistValue& request, PlistValue& reply,
+                                        TarnClientConnection* connection, uint64_t* error) {
+    TarnConcreteContainerIdentityRef identity = concreteContainerIdentity(request, *connection, {}, error);
+    if (!identity) return;
+    connection->recreateDefaultStructureWithContainerIdentity(identity, error);
+}
+
+void TarnHandleRegenerateUUIDCommand(const PlistValue& request, PlistValue& reply,
+                                     TarnClientConnection* connection, uint64_t* error) {
+    TarnConcreteContainerIdentityRef identity = concreteContainerIdentity(request, *connection, {}, error);
+    if (!identity) return;
+    connection->regenerateDirectoryUUIDWithContainerIdentity(identity, error);
+}
+
+void TarnHandleDeleteContainerCommand(const PlistValue& request, PlistValue& reply,
+                                      TarnClientConnection* connection, uint64_t* error) {
+    TarnContainerIdentityRef identity =
+        validatedContainerIdentity(request, *connection, "Identifier", "ContainerClass", error);
+    if (!identity) return;
+    connection->deleteContainerWithContainerIdentity(identity, boolForKey(request, "Transient"), error);
+}
+
+void TarnHandleDiskUsageCommand(const PlistValue& request, PlistValue& reply,
+                                TarnClientConnection* connection, uint64_t* error) {
+    TarnConcreteContainerIdentityRef identity = concreteContainerIdentity(request, *connection, {}, error);
+    if (!identity) return;
+    reply.set("ReplyDiskUsage", connection->diskUsageWithContainerIdentity(identity, error));
+}
+
+}  // namespace tarn
