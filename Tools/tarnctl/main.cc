@@ -2,6 +2,7 @@
 #include <CLI/CLI.hpp>
 
 #include "Platform/PlatformLog.h"
+#include "Tools/tarnctl/Container.h"
 #include "Tools/tarnctl/Maintenance.h"
 #include "Tools/tarnctl/SandboxItems.h"
 #include "Tools/tarnctl/Subcommands.h"
@@ -12,6 +13,7 @@ namespace {
 // Every subcommand, in the order --help lists them. Add a line per new file.
 constexpr SubcommandSetup kSubcommands[] = {
     SetupSendCommand,
+    SetupContainerCommands,
     SetupLockCommands,
     SetupWaitNotificationCommand,
     SetupSimulateRebootCommand,
@@ -39,6 +41,7 @@ Exit codes:
 
 Examples:
   tarnctl --root /tmp/scratch send '{"Command": 27}'
+  tarnctl --root /tmp/scratch container create com.example.notes
   tarnctl --root /tmp/scratch lock
   tarnctl --root /tmp/scratch wait-notification com.ostrea.tarnkeeper.cleanup-complete --timeout 5)";
 
