@@ -1,0 +1,106 @@
+// Container requests as a client sends them: arbitrary bytes decoded as a
+// Conduit body and handed to the request-decoding rules and to the
+// stage-for-deletion handler (which only queues work, so nothing on disk is
+// touched). Whatever the request holds, decoding either builds an identity or
+// reports a code; it never crashes and never reports success without one.
+#include <cstddef>
+#include <cstdint>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <memory>
+#include <string>
+
+#include "Daemon/TarnClientConnection.h"
+#include "Daemon/TarnContainerCommands.h"
+#include "Daemon/TarnUserIdentityCache.h"
+#include "Platform/ConduitWire.h"
+#include "Platform/PlatformLog.h"
+#include "Platform/RootPrefix.h"
+
+using namespace tarn;
+
+namespace {
+
+std::shared_ptr<TarnClientConnection> gAnyPersona;
+std::shared_ptr<TarnClientConnection> gEnterprise;
+
+void writeFile(const std::string& path, const std::string& contents) {
+    std::ofstream(path, std::ios::binary) << contents;
+}
+
+// A scratch root with a mobile account and a personal and an enterprise persona.
+void makeRoot() {
+    const char* tmp = std::getenv("TMPDIR");
+    std::string dir = std::string(tmp && *tmp ? tmp : "/tmp") + "/container_request_fuzz.XXXXXX";
+    if (!mkdtemp(dir.data())) std::abort();
+    // Left behind on exit: the persona roster's watcher still runs then, and
+    // removing its directory under it would race the process's teardown.
+    SetRootPrefix(dir);
+    std::filesystem::create_directories(dir + "/etc/tarnkeeper");
+    std::filesystem::create_directories(dir + "/private/var/mobile");
+    writeFile(dir + "/etc/passwd", "mobile:x:501:501::/private/var/mobile:/bin/false\n");
+    writeFile(dir + "/etc/group", "mobile:x:501:\n");
+    PlistValue personal{PlistDict{}}, enterprise{PlistDict{}};
+    personal.set("Type", "personal");
+    personal.set("UniqueString", "P");
+    personal.set("PersonaID", uint64_t{1000});
+    enterprise.set("Type", "enterprise");
+    enterprise.set("UniqueString", "E");
+    enterprise.set("PersonaID", uint64_t{1001});
+    enterprise.set("BundleIDs", PlistArray{PlistValue("com.e")});
+    auto bytes = PlistValue(PlistArray{personal, enterprise}).toBinary();
+    writeFile(dir + "/etc/tarnkeeper/personas.plist", std::string(bytes.begin(), bytes.end()));
+}
+
+std::shared_ptr<TarnClientConnection> caller(TarnUserIdentityRef user) {
+    auto identity = TarnClientIdentity::initWithBundleIdentifier(
+        "com.fuzz", 501, 501, 1, std::move(user), PlistValue(PlistDict{}), true, TarnAuditToken{}, false);
+    return TarnClientConnection::initWithClientIdentity(identity, true, true, true, std::nullopt,
+                                                        std::nullopt, std::make_shared<TarnCommandQueue>());
+}
+
+void checkConnection(const PlistValue& request, TarnClientConnection& connection) {
+    uint64_t error = TarnSuccess;
+    if (!validatedContainerIdentity(request, connection, nullptr, "ContainerClass", &error) &&
+        error == TarnSuccess)
+        std::abort();
+    error = TarnSuccess;
+    if (!concreteContainerIdentity(request, connection, {}, &error) && error == TarnSuccess) std::abort();
+    error = TarnSuccess;
+    TarnConcreteIdentityKeys old{"OldIdentifier", "OldContainerClass", "OldContainerUUID",
+                                 "OldPersonaUniqueString"};
+    if (!concreteContainerIdentity(request, connection, old, &error) && error == TarnSuccess) std::abort();
+
+    auto queued = std::make_shared<TarnCommandQueue>();
+    auto fresh = TarnClientConnection::initWithClientIdentity(
+        connection.clientIdentity(), true, true, true, std::nullopt, std::nullopt, queued);
+    PlistValue reply{PlistDict{}};
+    error = TarnSuccess;
+    TarnHandleStageForDeleteCommand(request, reply, fresh.get(), &error);
+    // A refused request queues nothing.
+    if ((error == TarnErrorBadInput || error == TarnErrorPersonaMismatch) && queued->TEST_count() != 0)
+        std::abort();
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerInitialize(int*, char***) {
+    PlatformLogSetQuiet(true);
+    makeRoot();
+    TarnUserIdentityCache::TEST_setPersonasAreSupported(true);
+    auto& cache = TarnUserIdentitySharedCache::sharedInstance();
+    gAnyPersona = caller(cache.unspecificUserIdentity());
+    gEnterprise = caller(cache.userIdentityForCurrentUserWithPersonaUniqueString(std::string("E")));
+    if (!gAnyPersona || !gEnterprise) std::abort();
+    return 0;
+}
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+    std::string why;
+    auto request = conduit::DecodeBody(data, size, &why);
+    if (!request || !request->isDict()) return 0;
+    checkConnection(*request, *gAnyPersona);
+    checkConnection(*request, *gEnterprise);
+    return 0;
+}
