@@ -102,11 +102,13 @@ TarnUserIdentityRef userIdentityForContainerIdentifier(const TarnClientConnectio
                 parent = mapping->parentIdentifierForChildIdentifier(identifier.value_or(""));
             bundleIdentifier = parent.empty() ? std::nullopt : std::optional<std::string>(parent);
         }
-        candidates = TarnContainerCache::sharedInstance().userIdentityCache().userIdentitiesForBundleIdentifier(
-            bundleIdentifier.value_or(""));
-        PlatformLog(kDecodingCategory, PlatformLogType::Debug,
-                    "Chose bundleIdentifier: %@, userIdentities: %@ for identifier: %@, class: %llu",
-                    bundleIdentifier, describe(candidates), identifier, containerClass);
+        candidates = TarnContainerCache::sharedInstance()
+                         .userIdentityCache()
+                         .userIdentitiesForBundleIdentifier(bundleIdentifier.value_or(""));
+        PlatformLog(
+            kDecodingCategory, PlatformLogType::Debug,
+            "Chose bundleIdentifier: %@, userIdentities: %@ for identifier: %@, class: %llu",
+            bundleIdentifier, describe(candidates), identifier, containerClass);
     }
 
     if (candidates.size() == 1) return *candidates.begin();
@@ -123,9 +125,9 @@ TarnUserIdentityRef userIdentityForContainerIdentifier(const TarnClientConnectio
     return nullptr;
 }
 
-TarnUserIdentityRef userIdentityForPersonaUniqueString(const TarnClientConnection& connection,
-                                                       const std::optional<std::string>& personaUniqueString,
-                                                       uint64_t* error) {
+TarnUserIdentityRef userIdentityForPersonaUniqueString(
+    const TarnClientConnection& connection, const std::optional<std::string>& personaUniqueString,
+    uint64_t* error) {
     TarnUserIdentityRef own = clientUserIdentity(connection);
     const auto& flags = HostConfiguration::shared().multiUserFlags;
     if (flags && (*flags & kMultiUserSharedDeviceBit)) {
@@ -154,15 +156,17 @@ TarnUserIdentityRef userIdentityForPersonaUniqueString(const TarnClientConnectio
 
 TarnContainerIdentityRef validatedContainerIdentity(const PlistValue& request,
                                                     const TarnClientConnection& connection,
-                                                    const char* identifierKey,
-                                                    const char* classKey, uint64_t* error) {
-    std::optional<std::string> identifier = identifierKey ? stringForKey(request, identifierKey)
-                                                          : identifierWithDefault(request, connection);
+                                                    const char* identifierKey, const char* classKey,
+                                                    uint64_t* error) {
+    std::optional<std::string> identifier = identifierKey
+                                                ? stringForKey(request, identifierKey)
+                                                : identifierWithDefault(request, connection);
     if (!identifier) {
         TarnSetError(error, TarnErrorMissingIdentifier);
         return nullptr;
     }
-    const TarnContainerClass containerClass = uint64ForKey(request, classKey ? classKey : "ContainerClass");
+    const TarnContainerClass containerClass =
+        uint64ForKey(request, classKey ? classKey : "ContainerClass");
     if (!TarnContainerClassIsValid(containerClass)) {
         TarnSetError(error, TarnErrorInvalidContainerClass);
         return nullptr;
@@ -170,8 +174,8 @@ TarnContainerIdentityRef validatedContainerIdentity(const PlistValue& request,
     TarnUserIdentityRef user =
         userIdentityForContainerIdentifier(connection, identifier, containerClass, error);
     if (!user) return nullptr;
-    return TarnContainerIdentity::containerIdentityWithUserIdentity(user, identifier, containerClass,
-                                                                   error);
+    return TarnContainerIdentity::containerIdentityWithUserIdentity(user, identifier,
+                                                                    containerClass, error);
 }
 
 TarnConcreteContainerIdentityRef concreteContainerIdentity(const PlistValue& request,
@@ -193,8 +197,8 @@ TarnConcreteContainerIdentityRef concreteContainerIdentity(const PlistValue& req
     } else {
         user = clientUserIdentity(connection);
     }
-    return TarnConcreteContainerIdentity::containerIdentityWithUUID(request.find(keys.uuid), user,
-                                                                   identifier, containerClass, error);
+    return TarnConcreteContainerIdentity::containerIdentityWithUUID(
+        request.find(keys.uuid), user, identifier, containerClass, error);
 }
 
 const char* sandboxExtensionClassForContainer(TarnContainerClass containerClass,
@@ -327,8 +331,9 @@ void TarnHandleStageForDeleteCommand(const PlistValue& request, PlistValue& repl
             return;
         }
         // A malformed entry is skipped; its code stays in the slot.
-        TarnConcreteContainerIdentityRef identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-            &(*uuids)[i], user, &(*identifiers)[i], containerClass, error);
+        TarnConcreteContainerIdentityRef identity =
+            TarnConcreteContainerIdentity::containerIdentityWithUUID(
+                &(*uuids)[i], user, &(*identifiers)[i], containerClass, error);
         if (identity) identities.push_back(std::move(identity));
     }
     connection->commandQueue()->insertCommand(
@@ -350,7 +355,8 @@ void TarnHandleDeleteDeathRowCommand(const PlistValue& request, PlistValue& repl
 
 void TarnHandleSetInfoValueCommand(const PlistValue& request, PlistValue& reply,
                                    TarnClientConnection* connection, uint64_t* error) {
-    TarnConcreteContainerIdentityRef identity = concreteContainerIdentity(request, *connection, {}, error);
+    TarnConcreteContainerIdentityRef identity =
+        concreteContainerIdentity(request, *connection, {}, error);
     if (!identity) return;
     connection->setInfoValue(plistForKey(request, "Value"), stringForKey(request, "Key"), identity,
                              /*useLocking=*/true, error);
@@ -358,16 +364,18 @@ void TarnHandleSetInfoValueCommand(const PlistValue& request, PlistValue& reply,
 
 void TarnHandleInfoValueCommand(const PlistValue& request, PlistValue& reply,
                                 TarnClientConnection* connection, uint64_t* error) {
-    TarnConcreteContainerIdentityRef identity = concreteContainerIdentity(request, *connection, {}, error);
+    TarnConcreteContainerIdentityRef identity =
+        concreteContainerIdentity(request, *connection, {}, error);
     if (!identity) return;
-    std::optional<PlistValue> value =
-        connection->infoValueForKey(stringForKey(request, "Key"), identity, /*useLocking=*/true, error);
+    std::optional<PlistValue> value = connection->infoValueForKey(
+        stringForKey(request, "Key"), identity, /*useLocking=*/true, error);
     if (value) reply.set("ReplyInfoValue", std::move(*value));
 }
 
 void TarnHandleMetadataCommand(const PlistValue& request, PlistValue& reply,
                                TarnClientConnection* connection, uint64_t* error) {
-    TarnConcreteContainerIdentityRef identity = concreteContainerIdentity(request, *connection, {}, error);
+    TarnConcreteContainerIdentityRef identity =
+        concreteContainerIdentity(request, *connection, {}, error);
     if (!identity) return;
     TarnMetadataRef container = connection->metadataWithContainerIdentity(identity, error);
     if (!container) return;
@@ -383,14 +391,16 @@ void TarnHandleMetadataCommand(const PlistValue& request, PlistValue& reply,
 
 void TarnHandleRecreateStructureCommand(const PlistValue& request, PlistValue& reply,
                                         TarnClientConnection* connection, uint64_t* error) {
-    TarnConcreteContainerIdentityRef identity = concreteContainerIdentity(request, *connection, {}, error);
+    TarnConcreteContainerIdentityRef identity =
+        concreteContainerIdentity(request, *connection, {}, error);
     if (!identity) return;
     connection->recreateDefaultStructureWithContainerIdentity(identity, error);
 }
 
 void TarnHandleRegenerateUUIDCommand(const PlistValue& request, PlistValue& reply,
                                      TarnClientConnection* connection, uint64_t* error) {
-    TarnConcreteContainerIdentityRef identity = concreteContainerIdentity(request, *connection, {}, error);
+    TarnConcreteContainerIdentityRef identity =
+        concreteContainerIdentity(request, *connection, {}, error);
     if (!identity) return;
     connection->regenerateDirectoryUUIDWithContainerIdentity(identity, error);
 }
@@ -400,12 +410,14 @@ void TarnHandleDeleteContainerCommand(const PlistValue& request, PlistValue& rep
     TarnContainerIdentityRef identity =
         validatedContainerIdentity(request, *connection, "Identifier", "ContainerClass", error);
     if (!identity) return;
-    connection->deleteContainerWithContainerIdentity(identity, boolForKey(request, "Transient"), error);
+    connection->deleteContainerWithContainerIdentity(identity, boolForKey(request, "Transient"),
+                                                     error);
 }
 
 void TarnHandleDiskUsageCommand(const PlistValue& request, PlistValue& reply,
                                 TarnClientConnection* connection, uint64_t* error) {
-    TarnConcreteContainerIdentityRef identity = concreteContainerIdentity(request, *connection, {}, error);
+    TarnConcreteContainerIdentityRef identity =
+        concreteContainerIdentity(request, *connection, {}, error);
     if (!identity) return;
     reply.set("ReplyDiskUsage", connection->diskUsageWithContainerIdentity(identity, error));
 }

@@ -54,9 +54,9 @@ TarnUserIdentityRef userIdentityForContainerIdentifier(const TarnClientConnectio
 // The user identity a persona unique string names, as long as the caller may
 // act for it (a caller without a specific persona may act for any). Empty with
 // 76 otherwise. In shared-device mode the caller's own identity, always.
-TarnUserIdentityRef userIdentityForPersonaUniqueString(const TarnClientConnection& connection,
-                                                       const std::optional<std::string>& personaUniqueString,
-                                                       uint64_t* error);
+TarnUserIdentityRef userIdentityForPersonaUniqueString(
+    const TarnClientConnection& connection, const std::optional<std::string>& personaUniqueString,
+    uint64_t* error);
 
 // A container identity from an identifier key and a class key, validated:
 // 18 without identifier, 20 for a class outside 1 to 13, 76 when the persona
@@ -64,8 +64,8 @@ TarnUserIdentityRef userIdentityForPersonaUniqueString(const TarnClientConnectio
 // bundle identifier as default; otherwise the key is required.
 TarnContainerIdentityRef validatedContainerIdentity(const PlistValue& request,
                                                     const TarnClientConnection& connection,
-                                                    const char* identifierKey,
-                                                    const char* classKey, uint64_t* error);
+                                                    const char* identifierKey, const char* classKey,
+                                                    uint64_t* error);
 
 // Request keys of a concrete identity (the replace command reads two sets).
 struct TarnConcreteIdentityKeys {
@@ -111,7 +111,8 @@ void TarnHandleInfoValueCommand(const PlistValue& request, PlistValue& reply,
 void TarnHandleMetadataCommand(const PlistValue& request, PlistValue& reply,
                                TarnClientConnection* connection, uint64_t* error);  // 7
 void TarnHandleRecreateStructureCommand(const PlistValue& request, PlistValue& reply,
-                                        TarnClientConnection* connection, uint64_t* error);  // 8, 22
+                                        TarnClientConnection* connection,
+                                        uint64_t* error);  // 8, 22
 void TarnHandleRegenerateUUIDCommand(const PlistValue& request, PlistValue& reply,
                                      TarnClientConnection* connection, uint64_t* error);  // 9
 void TarnHandleDeleteContainerCommand(const PlistValue& request, PlistValue& reply,

@@ -55,9 +55,11 @@ void makeRoot() {
 
 std::shared_ptr<TarnClientConnection> caller(TarnUserIdentityRef user) {
     auto identity = TarnClientIdentity::initWithBundleIdentifier(
-        "com.fuzz", 501, 501, 1, std::move(user), PlistValue(PlistDict{}), true, TarnAuditToken{}, false);
+        "com.fuzz", 501, 501, 1, std::move(user), PlistValue(PlistDict{}), true, TarnAuditToken{},
+        false);
     return TarnClientConnection::initWithClientIdentity(identity, true, true, true, std::nullopt,
-                                                        std::nullopt, std::make_shared<TarnCommandQueue>());
+                                                        std::nullopt,
+                                                        std::make_shared<TarnCommandQueue>());
 }
 
 void checkConnection(const PlistValue& request, TarnClientConnection& connection) {
@@ -66,11 +68,13 @@ void checkConnection(const PlistValue& request, TarnClientConnection& connection
         error == TarnSuccess)
         std::abort();
     error = TarnSuccess;
-    if (!concreteContainerIdentity(request, connection, {}, &error) && error == TarnSuccess) std::abort();
+    if (!concreteContainerIdentity(request, connection, {}, &error) && error == TarnSuccess)
+        std::abort();
     error = TarnSuccess;
     TarnConcreteIdentityKeys old{"OldIdentifier", "OldContainerClass", "OldContainerUUID",
                                  "OldPersonaUniqueString"};
-    if (!concreteContainerIdentity(request, connection, old, &error) && error == TarnSuccess) std::abort();
+    if (!concreteContainerIdentity(request, connection, old, &error) && error == TarnSuccess)
+        std::abort();
 
     auto queued = std::make_shared<TarnCommandQueue>();
     auto fresh = TarnClientConnection::initWithClientIdentity(
@@ -79,7 +83,8 @@ void checkConnection(const PlistValue& request, TarnClientConnection& connection
     error = TarnSuccess;
     TarnHandleStageForDeleteCommand(request, reply, fresh.get(), &error);
     // A refused request queues nothing.
-    if ((error == TarnErrorBadInput || error == TarnErrorPersonaMismatch) && queued->TEST_count() != 0)
+    if ((error == TarnErrorBadInput || error == TarnErrorPersonaMismatch) &&
+        queued->TEST_count() != 0)
         std::abort();
 }
 

@@ -1,11 +1,10 @@
 // Request decoding of the container commands, in process: which persona a
 // request acts for, which identities a request may name, and which sandboxed
-// callers get extension tokens.
-#include "Daemon/TarnContainerCommands.h"
-
+// callers get extension tokens. (Staging and the replies are tested over IPC.)
 #include <gtest/gtest.h>
 
 #include "Daemon/TarnClientConnection.h"
+#include "Daemon/TarnContainerCommands.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/HostConfiguration.h"
 #include "Platform/Sandbox.h"
@@ -15,7 +14,7 @@ namespace tarn {
 namespace {
 
 class ContainerCommandsDecodingTest : public test::ScratchRootTest {
-protected:
+  protected:
     void SetUp() override {
         // Personal P; enterprise E1 and E2 with their own apps and one app
         // both list; a universal persona whose app every identity shares.
@@ -25,7 +24,8 @@ protected:
             p.set("UniqueString", unique);
             p.set("PersonaID", id);
             p.set("BundleIDs", std::move(bundles));
-            if (std::string(type) == "enterprise") p.set("LayoutPath", std::string("/personas/") + unique);
+            if (std::string(type) == "enterprise")
+                p.set("LayoutPath", std::string("/personas/") + unique);
             return p;
         };
         PlistValue list(PlistArray{
@@ -48,15 +48,16 @@ protected:
     static TarnUserIdentityRef persona(const char* unique) {
         return cache().userIdentityForCurrentUserWithPersonaUniqueString(std::string(unique));
     }
-    static std::shared_ptr<TarnClientConnection> caller(TarnUserIdentityRef user, bool sandboxed = false,
-                                                        std::shared_ptr<TarnCommandQueue> queue = nullptr) {
+    static std::shared_ptr<TarnClientConnection> caller(TarnUserIdentityRef user,
+                                                        bool sandboxed = false) {
         TarnAuditToken token{};
         token[0] = 0x5a;
         auto identity = TarnClientIdentity::initWithBundleIdentifier(
-            "com.caller", 501, 501, 4242, std::move(user), PlistValue(PlistDict{}), sandboxed, token, false);
-        return TarnClientConnection::initWithClientIdentity(
-            identity, true, true, true, std::nullopt, std::nullopt,
-            queue ? queue : std::make_shared<TarnCommandQueue>());
+            "com.caller", 501, 501, 4242, std::move(user), PlistValue(PlistDict{}), sandboxed,
+            token, false);
+        return TarnClientConnection::initWithClientIdentity(identity, true, true, true,
+                                                            std::nullopt, std::nullopt,
+                                                            std::make_shared<TarnCommandQueue>());
     }
     static PlistValue request(PlistDict keys) { return PlistValue(std::move(keys)); }
 
@@ -70,16 +71,15 @@ TEST_F(ContainerCommandsDecodingTest, CallerWithoutPersonaActsForTheApplications
         TarnContainerClass containerClass;
         const char* expected;  // persona unique string; nullptr: error 76
     } cases[] = {
-        {"com.e1.app", 2, "E1"},
-        {"com.unlisted", 7, "P"},
-        {"com.uni", 2, "P"},      // listed everywhere: the caller's own (unspecific) identity
-        {"com.both", 2, nullptr}, // two enterprise personas, neither the caller's
-        {"com.both", 1, "P"},     // global classes keep the caller's identity
+        {"com.e1.app", 2, "E1"},  {"com.unlisted", 7, "P"},
+        {"com.uni", 2, "P"},       // listed everywhere: the caller's own (unspecific) identity
+        {"com.both", 2, nullptr},  // two enterprise personas, neither the caller's
+        {"com.both", 1, "P"},      // global classes keep the caller's identity
     };
     for (const Case& c : cases) {
         uint64_t error = TarnSuccess;
-        TarnUserIdentityRef user =
-            userIdentityForContainerIdentifier(*anyPersona, std::string(c.identifier), c.containerClass, &error);
+        TarnUserIdentityRef user = userIdentityForContainerIdentifier(
+            *anyPersona, std::string(c.identifier), c.containerClass, &error);
         if (!c.expected) {
             EXPECT_FALSE(user) << c.identifier;
             EXPECT_EQ(error, TarnErrorPersonaMismatch) << c.identifier;
@@ -93,9 +93,12 @@ TEST_F(ContainerCommandsDecodingTest, CallerWithoutPersonaActsForTheApplications
     // A caller of a specific persona always acts for it.
     uint64_t error = TarnSuccess;
     auto e1 = caller(persona("E1"));
-    EXPECT_EQ(userIdentityForContainerIdentifier(*e1, std::string("com.both"), 2, &error)->identifier(), "E1");
+    EXPECT_EQ(
+        userIdentityForContainerIdentifier(*e1, std::string("com.both"), 2, &error)->identifier(),
+        "E1");
     auto anonymous = TarnClientConnection::initWithClientIdentity(
-        nullptr, false, false, false, std::nullopt, std::nullopt, std::make_shared<TarnCommandQueue>());
+        nullptr, false, false, false, std::nullopt, std::nullopt,
+        std::make_shared<TarnCommandQueue>());
     EXPECT_FALSE(userIdentityForContainerIdentifier(*anonymous, std::string("x"), 2, &error));
     EXPECT_EQ(error, TarnErrorPersonaMismatch);
 }
@@ -104,14 +107,20 @@ TEST_F(ContainerCommandsDecodingTest, PersonaStringMustBeOneTheCallerMayActFor) 
     auto anyPersona = caller(cache().unspecificUserIdentity());
     auto e1 = caller(persona("E1"));
     uint64_t error = TarnSuccess;
-    EXPECT_EQ(userIdentityForPersonaUniqueString(*anyPersona, std::string("E2"), &error)->identifier(), "E2");
-    EXPECT_TRUE(userIdentityForPersonaUniqueString(*anyPersona, std::nullopt, &error)->isNoSpecificPersona());
-    EXPECT_EQ(userIdentityForPersonaUniqueString(*e1, std::string("E1"), &error)->identifier(), "E1");
+    EXPECT_EQ(
+        userIdentityForPersonaUniqueString(*anyPersona, std::string("E2"), &error)->identifier(),
+        "E2");
+    EXPECT_TRUE(userIdentityForPersonaUniqueString(*anyPersona, std::nullopt, &error)
+                    ->isNoSpecificPersona());
+    EXPECT_EQ(userIdentityForPersonaUniqueString(*e1, std::string("E1"), &error)->identifier(),
+              "E1");
     EXPECT_EQ(error, TarnSuccess);
 
-    for (auto [connection, unique] : {std::pair{e1, "E2"}, std::pair{e1, "NOPE"}, std::pair{anyPersona, "NOPE"}}) {
+    for (auto [connection, unique] :
+         {std::pair{e1, "E2"}, std::pair{e1, "NOPE"}, std::pair{anyPersona, "NOPE"}}) {
         error = TarnSuccess;
-        EXPECT_FALSE(userIdentityForPersonaUniqueString(*connection, std::string(unique), &error)) << unique;
+        EXPECT_FALSE(userIdentityForPersonaUniqueString(*connection, std::string(unique), &error))
+            << unique;
         EXPECT_EQ(error, TarnErrorPersonaMismatch) << unique;
     }
 
@@ -120,15 +129,16 @@ TEST_F(ContainerCommandsDecodingTest, PersonaStringMustBeOneTheCallerMayActFor) 
     host.multiUserFlags = 0x80000000u;
     HostConfiguration::TEST_setShared(host);
     error = TarnSuccess;
-    EXPECT_EQ(userIdentityForPersonaUniqueString(*e1, std::string("NOPE"), &error)->identifier(), "E1");
+    EXPECT_EQ(userIdentityForPersonaUniqueString(*e1, std::string("NOPE"), &error)->identifier(),
+              "E1");
     EXPECT_EQ(error, TarnSuccess);
 }
 
 TEST_F(ContainerCommandsDecodingTest, IdentitiesFromRequests) {
     auto c = caller(persona("E1"));
     uint64_t error = TarnSuccess;
-    auto own = validatedContainerIdentity(request({{"ContainerClass", PlistValue(uint64_t{2})}}), *c,
-                                          nullptr, "ContainerClass", &error);
+    auto own = validatedContainerIdentity(request({{"ContainerClass", PlistValue(uint64_t{2})}}),
+                                          *c, nullptr, "ContainerClass", &error);
     ASSERT_TRUE(own);
     EXPECT_EQ(own->identifier(), "com.caller") << "defaults to the caller";
     EXPECT_EQ(own->userIdentity()->identifier(), "E1");
@@ -138,15 +148,20 @@ TEST_F(ContainerCommandsDecodingTest, IdentitiesFromRequests) {
         const char* identifierKey;
         uint64_t expected;
     } validated[] = {
-        {{{"Identifier", PlistValue(uint64_t{5})}, {"ContainerClass", PlistValue(uint64_t{2})}}, nullptr, 18},
+        {{{"Identifier", PlistValue(uint64_t{5})}, {"ContainerClass", PlistValue(uint64_t{2})}},
+         nullptr,
+         18},
         {{{"ContainerClass", PlistValue(uint64_t{2})}}, "Identifier", 18},
         {{{"Identifier", PlistValue("a")}}, nullptr, 20},
-        {{{"Identifier", PlistValue("a")}, {"ContainerClass", PlistValue(uint64_t{14})}}, nullptr, 20},
+        {{{"Identifier", PlistValue("a")}, {"ContainerClass", PlistValue(uint64_t{14})}},
+         nullptr,
+         20},
         {{{"Identifier", PlistValue("a")}, {"ContainerClass", PlistValue("2")}}, nullptr, 20},
     };
     for (auto& v : validated) {
         error = TarnSuccess;
-        EXPECT_FALSE(validatedContainerIdentity(request(v.keys), *c, v.identifierKey, "ContainerClass", &error));
+        EXPECT_FALSE(validatedContainerIdentity(request(v.keys), *c, v.identifierKey,
+                                                "ContainerClass", &error));
         EXPECT_EQ(error, v.expected) << request(v.keys).description();
     }
 
@@ -157,19 +172,37 @@ TEST_F(ContainerCommandsDecodingTest, IdentitiesFromRequests) {
     } concrete[] = {
         {{{"ContainerClass", PlistValue(uint64_t{2})}, {"UUID", PlistValue(uuid)}}, 18},
         // The decoder does not range-check: the identity refuses class 14 as an argument.
-        {{{"Identifier", PlistValue("a")}, {"ContainerClass", PlistValue(uint64_t{14})}, {"UUID", PlistValue(uuid)},
-          {"PersonaUniqueString", PlistValue("E1")}}, 11},
-        {{{"Identifier", PlistValue("a")}, {"ContainerClass", PlistValue(uint64_t{2})}, {"UUID", PlistValue(uuid.string())},
-          {"PersonaUniqueString", PlistValue("E1")}}, 11},
+        {{{"Identifier", PlistValue("a")},
+          {"ContainerClass", PlistValue(uint64_t{14})},
+          {"UUID", PlistValue(uuid)},
+          {"PersonaUniqueString", PlistValue("E1")}},
+         11},
+        {{{"Identifier", PlistValue("a")},
+          {"ContainerClass", PlistValue(uint64_t{2})},
+          {"UUID", PlistValue(uuid.string())},
+          {"PersonaUniqueString", PlistValue("E1")}},
+         11},
         // An enterprise caller must name its persona: none means "no specific persona".
-        {{{"Identifier", PlistValue("a")}, {"ContainerClass", PlistValue(uint64_t{2})}, {"UUID", PlistValue(uuid)}}, 76},
-        {{{"Identifier", PlistValue("a")}, {"ContainerClass", PlistValue(uint64_t{2})}, {"UUID", PlistValue(uuid)},
-          {"PersonaUniqueString", PlistValue("E2")}}, 76},
-        {{{"Identifier", PlistValue("a")}, {"ContainerClass", PlistValue(uint64_t{2})}, {"UUID", PlistValue(uuid)},
-          {"PersonaUniqueString", PlistValue("E1")}}, 1},
+        {{{"Identifier", PlistValue("a")},
+          {"ContainerClass", PlistValue(uint64_t{2})},
+          {"UUID", PlistValue(uuid)}},
+         76},
+        {{{"Identifier", PlistValue("a")},
+          {"ContainerClass", PlistValue(uint64_t{2})},
+          {"UUID", PlistValue(uuid)},
+          {"PersonaUniqueString", PlistValue("E2")}},
+         76},
+        {{{"Identifier", PlistValue("a")},
+          {"ContainerClass", PlistValue(uint64_t{2})},
+          {"UUID", PlistValue(uuid)},
+          {"PersonaUniqueString", PlistValue("E1")}},
+         1},
         // Global classes ignore the persona string.
-        {{{"Identifier", PlistValue("a")}, {"ContainerClass", PlistValue(uint64_t{12})}, {"UUID", PlistValue(uuid)},
-          {"PersonaUniqueString", PlistValue("NOPE")}}, 1},
+        {{{"Identifier", PlistValue("a")},
+          {"ContainerClass", PlistValue(uint64_t{12})},
+          {"UUID", PlistValue(uuid)},
+          {"PersonaUniqueString", PlistValue("NOPE")}},
+         1},
     };
     for (auto& v : concrete) {
         error = TarnSuccess;
@@ -187,9 +220,8 @@ TEST_F(ContainerCommandsDecodingTest, TokensOnlyForSandboxedCallersOfEnterpriseC
         uint64_t error = TarnSuccess;
         auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
             Uuid::generate(), std::move(user), std::string("com.caller"), containerClass, &error);
-        return TarnMetadata::initWithContainerIdentity(identity, std::nullopt,
-                                                       "/private/var/c/" + identity->uuid().string(),
-                                                       std::nullopt);
+        return TarnMetadata::initWithContainerIdentity(
+            identity, std::nullopt, "/private/var/c/" + identity->uuid().string(), std::nullopt);
     };
     auto sandboxed = caller(persona("E1"), true);
     const TarnClientIdentity* client = sandboxed->clientIdentity().get();
@@ -212,8 +244,8 @@ TEST_F(ContainerCommandsDecodingTest, TokensOnlyForSandboxedCallersOfEnterpriseC
         const PlistValue* token = reply.find("ReplySandboxToken");
         ASSERT_EQ(bool(token), c.extensionClass != nullptr) << c.owner << " " << c.containerClass;
         if (token) {
-            EXPECT_TRUE(SandboxExtensionVerify(*token->asString(), c.extensionClass, metadata->url(),
-                                               client->auditToken()));
+            EXPECT_TRUE(SandboxExtensionVerify(*token->asString(), c.extensionClass,
+                                               metadata->url(), client->auditToken()));
         }
     }
 
@@ -221,39 +253,6 @@ TEST_F(ContainerCommandsDecodingTest, TokensOnlyForSandboxedCallersOfEnterpriseC
     issueSandboxExtension(reply, "ReplySandboxToken", *container(persona("E1"), 2),
                           caller(persona("E1"), false)->clientIdentity().get());
     EXPECT_FALSE(reply.find("ReplySandboxToken")) << "an unsandboxed caller needs none";
-}
-
-TEST_F(ContainerCommandsDecodingTest, StageForDeleteQueuesAllOrNothing) {
-    const Uuid a = Uuid::generate(), b = Uuid::generate();
-    auto stage = [&](PlistArray classes, PlistArray uuids, PlistArray ids, PlistArray personas,
-                     size_t* queued) {
-        auto queue = std::make_shared<TarnCommandQueue>();
-        auto c = caller(cache().unspecificUserIdentity(), false, queue);
-        PlistValue reply{PlistDict{}};
-        uint64_t error = TarnSuccess;
-        TarnHandleStageForDeleteCommand(request({{"ContainerClassesArray", PlistValue(std::move(classes))},
-                                                 {"UUIDsArray", PlistValue(std::move(uuids))},
-                                                 {"IdentifiersArray", PlistValue(std::move(ids))},
-                                                 {"PersonaUniqueStringsArray", PlistValue(std::move(personas))}}),
-                                        reply, c.get(), &error);
-        *queued = queue->TEST_count();
-        return error;
-    };
-    const PlistValue two(uint64_t{2});
-    size_t queued = 99;
-    EXPECT_EQ(stage({two, two, two}, {PlistValue(a), PlistValue(b)}, {PlistValue("x"), PlistValue("y"), PlistValue("z")},
-                    {PlistValue("P"), PlistValue("P"), PlistValue("P")}, &queued),
-              TarnErrorBadInput);
-    EXPECT_EQ(queued, 0u);
-    EXPECT_EQ(stage({two, two}, {PlistValue(a), PlistValue(b)}, {PlistValue("x"), PlistValue("y")},
-                    {PlistValue("P"), PlistValue("NOPE")}, &queued),
-              TarnErrorPersonaMismatch);
-    EXPECT_EQ(queued, 0u);
-    // A malformed entry (a UUID as text) is skipped; the rest is still staged.
-    EXPECT_EQ(stage({two, two}, {PlistValue(a.string()), PlistValue(b)}, {PlistValue("x"), PlistValue("y")},
-                    {PlistValue("P"), PlistValue("E1")}, &queued),
-              TarnErrorInvalidArgument);
-    EXPECT_EQ(queued, 1u);
 }
 
 }  // namespace

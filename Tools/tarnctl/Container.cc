@@ -39,8 +39,7 @@ CLI::App* addContainerSubcommand(CLI::App* parent, const char* name, const char*
     auto* sub = parent->add_subcommand(name, description);
     if (withIdentifier)
         sub->add_option("IDENTIFIER", args.identifier, "The container's identifier")->required();
-    sub->add_option("--class", args.containerClass, "Container class, 1 to 13")
-        ->default_val(2);
+    sub->add_option("--class", args.containerClass, "Container class, 1 to 13")->default_val(2);
     sub->add_flag("--transient", args.transient, "The transient container of the identity");
     return sub;
 }
