@@ -343,6 +343,10 @@ void TarnHandleStageForDeleteCommand(const PlistValue& request, PlistValue& repl
 
 void TarnHandleDeleteDeathRowCommand(const PlistValue& request, PlistValue& reply,
                                      TarnClientConnection* connection, uint64_t* error) {
+    // Run what the request queued (entitlement registration) before the pass
+    // starts: a failure there must be the one reply, not a second one after
+    // the completion's. The processor's own run then finds the queue empty.
+    if (!connection->completeWithError(error)) return;
     std::shared_ptr<TarnDeferredReply> deferred = TarnTakeDeferredReply();
     if (!deferred) {
         // Called outside a request (no reply to keep): just start the pass.

@@ -255,5 +255,26 @@ TEST_F(ContainerCommandsDecodingTest, TokensOnlyForSandboxedCallersOfEnterpriseC
     EXPECT_FALSE(reply.find("ReplySandboxToken")) << "an unsandboxed caller needs none";
 }
 
+// A queued command that fails before the death-row pass starts is the reply;
+// no pass (and so no second, asynchronous reply) follows.
+TEST_F(ContainerCommandsDecodingTest, DeathRowCommandRunsQueuedWorkFirst) {
+    struct Failing : TarnCommand {
+        uint64_t command() const override { return 99; }
+        bool fromQueue(TarnCommandQueue*, uint64_t* error) override {
+            *error = TarnErrorCacheRemoveFailed;
+            return false;
+        }
+    };
+    auto queue = std::make_shared<TarnCommandQueue>();
+    queue->insertCommand(std::make_shared<Failing>());
+    auto connection = TarnClientConnection::initWithClientIdentity(
+        nullptr, true, true, true, std::nullopt, std::nullopt, queue);
+    PlistValue reply{PlistDict{}};
+    uint64_t error = TarnSuccess;
+    TarnHandleDeleteDeathRowCommand(PlistValue(PlistDict{}), reply, connection.get(), &error);
+    EXPECT_EQ(error, TarnErrorCacheRemoveFailed);
+    EXPECT_EQ(queue->TEST_count(), 0u);
+}
+
 }  // namespace
 }  // namespace tarn
