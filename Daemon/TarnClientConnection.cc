@@ -308,9 +308,9 @@ bool TarnClientConnection::_createSubDirectories(const FileURL& url,
     std::vector<std::string> names;
     uint64_t libraryCode = kContainerLibraryErrorNoSubdirectories;
     if (!ContainerLibrarySubdirectoriesForClass(containerClass, &names, &libraryCode)) {
-        TarnErrorRef e = TARN_ERROR(libraryCode, nullptr,
-                                    "Failed to get subdirectory names for %llu : %llu",
-                                    containerClass, libraryCode);
+        TarnErrorRef e =
+            TARN_ERROR(libraryCode, nullptr, "Failed to get subdirectory names for %llu : %llu",
+                       containerClass, libraryCode);
         if (error) *error = e;
         return false;
     }
@@ -334,10 +334,10 @@ bool TarnClientConnection::_createSubDirectories(const FileURL& url,
         if (!fm.createDirectoryAtURL(subdirectory, true, mode, owner,
                                      static_cast<TarnDataProtectionClass>(subdirectoryClass),
                                      &underlying)) {
-            TarnErrorRef e = TARN_ERROR(TarnErrorCreateDirectoryFailed, underlying,
-                                        "Failed to create sub-dir for %@ at %@ (protClass: %d)",
-                                        containerMetadata->identifier(), subdirectory,
-                                        subdirectoryClass);
+            TarnErrorRef e =
+                TARN_ERROR(TarnErrorCreateDirectoryFailed, underlying,
+                           "Failed to create sub-dir for %@ at %@ (protClass: %d)",
+                           containerMetadata->identifier(), subdirectory, subdirectoryClass);
             if (error) *error = e;
             return false;
         }
@@ -392,8 +392,9 @@ class GlobalLockHolder {
     bool held_ = false;
 };
 
-bool isNotFound(const TarnErrorRef& e) { return e && e->isTarn() && e->code() == TarnErrorNotFound; }
-
+bool isNotFound(const TarnErrorRef& e) {
+    return e && e->isTarn() && e->code() == TarnErrorNotFound;
+}
 
 // The live directory name of a new container: system containers on the
 // well-known list keep a fixed name, everything else is named by a UUID.
@@ -427,9 +428,9 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
         event.end();
     }
 
-    const FileURL stagingURL = PathJoin(
-        configuration.stagingDirectoryURLForUserIdentity(userIdentity, containerClass),
-        directoryName);
+    const FileURL stagingURL =
+        PathJoin(configuration.stagingDirectoryURLForUserIdentity(userIdentity, containerClass),
+                 directoryName);
     TarnErrorRef underlying;
     if (!connection._createTopLevelContainerDirectory(
             stagingURL, containerClass, userIdentity->posixUIDForContainerClass(containerClass),
@@ -463,16 +464,15 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
             return;
         if (!connection._createSubDirectories(stagingURL, metadata, &failure)) return;
 
-        std::optional<FileURL> liveParent =
-            configuration.containerDirectoryURLForUserIdentity(userIdentity, containerClass,
-                                                               transient);
+        std::optional<FileURL> liveParent = configuration.containerDirectoryURLForUserIdentity(
+            userIdentity, containerClass, transient);
         liveURL = PathJoin(liveParent.value_or(FileURL()),
                            liveDirectoryName(identifier, containerClass, directoryName));
         TarnErrorRef moveError;
         if (!liveParent || !fm.moveItemAtURL(stagingURL, liveURL, &moveError))
-            failure = TARN_ERROR(TarnErrorMoveStagingFailed, moveError,
-                                 "Failed to move staging dir: %@ to live dir: %@", stagingURL,
-                                 liveURL);
+            failure =
+                TARN_ERROR(TarnErrorMoveStagingFailed, moveError,
+                           "Failed to move staging dir: %@ to live dir: %@", stagingURL, liveURL);
     }();
 
     if (failure) {
@@ -532,8 +532,8 @@ TarnMetadataRef createOrLookup(TarnClientConnection& connection,
     if (!transient) {
         if (useLocking) globalLock.readLock();
         TarnErrorRef lookupError;
-        TarnMetadataRef cached = cache.containerForContainerIdentity(identity, false, true,
-                                                                     allowKernelLookup, &lookupError);
+        TarnMetadataRef cached = cache.containerForContainerIdentity(
+            identity, false, true, allowKernelLookup, &lookupError);
         globalLock.release();
         if (cached) return foundContainer(cached);
         if (!isNotFound(lookupError)) {
@@ -613,8 +613,7 @@ std::optional<std::vector<TarnMetadataRef>> TarnClientConnection::containersWith
         auto containers = TarnContainerCache::sharedInstance().allContainersForUserIdentity(
             userIdentity, containerClass, transient, &cacheError);
         globalLock.release();
-        if (!containers)
-            TarnSetError(error, TarnErrorCodeOf(cacheError, TarnErrorInvalidArgument));
+        if (!containers) TarnSetError(error, TarnErrorCodeOf(cacheError, TarnErrorInvalidArgument));
         return containers;
     } catch (const std::exception& e) {
         globalLock.release();
@@ -643,7 +642,7 @@ void TarnClientConnection::deleteContainerWithContainerIdentity(
     }
     commandQueue_->insertCommand(
         TarnCommandStageForDelete::commandForStageForDeleteWithContainerIdentities({concrete}, true,
-                                                                                  nullptr));
+                                                                                   nullptr));
     TarnSetError(error, TarnSuccess);
 }
 

@@ -116,10 +116,9 @@ bool TarnCommandStageForDelete::stageAll(TarnCommandQueue* queue, uint64_t* erro
         }
 
         TarnErrorRef cacheError;
-        if (!cache.removeContainerForUserIdentity(container->userIdentity(),
-                                                  container->containerClass(),
-                                                  container->identifier(), container->transient(),
-                                                  &cacheError)) {
+        if (!cache.removeContainerForUserIdentity(
+                container->userIdentity(), container->containerClass(), container->identifier(),
+                container->transient(), &cacheError)) {
             TarnErrorRef e = TARN_ERROR(
                 TarnErrorCacheRemoveFailed, cacheError,
                 "Failed to remove from cache id: %@, class: %ld, transient: %d",

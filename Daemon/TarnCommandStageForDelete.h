@@ -31,7 +31,8 @@ class TarnCommandStageForDelete : public TarnCommand {
 
     // Plain identities are looked up by identifier and class (the permanent
     // container), concrete ones by their exact UUID (live or transient).
-    static std::shared_ptr<TarnCommandStageForDelete> commandForStageForDeleteWithContainerIdentities(
+    static std::shared_ptr<TarnCommandStageForDelete>
+    commandForStageForDeleteWithContainerIdentities(
         std::vector<TarnContainerIdentityRef> containerIdentities, bool useLocking,
         ErrorCallback onError);
     TarnCommandStageForDelete(std::vector<TarnContainerIdentityRef> containerIdentities,

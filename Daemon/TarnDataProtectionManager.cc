@@ -35,9 +35,9 @@ int32_t TarnDataProtectionManager::dataProtectionClassForEntitlementValue(
 
 int32_t TarnDataProtectionManager::dataProtectionClassForEntitlements(
     const PlistDict& entitlements) {
-    for (const char* key : {kTarnDefaultDataProtectionEntitlement,
-                            kTarnDataProtectionClassEntitlement,
-                            kTarnDataProtectionClassLegacyEntitlement}) {
+    for (const char* key :
+         {kTarnDefaultDataProtectionEntitlement, kTarnDataProtectionClassEntitlement,
+          kTarnDataProtectionClassLegacyEntitlement}) {
         auto it = entitlements.find(key);
         if (it == entitlements.end()) continue;
         if (const std::string* level = it->second.asString())

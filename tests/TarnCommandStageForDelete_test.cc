@@ -91,17 +91,20 @@ class TarnCommandStageForDeleteTest : public test::ScratchRootTest {
     }
 
     void store(const std::string& id, std::vector<std::string> children = {}) {
-        auto entry = std::make_shared<TarnCodeSigningEntry>(PlistDict{{kTarnEntitlementsKey, PlistDict{}}}, 3);
+        auto entry = std::make_shared<TarnCodeSigningEntry>(
+            PlistDict{{kTarnEntitlementsKey, PlistDict{}}}, 3);
         entry->setChildBundleIdentifiers(std::move(children));
         auto* mapping = TarnCodeSigningMapping::sharedInstance();
         TarnErrorRef e;
         bool ok = false;
-        mapping->queue()->sync([&] { ok = mapping->codeSigningMappingDB()->addCodeSigningEntry(entry, id, &e); });
+        mapping->queue()->sync(
+            [&] { ok = mapping->codeSigningMappingDB()->addCodeSigningEntry(entry, id, &e); });
         ASSERT_TRUE(ok) << (e ? e->description() : "");
     }
     static bool stored(const std::string& id) {
         TarnErrorRef e;
-        return TarnCodeSigningMapping::sharedInstance()->codeSigningEntryForIdentifier(id, &e) != nullptr;
+        return TarnCodeSigningMapping::sharedInstance()->codeSigningEntryForIdentifier(id, &e) !=
+               nullptr;
     }
 
     TarnClientConnection connection_;
@@ -143,8 +146,8 @@ TEST_F(TarnCommandStageForDeleteTest, ContainersAlreadyGoneAreSkippedWithoutFail
         &unknownCode);
 
     bool called = false;
-    auto command = stage({identity("com.example.vanished", 2), neverMade},
-                         [&](uint64_t) { called = true; });
+    auto command =
+        stage({identity("com.example.vanished", 2), neverMade}, [&](uint64_t) { called = true; });
     TarnCommandQueue queue;
     queue.insertCommand(command);
     uint64_t code = TarnSuccess;

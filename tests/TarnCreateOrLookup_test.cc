@@ -201,9 +201,8 @@ TEST_F(TarnCreateOrLookupTest, ConcurrentCreationsOfOneIdentityMakeOneContainer)
                 TarnClientConnection connection;
                 uint64_t code = TarnSuccess;
                 start.arrive_and_wait();
-                results[i] =
-                    connection.createOrLookupContainerWithContainerIdentity(id, true, false, true,
-                                                                            &code);
+                results[i] = connection.createOrLookupContainerWithContainerIdentity(
+                    id, true, false, true, &code);
             });
         for (auto& t : threads) t.join();
         ASSERT_TRUE(results[0] && results[1]);
@@ -232,8 +231,8 @@ TEST_F(TarnCreateOrLookupTest, TransientContainersAreMadeAnewAndTheOldOneGoesToD
 
     // A transient container is invisible to plain lookups.
     uint64_t code = TarnSuccess;
-    EXPECT_FALSE(connection_.createOrLookupContainerWithContainerIdentity(id, false, false, true,
-                                                                          &code));
+    EXPECT_FALSE(
+        connection_.createOrLookupContainerWithContainerIdentity(id, false, false, true, &code));
     EXPECT_EQ(code, TarnErrorNotFound);
     TarnDeathRowQueue()->resume();
 }
