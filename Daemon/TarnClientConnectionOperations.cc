@@ -121,8 +121,7 @@ TarnMetadataRef TarnClientConnection::metadataWithContainerIdentity(
 
 std::optional<PlistValue> TarnClientConnection::infoValueForKey(
     const std::optional<std::string>& key,
-    const TarnConcreteContainerIdentityRef& containerIdentity, bool useLocking,
-    uint64_t* error) {
+    const TarnConcreteContainerIdentityRef& containerIdentity, bool useLocking, uint64_t* error) {
     return catchingExceptions(__func__, error, [&]() -> std::optional<PlistValue> {
         if (!key) {
             setErrorFrom(error, TARN_ERROR(TarnErrorBadInput, nullptr,
@@ -224,8 +223,8 @@ uint64_t TarnClientConnection::diskUsageWithContainerIdentity(
             }
             if (isBundle) {
                 uint64_t infoError = TarnSuccess;
-                auto value = infoValueForKey(std::string(kStaticDiskUsageKey), identity, false,
-                                             &infoError);
+                auto value =
+                    infoValueForKey(std::string(kStaticDiskUsageKey), identity, false, &infoError);
                 if (value)
                     remembered = value->asUInt64();
                 else if (infoError != TarnErrorInfoValueNotFound)
@@ -237,7 +236,8 @@ uint64_t TarnClientConnection::diskUsageWithContainerIdentity(
         if (remembered) return *remembered;
 
         TarnTestLocks::sharedInstance().waitOnLock(kDiskUsageTestGate);
-        const uint64_t bytes = TarnFileManager::defaultManager().fastDiskUsageForURL(metadata->url());
+        const uint64_t bytes =
+            TarnFileManager::defaultManager().fastDiskUsageForURL(metadata->url());
 
         // With fast sizing the file system keeps the figure current itself;
         // without it a bundle (which never changes in place) is walked once.
@@ -295,21 +295,29 @@ void TarnClientConnection::regenerateDirectoryUUIDWithContainerIdentity(
             return;
         }
         ScopedGlobalWriteLock lock;
+        // Looked up again under the lock: a write that finished in between
+        // must not be undone by putting the earlier record back.
+        metadata = lookUp(identity);
+        if (!metadata) {
+            setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
+                                           "No Container with identity: %@", identity));
+            return;
+        }
         const FileURL oldURL = metadata->url();
         const std::string lastComponent = PathLastComponent(oldURL);
         // Well-known system containers keep their fixed name.
         if (!Uuid::parse(lastComponent)) {
             setErrorFrom(error, TARN_ERROR(TarnErrorInvalidArgument, nullptr,
-                                           "Non-UUID last path component: %@ for %@",
-                                           lastComponent, identity));
+                                           "Non-UUID last path component: %@ for %@", lastComponent,
+                                           identity));
             return;
         }
         const FileURL newURL = PathJoin(PathParent(oldURL), Uuid::generate().string());
         TarnErrorRef moveError;
         if (!TarnFileManager::defaultManager().moveItemAtURL(oldURL, newURL, &moveError)) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorUUIDMoveFailed, moveError,
-                                           "Failed to move dir: %@ to new UUID dir: %@", oldURL,
-                                           newURL));
+            setErrorFrom(error,
+                         TARN_ERROR(TarnErrorUUIDMoveFailed, moveError,
+                                    "Failed to move dir: %@ to new UUID dir: %@", oldURL, newURL));
             return;
         }
         TarnErrorRef cacheError;

@@ -1,5 +1,6 @@
 #include "Daemon/TarnFileManager.h"
 
+#include <atomic>
 #include <cerrno>
 #include <cstring>
 
@@ -843,7 +844,16 @@ bool TarnFileManager::standardizeAllSystemContainerACLsAtURL(const FileURL& url,
 
 // ---- Disk usage ----
 
+namespace {
+std::atomic<uint64_t> gDiskUsageMeasurementCount{0};
+}  // namespace
+
+uint64_t TarnFileManager::TEST_diskUsageMeasurementCount() {
+    return gDiskUsageMeasurementCount.load();
+}
+
 uint64_t TarnFileManager::fastDiskUsageForURL(const FileURL& url) {
+    gDiskUsageMeasurementCount.fetch_add(1, std::memory_order_relaxed);
     if (!HostConfiguration::shared().featureEnabled("fast_container_sizing")) return diskUsageForURL(url);
     SignpostInterval interval(kLogCategory, "CalculatingDiskUsage");
     int64_t total = 0;

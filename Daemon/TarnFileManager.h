@@ -222,6 +222,8 @@ public:
     // Bytes allocated to the tree; 0 when no size can be had.
     uint64_t fastDiskUsageForURL(const FileURL& url);
     uint64_t diskUsageForURL(const FileURL& url);
+    // Test-only: fastDiskUsageForURL() calls so far, process-wide.
+    static uint64_t TEST_diskUsageMeasurementCount();
 
     // ACL builders (callers own the result). Failures are TarnErrorACLFailed.
     bool _CreateSystemUserACEInACL(TarnACL* acl, uint32_t withPermissions, uint32_t andFlags,
