@@ -1,5 +1,7 @@
 #include "Platform/PropertyList.h"
 
+#include "Platform/BinaryPlist.h"
+
 #include <plist/plist.h>
 #include <uuid/uuid.h>
 
@@ -226,31 +228,7 @@ constexpr int kMaxDepth = 256;
 
 // Strings the daemon keeps must be valid UTF-8: they are written back to files
 // and sent over IPC, and neither can carry broken text.
-bool validUtf8(const std::string& s) {
-    size_t i = 0, n = s.size();
-    while (i < n) {
-        unsigned char c = static_cast<unsigned char>(s[i]);
-        size_t extra;
-        if (c < 0x80) extra = 0;
-        else if ((c >> 5) == 0x6) extra = 1;
-        else if ((c >> 4) == 0xE) extra = 2;
-        else if ((c >> 3) == 0x1E) extra = 3;
-        else return false;
-        if (extra > n - i - 1) return false;
-        uint32_t cp = extra == 0 ? c : c & (0x3F >> extra);
-        for (size_t k = 1; k <= extra; ++k) {
-            unsigned char d = static_cast<unsigned char>(s[i + k]);
-            if ((d >> 6) != 0x2) return false;
-            cp = (cp << 6) | (d & 0x3F);
-        }
-        // Overlong forms, surrogates and values past the last code point.
-        if ((extra == 1 && cp < 0x80) || (extra == 2 && cp < 0x800) ||
-            (extra == 3 && cp < 0x10000) || (cp >= 0xD800 && cp <= 0xDFFF) || cp > 0x10FFFF)
-            return false;
-        i += extra + 1;
-    }
-    return true;
-}
+bool validUtf8(const std::string& s) { return PlistIsValidUtf8(s); }
 
 plist_t toNode(const PlistValue& v, int depth) {
     if (depth > kMaxDepth) return nullptr;
@@ -484,6 +462,18 @@ std::string PlistValue::toXml() const {
 
 std::optional<PlistValue> PlistValue::fromBytes(const void* bytes, size_t length,
                                                 std::string* why) {
+    if (length == 0 || length > kMaxPlistBytes) {
+        if (why) *why = length == 0 ? "empty property list" : "property list too large";
+        return std::nullopt;
+    }
+    // Binary lists, the daemon's own format, skip the library's node tree.
+    if (length >= 8 && std::memcmp(bytes, "bplist00", 8) == 0)
+        return ParseBinaryPlist(static_cast<const uint8_t*>(bytes), length, why);
+    return TEST_fromBytesViaLibrary(bytes, length, why);
+}
+
+std::optional<PlistValue> PlistValue::TEST_fromBytesViaLibrary(const void* bytes, size_t length,
+                                                               std::string* why) {
     if (length == 0 || length > kMaxPlistBytes) {
         if (why) *why = length == 0 ? "empty property list" : "property list too large";
         return std::nullopt;

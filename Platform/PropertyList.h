@@ -117,6 +117,11 @@ public:
     // reason in *why when given.
     static std::optional<PlistValue> fromBytes(const void* bytes, size_t length,
                                                std::string* why = nullptr);
+    // Any format through the property-list library's own parser, which
+    // fromBytes uses for XML only: the reference the binary reader is checked
+    // against.
+    static std::optional<PlistValue> TEST_fromBytesViaLibrary(const void* bytes, size_t length,
+                                                              std::string* why = nullptr);
 
 private:
     std::variant<std::monostate, bool, uint64_t, int64_t, double, std::string, PlistData,
