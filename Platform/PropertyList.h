@@ -129,6 +129,10 @@ private:
         v_;
 };
 
+// True when `s` is well-formed UTF-8: no overlong forms, no surrogates, nothing
+// past U+10FFFF.
+bool PlistIsValidUtf8(std::string_view s);
+
 // Largest property-list file the daemon will parse; anything bigger is refused
 // before allocation.
 inline constexpr size_t kMaxPlistBytes = 16 * 1024 * 1024;

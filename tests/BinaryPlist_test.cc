@@ -7,7 +7,6 @@
 #include <cstring>
 #include <random>
 
-#include "Platform/BinaryPlist.h"
 #include "Platform/PropertyList.h"
 
 namespace tarn {
