@@ -102,6 +102,8 @@ TEST_F(ContainerCommandsTest, CreateLookUpAndRefuseBadIdentities) {
         R"({"Command": 0, "CreateIfNecessary": true, "Identifier": "com.a")";
     EXPECT_EQ(errorOf(send(admin_, createA + R"(, "ContainerClass": 0})")), 20u);
     EXPECT_EQ(errorOf(send(admin_, createA + R"(, "ContainerClass": 14})")), 20u);
+    const std::string live = root_.at("/private/var/mobile/Containers/Data/Application");
+    EXPECT_TRUE(!fs::exists(live) || fs::is_empty(live));
 
     PlistValue made = create("com.a");
     ASSERT_EQ(errorOf(made), 1u);
