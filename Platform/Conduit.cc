@@ -1,6 +1,7 @@
 #include "Platform/Conduit.h"
 
 #include <fcntl.h>
+#include <pthread.h>
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
@@ -14,6 +15,7 @@
 #include <cstring>
 #include <filesystem>
 #include <map>
+#include <system_error>
 #include <thread>
 
 #include "Platform/ConduitSocket.h"
@@ -98,19 +100,34 @@ MessageRef Message::createReply() const {
 // The I/O thread of a listener: accepts, reads every resumed connection and
 // hands complete messages to the connections' queues.
 
-struct Listener::IoLoop {
+// Threads poll one epoll set together; each connection's socket is armed
+// one-shot, so at most one thread reads a given peer at a time. The thread
+// that reads a complete request runs it itself, on the connection's queue,
+// when that queue is idle: no other thread has to be woken (across CPUs, the
+// dearest part of a round trip). Before it does, it makes sure another thread
+// is polling, starting one if none is, so that other peers keep being served.
+// A thread "in the I/O part" is polling, accepting or reading; one running a
+// request is not, and cancel() waits only for the former.
+constexpr int kMaxIoThreads = 16;
+// A polling thread idle this long exits when another one polls.
+constexpr int kIdleIoThreadMs = 10000;
+
+struct Listener::IoLoop : std::enable_shared_from_this<Listener::IoLoop> {
     int listenFd = -1;
     int epollFd = -1;
     int wakeFd = -1;
-    std::thread thread;
     std::weak_ptr<Listener> owner;
 
     Mutex mu;
+    CondVar ioIdle;  // inIo dropped to zero
     std::map<uint64_t, ConnectionRef> connections GUARDED_BY(mu);
     std::function<void(const ConnectionRef&)> handler GUARDED_BY(mu);
     uint64_t nextSerial GUARDED_BY(mu) = 2;  // 0 and 1 are the wake and listen keys
     bool started GUARDED_BY(mu) = false;
     bool stopped GUARDED_BY(mu) = false;
+    int threads GUARDED_BY(mu) = 0;
+    int polling GUARDED_BY(mu) = 0;  // threads in (or on their way to) epoll_wait
+    int inIo GUARDED_BY(mu) = 0;     // threads in the I/O part
 
     ~IoLoop() {
         sock::CloseFd(listenFd);
@@ -118,9 +135,19 @@ struct Listener::IoLoop {
         sock::CloseFd(wakeFd);
     }
 
+    // Starts a thread that begins by polling; false when the OS refused one.
+    bool spawn() REQUIRES(mu);
     void run();
+    void exitThread() REQUIRES(mu);
+    // Called before running a request: true when the thread may, with some
+    // other thread polling meanwhile; it then leaves the I/O part.
+    bool leaveForRequest() EXCLUDES(mu);
+    // After the request: false when the loop stopped meanwhile and the thread
+    // must end without touching the loop's descriptors again.
+    bool returnFromRequest() EXCLUDES(mu);
     void acceptAll();
-    void readConnection(const ConnectionRef& c);
+    // false when the thread must end (see returnFromRequest).
+    bool readConnection(const ConnectionRef& c);
     ConnectionRef find(uint64_t serial) {
         MutexLock l(mu);
         auto it = connections.find(serial);
@@ -135,26 +162,85 @@ struct Listener::IoLoop {
     }
 };
 
+namespace {
+// The loop whose I/O part the calling thread is in, if any.
+thread_local const Listener::IoLoop* tInIoOf = nullptr;
+}  // namespace
+
+bool Listener::IoLoop::spawn() {
+    if (threads >= kMaxIoThreads) return false;
+    try {
+        std::thread([io = shared_from_this()] { io->run(); }).detach();
+    } catch (const std::system_error&) {
+        return false;
+    }
+    ++threads;
+    ++inIo;
+    ++polling;
+    return true;
+}
+
+void Listener::IoLoop::exitThread() {
+    --threads;
+    if (--inIo == 0) ioIdle.notifyAll();
+    tInIoOf = nullptr;
+}
+
+bool Listener::IoLoop::leaveForRequest() {
+    MutexLock l(mu);
+    if (stopped || (polling == 0 && !spawn())) return false;
+    tInIoOf = nullptr;
+    if (--inIo == 0) ioIdle.notifyAll();
+    return true;
+}
+
+bool Listener::IoLoop::returnFromRequest() {
+    MutexLock l(mu);
+    if (stopped) {
+        --threads;
+        return false;
+    }
+    ++inIo;
+    tInIoOf = this;
+    return true;
+}
+
 void Listener::IoLoop::run() {
-    struct epoll_event events[32];
+    (void)pthread_setname_np(pthread_self(), "tarn-conduit-io");  // for ps and debuggers only
+    tInIoOf = this;
+    bool counted = true;  // spawn() counted this thread as polling
     for (;;) {
-        const int n = ::epoll_wait(epollFd, events, 32, -1);
-        if (n < 0) {
-            if (errno == EINTR) continue;
-            PlatformLog("conduit", PlatformLogType::Fault, "epoll_wait failed: %s",
-                        std::strerror(errno));
-            return;
-        }
-        for (int i = 0; i < n; ++i) {
-            const uint64_t key = events[i].data.u64;
-            if (key == kWakeKey) {
-                MutexLock l(mu);
-                if (stopped) return;
-            } else if (key == kListenKey) {
-                acceptAll();
-            } else if (ConnectionRef c = find(key)) {
-                readConnection(c);
+        {
+            MutexLock l(mu);
+            if (!counted) ++polling;
+            counted = false;
+            if (stopped) {
+                --polling;
+                exitThread();
+                return;
             }
+        }
+        struct epoll_event event;
+        const int n = ::epoll_wait(epollFd, &event, 1, kIdleIoThreadMs);
+        const int savedErrno = errno;
+        {
+            MutexLock l(mu);
+            --polling;
+            if ((n == 0 && polling > 0) || (n < 0 && savedErrno != EINTR)) {
+                if (n < 0)
+                    PlatformLog("conduit", PlatformLogType::Fault, "epoll_wait failed: %s",
+                                std::strerror(savedErrno));
+                exitThread();
+                return;
+            }
+        }
+        if (n <= 0) continue;
+        const uint64_t key = event.data.u64;
+        if (key == kWakeKey) continue;  // stopping: seen at the top of the loop
+        if (key == kListenKey) {
+            acceptAll();
+        } else if (ConnectionRef c = find(key)) {
+            if (!readConnection(c)) return;
         }
     }
 }
@@ -201,47 +287,66 @@ void Listener::IoLoop::acceptAll() {
     arm(listenFd, kListenKey, false);
 }
 
-void Listener::IoLoop::readConnection(const ConnectionRef& c) {
+bool Listener::IoLoop::readConnection(const ConnectionRef& c) {
     std::vector<uint8_t> record;
     // A bounded batch per wake-up keeps one busy peer from starving the others.
     for (int batch = 0; batch < 16; ++batch) {
-        std::string why;
-        switch (sock::ReceiveRecord(c->fd_, kMaxRecordBytes, &record, &why)) {
-            case sock::RecvResult::WouldBlock:
-                arm(c->fd_, c->serial_, false);
-                return;
-            case sock::RecvResult::Closed:
-                c->cancel();
-                return;
-            case sock::RecvResult::Error:
-                c->fail(why);
-                return;
-            case sock::RecvResult::Record:
-                break;
+        RecordHeader h;
+        std::vector<uint8_t> body;
+        {
+            MutexLock r(c->readMu_);
+            std::string why;
+            switch (sock::ReceiveRecord(c->fd_, kMaxRecordBytes, &record, &why)) {
+                case sock::RecvResult::WouldBlock:
+                    arm(c->fd_, c->serial_, false);
+                    return true;
+                case sock::RecvResult::Closed:
+                    c->cancel();
+                    return true;
+                case sock::RecvResult::Error:
+                    c->fail(why);
+                    return true;
+                case sock::RecvResult::Record:
+                    break;
+            }
+            switch (c->assembler_.add(record.data(), record.size(), &why)) {
+                case RecordAssembler::Result::Malformed:
+                    c->fail(why);
+                    return true;
+                case RecordAssembler::Result::NeedMore:
+                    continue;
+                case RecordAssembler::Result::Complete:
+                    break;
+            }
+            h = c->assembler_.header();
+            body = c->assembler_.take();
         }
-        switch (c->assembler_.add(record.data(), record.size(), &why)) {
-            case RecordAssembler::Result::Malformed:
-                c->fail(why);
-                return;
-            case RecordAssembler::Result::NeedMore:
-                continue;
-            case RecordAssembler::Result::Complete:
-                break;
+        bool idle;
+        {
+            MutexLock l(c->mu_);
+            if (c->cancelled_) return true;
+            idle = c->queued_ == 0;  // nothing handed over earlier still waits to run
         }
-        const RecordHeader h = c->assembler_.header();
+        if (idle && leaveForRequest()) {
+            const bool ran = c->queue_->runHereIfIdle(
+                [&] { c->deliver(std::move(body), h.flags, h.messageId, h.replyTo, false); });
+            if (!returnFromRequest()) return false;
+            if (ran) continue;
+        }
         bool pause;
         {
             MutexLock l(c->mu_);
-            if (c->cancelled_) return;
+            if (c->cancelled_) return true;
             pause = ++c->queued_ >= kMaxQueuedMessages;
             if (pause) c->paused_ = true;
         }
-        c->queue_->async([c, body = c->assembler_.take(), h]() mutable {
-            c->deliver(std::move(body), h.flags, h.messageId, h.replyTo);
+        c->queue_->async([c, body = std::move(body), h]() mutable {
+            c->deliver(std::move(body), h.flags, h.messageId, h.replyTo, true);
         });
-        if (pause) return;  // re-armed by the queue once it has caught up
+        if (pause) return true;  // re-armed by the queue once it has caught up
     }
     arm(c->fd_, c->serial_, false);
+    return true;
 }
 
 // ---------------------------------------------------------------------------
@@ -355,7 +460,7 @@ void Connection::finish() {
 }
 
 void Connection::deliver(std::vector<uint8_t> body, uint16_t flags, uint64_t id,
-                         uint64_t replyTo) {
+                         uint64_t replyTo, bool handedOver) {
     std::function<void(const Event&)> h;
     std::string why;
     auto value = DecodeBody(body.data(), body.size(), &why);
@@ -380,7 +485,7 @@ void Connection::deliver(std::vector<uint8_t> body, uint16_t flags, uint64_t id,
     auto message = std::make_shared<Message>(Message::PrivateTag{}, weak_from_this(), id, replyTo,
                                               (flags & kFlagRequest) != 0, std::move(*value));
     if (h) h(Event{Event::Kind::Message, message});
-    onDelivered();
+    if (handedOver) onDelivered();
 }
 
 void Connection::onDelivered() {
@@ -547,30 +652,39 @@ void Listener::resume() {
     ev.data.u64 = kWakeKey;
     (void)::epoll_ctl(io_->epollFd, EPOLL_CTL_ADD, io_->wakeFd, &ev);  // fresh fds: cannot fail
     io_->arm(io_->listenFd, kListenKey, true);
-    io_->thread = std::thread([io = io_] { io->run(); });
+    MutexLock l(io_->mu);
+    if (!io_->spawn())
+        PlatformLog("conduit", PlatformLogType::Fault, "Cannot start the listener on %s: no thread",
+                    socketPath_);
 }
 
 void Listener::cancel() {
     std::map<uint64_t, ConnectionRef> connections;
+    bool started;
     {
         MutexLock l(io_->mu);
         if (io_->stopped) return;
         io_->stopped = true;
+        started = io_->started;
         connections.swap(io_->connections);
         io_->handler = nullptr;
     }
-    if (io_->thread.joinable()) {
+    if (started && io_->wakeFd >= 0) {
         const uint64_t one = 1;
-        (void)!::write(io_->wakeFd, &one, sizeof one);  // an eventfd write cannot fail here
-        if (io_->thread.get_id() == std::this_thread::get_id()) {
-            io_->thread.detach();  // the I/O thread let go of the last reference
-        } else {
-            io_->thread.join();
-            // Close now so that late connects fail instead of waiting in the backlog.
-            sock::CloseFd(io_->listenFd);
-            io_->listenFd = -1;
-        }
-    } else {
+        // Never read, so it wakes every polling thread in turn; cannot fail here.
+        (void)!::write(io_->wakeFd, &one, sizeof one);
+    }
+    // Threads running a request are not waited for: the request may be the
+    // one calling this. A thread in the I/O part calling this (it dropped the
+    // last reference) cannot wait for itself; it still uses the listening
+    // socket, which the loop's destructor closes then.
+    const bool self = tInIoOf == io_.get();
+    {
+        MutexLock l(io_->mu);
+        while (io_->inIo > (self ? 1 : 0)) io_->ioIdle.wait(io_->mu);
+    }
+    if (!self) {
+        // Close now so that late connects fail instead of waiting in the backlog.
         sock::CloseFd(io_->listenFd);
         io_->listenFd = -1;
     }

@@ -15,9 +15,10 @@
 // an error line in the platform log (category "conduit"); other peers are not
 // affected.
 //
-// Threads: one I/O thread per Listener reads every socket; decoding and event
-// handlers run on the connections' queues. All member functions are
-// thread-safe.
+// Threads: a Listener's I/O threads read the sockets. Event handlers always
+// run as items of the connections' queues: on the I/O thread that read the
+// message when that queue is idle (no thread hand-off), otherwise on the
+// queue's own turn. All member functions are thread-safe.
 #pragma once
 
 #include <sys/types.h>
@@ -158,8 +159,11 @@ public:
 private:
     friend class Listener;
 
-    // On the queue: decodes and hands one message to the handler.
-    void deliver(std::vector<uint8_t> body, uint16_t flags, uint64_t id, uint64_t replyTo);
+    // On the queue: decodes and hands one message to the handler. `handedOver`
+    // when the I/O part queued it (and counted it in queued_) rather than
+    // running it on the thread that read it.
+    void deliver(std::vector<uint8_t> body, uint16_t flags, uint64_t id, uint64_t replyTo,
+                 bool handedOver);
     void fail(const std::string& reason);
     void finish();  // on the queue: ConnectionInvalid, drop the handler
     void onDelivered();
@@ -199,8 +203,10 @@ private:
     mutable Mutex exeMu_;
     mutable std::optional<ExecutableCache> exe_ GUARDED_BY(exeMu_);
 
-    // Touched by the Listener's I/O thread only.
-    RecordAssembler assembler_;
+    // Read state, used by whichever I/O thread holds the socket's one-shot
+    // readiness: the lock only orders those threads, it is never contended.
+    Mutex readMu_;
+    RecordAssembler assembler_ GUARDED_BY(readMu_);
 };
 
 // The server socket. Accepts and reads on its own I/O thread once resumed;
@@ -221,10 +227,11 @@ public:
     void setNewConnectionHandler(std::function<void(const ConnectionRef&)> handler);
     // Starts accepting. Nothing is accepted or delivered before.
     void resume();
-    // Stops accepting, cancels every connection it made, stops the I/O thread
+    // Stops accepting, cancels every connection it made, stops the I/O threads
     // and removes the socket file it created. Idempotent; also run by the
-    // destructor. Waits for the I/O thread only, never for event handlers, so
-    // it may be called from a handler.
+    // destructor. Waits only for I/O threads that are polling, accepting or
+    // reading, never for event handlers (even one running on an I/O thread),
+    // so it may be called from a handler.
     void cancel();
 
     const std::string& socketPath() const { return socketPath_; }

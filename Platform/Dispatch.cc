@@ -70,15 +70,22 @@ class WorkerPool {
     }
 
     void submit(QoS qos, std::function<void()> job) EXCLUDES(mu_) {
-        MutexLock lock(mu_);
-        jobs_[static_cast<size_t>(qos)].push_back(std::move(job));
-        ++queued_;
-        if (idle_ > 0) workReady_.notifyOne();
-        // Idle threads already woken for earlier jobs count against this one.
-        if (idle_ >= queued_) return;
-        if (threads_ < eagerThreads_ && spawnWorker()) return;
-        startMonitor();
-        monitorWake_.notifyOne();
+        bool wakeWorker = false, wakeMonitor = false;
+        {
+            MutexLock lock(mu_);
+            jobs_[static_cast<size_t>(qos)].push_back(std::move(job));
+            ++queued_;
+            wakeWorker = idle_ > 0;
+            // Idle threads already woken for earlier jobs count against this one.
+            if (idle_ < queued_ && !(threads_ < eagerThreads_ && spawnWorker())) {
+                startMonitor();
+                wakeMonitor = true;
+            }
+        }
+        // Signalled after unlocking, so that the woken thread does not run
+        // straight into the lock still held here. Waiters re-check queued_.
+        if (wakeWorker) workReady_.notifyOne();
+        if (wakeMonitor) monitorWake_.notifyOne();
     }
 
   private:
@@ -189,17 +196,19 @@ class DelayedWork {
 
     void schedule(Clock::time_point deadline, DispatchQueueRef queue, std::function<void()> work)
         EXCLUDES(mu_) {
-        MutexLock lock(mu_);
-        if (!started_) {
-            try {
-                std::thread([this] { loop(); }).detach();
-            } catch (const std::system_error& e) {
-                fatal(std::string("cannot start the timer thread: ") + e.what());
+        {
+            MutexLock lock(mu_);
+            if (!started_) {
+                try {
+                    std::thread([this] { loop(); }).detach();
+                } catch (const std::system_error& e) {
+                    fatal(std::string("cannot start the timer thread: ") + e.what());
+                }
+                started_ = true;
             }
-            started_ = true;
+            entries_.push_back(Entry{deadline, nextSeq_++, std::move(queue), std::move(work)});
+            std::push_heap(entries_.begin(), entries_.end(), Later{});
         }
-        entries_.push_back(Entry{deadline, nextSeq_++, std::move(queue), std::move(work)});
-        std::push_heap(entries_.begin(), entries_.end(), Later{});
         changed_.notifyOne();
     }
 
@@ -282,9 +291,13 @@ struct TransactionState {
 // chain like an item; each queue it starts in appends itself to `entered`, and
 // the root (or a queue the thread already runs) grants it.
 struct DispatchQueue::SyncWaiter {
+    // The caller holds a reference to the waiter, so signalling after the
+    // unlock cannot touch a waiter that has already returned and gone.
     void grant() {
-        MutexLock lock(mu);
-        granted = true;
+        {
+            MutexLock lock(mu);
+            granted = true;
+        }
         wakeup.notifyOne();
     }
 
@@ -408,11 +421,13 @@ void DispatchQueue::submit(Item item) {
                 return;
             }
             MainRunner& runner = MainRunner::instance();
-            MutexLock lock(runner.mu);
-            runner.jobs.push_back([this, work = std::move(item.work)] {
-                QueueFrame frame(this);
-                runWork(work, label_);
-            });
+            {
+                MutexLock lock(runner.mu);
+                runner.jobs.push_back([this, work = std::move(item.work)] {
+                    QueueFrame frame(this);
+                    runWork(work, label_);
+                });
+            }
             runner.changed.notifyAll();
             return;
         }
@@ -542,6 +557,44 @@ void DispatchQueue::syncImpl(const std::function<void()>& work, bool barrier) {
     for (size_t i = 0; i < entered.size(); ++i) entered[i]->finishItem(i == 0 && barrier);
 }
 
+bool DispatchQueue::runHereIfIdle(const std::function<void()>& work) {
+    if (!work) fatal("empty work item submitted to queue \"" + label_ + "\"");
+    // Enter every queue up the chain that is free now, or none: a queue with
+    // anything pending or running (or suspended) keeps its FIFO order by
+    // refusing, and the caller submits the work instead.
+    std::array<DispatchQueue*, 16> entered;
+    size_t depth = 0;
+    bool admitted = false;
+    for (DispatchQueue* q = this; q && depth < entered.size();) {
+        if (q->kind_ == Kind::GlobalRoot) {
+            admitted = true;
+            break;
+        }
+        if (q->kind_ == Kind::MainRoot) break;  // only runMain() may run its work
+        DispatchQueue* next;
+        {
+            MutexLock lock(q->mu_);
+            if (q->suspendCount_ > 0 || !q->pending_.empty() || q->barrierRunning_ ||
+                q->running_ >= q->width())
+                break;
+            ++q->running_;
+            q->used_ = true;
+            next = q->target_.get();  // kept alive by q, whose target is now fixed
+        }
+        entered[depth++] = q;
+        q = next;
+    }
+    if (admitted) {
+        for (size_t i = depth; i-- > 0;) tCurrentQueues.push_back(entered[i]);
+        runWork(work, label_);
+        tCurrentQueues.resize(tCurrentQueues.size() - depth);
+    }
+    // Innermost first, as a finished item would; pending work that arrived
+    // meanwhile starts from here.
+    for (size_t i = 0; i < depth; ++i) entered[i]->finishItem(false);
+    return admitted;
+}
+
 void DispatchQueue::suspend() {
     if (isRoot()) return;
     MutexLock lock(mu_);
@@ -602,8 +655,10 @@ void DispatchQueue::runMain() {
 
 void DispatchQueue::stopMain() {
     MainRunner& runner = MainRunner::instance();
-    MutexLock lock(runner.mu);
-    runner.stopRequested = true;
+    {
+        MutexLock lock(runner.mu);
+        runner.stopRequested = true;
+    }
     runner.changed.notifyAll();
 }
 
@@ -615,9 +670,13 @@ void Transaction::begin() {
 
 void Transaction::end() {
     TransactionState& state = TransactionState::instance();
-    MutexLock lock(state.mu);
-    if (state.open == 0) fatal("Transaction::end without an open transaction");
-    if (--state.open == 0) state.idle.notifyAll();
+    bool idle;
+    {
+        MutexLock lock(state.mu);
+        if (state.open == 0) fatal("Transaction::end without an open transaction");
+        idle = --state.open == 0;
+    }
+    if (idle) state.idle.notifyAll();
 }
 
 uint64_t Transaction::openCount() {

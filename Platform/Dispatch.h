@@ -88,6 +88,13 @@ class DispatchQueue : public std::enable_shared_from_this<DispatchQueue> {
     void barrierAsync(std::function<void()> work);
     void barrierSync(const std::function<void()>& work);
 
+    // Runs `work` on the calling thread at once, as an item of this queue, when
+    // this queue and every queue it targets could start an item now (nothing
+    // pending, running or suspended on a serial one); returns false without
+    // running it otherwise, so that the caller submits it instead. Lets a
+    // thread that received work run it without waking another thread.
+    bool runHereIfIdle(const std::function<void()>& work);
+
     // Counted. While the count is above zero no new item of this queue starts
     // (nor of queues that target it); an item already running finishes.
     void suspend();
