@@ -5,6 +5,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <algorithm>
 #include <cstring>
 #include <mutex>
 #include <vector>
@@ -95,6 +96,31 @@ FileURL FileSandboxUserState::fileForUID(uint32_t uid) const {
     return PathJoin(directory_, std::to_string(uid) + ".plist");
 }
 
+FileURL FileSandboxUserState::journalForUID(uint32_t uid) const {
+    return PathJoin(directory_, std::to_string(uid) + ".journal");
+}
+
+namespace {
+
+// Journal length that forces the next change to rewrite the snapshot.
+constexpr size_t kJournalTorn = SIZE_MAX / 2;
+
+// Journal record: 4-byte little-endian length, then a binary property list
+// {"Type", "Identifier", "PersonaID", "Path" (absent: removed)}.
+void appendRecord(std::vector<uint8_t>* out, uint64_t type, const std::string& identifier,
+                  uint32_t persona, const std::optional<std::string>& path) {
+    PlistDict d{{"Type", PlistValue(type)},
+                {"Identifier", PlistValue(identifier)},
+                {"PersonaID", PlistValue(uint64_t{persona})}};
+    if (path) d["Path"] = PlistValue(*path);
+    const std::vector<uint8_t> bytes = PlistValue(std::move(d)).toBinary();
+    const auto n = static_cast<uint32_t>(bytes.size());
+    for (int shift = 0; shift < 32; shift += 8) out->push_back(static_cast<uint8_t>(n >> shift));
+    out->insert(out->end(), bytes.begin(), bytes.end());
+}
+
+}  // namespace
+
 FileSandboxUserState::Table& FileSandboxUserState::_lock_tableForUID(uint32_t uid) {
     auto it = tables_.find(uid);
     if (it != tables_.end()) return it->second;
@@ -102,44 +128,88 @@ FileSandboxUserState::Table& FileSandboxUserState::_lock_tableForUID(uint32_t ui
     std::vector<uint8_t> bytes;
     const FileURL file = fileForUID(uid);
     int err = readAll(file, kMaxStateFileBytes, &bytes);
-    if (err == ENOENT) {
-        persisted_[uid] = table;
-        return table;
-    }
-    if (err != 0) {
+    if (err != 0 && err != ENOENT) {
         PlatformLog("sandbox", PlatformLogType::Error, "Cannot read sandbox state %s: %s", file,
                     std::strerror(err));
-        return table;
-    }
-    std::string why;
-    auto root = PlistValue::fromBytes(bytes.data(), bytes.size(), &why);
-    const PlistArray* items =
-        root ? (root->find("Items") ? root->find("Items")->asArray() : nullptr) : nullptr;
-    if (!items) {
-        PlatformLog("sandbox", PlatformLogType::Error, "Ignoring malformed sandbox state %s: %s",
-                    file, why.empty() ? std::string("no item list") : why);
-        return table;
-    }
-    for (const PlistValue& item : *items) {
-        const PlistValue* type = item.find("Type");
-        const PlistValue* identifier = item.find("Identifier");
-        const PlistValue* path = item.find("Path");
-        const PlistValue* persona = item.find("PersonaID");
-        auto t = type ? type->asUInt64() : std::nullopt;
-        auto p = persona ? persona->asUInt64() : std::nullopt;
-        if (!t || !p || *p > UINT32_MAX || !identifier || !identifier->asString() || !path ||
-            !path->asString() || identifier->asString()->empty()) {
-            PlatformLog("sandbox", PlatformLogType::Error, "Skipping malformed sandbox item in %s",
-                        file);
-            continue;
+    } else if (err == 0) {
+        std::string why;
+        auto root = PlistValue::fromBytes(bytes.data(), bytes.size(), &why);
+        const PlistArray* items =
+            root ? (root->find("Items") ? root->find("Items")->asArray() : nullptr) : nullptr;
+        if (!items) {
+            PlatformLog("sandbox", PlatformLogType::Error,
+                        "Ignoring malformed sandbox state %s: %s", file,
+                        why.empty() ? std::string("no item list") : why);
+        } else {
+            for (const PlistValue& item : *items) {
+                const PlistValue* type = item.find("Type");
+                const PlistValue* identifier = item.find("Identifier");
+                const PlistValue* path = item.find("Path");
+                const PlistValue* persona = item.find("PersonaID");
+                auto t = type ? type->asUInt64() : std::nullopt;
+                auto p = persona ? persona->asUInt64() : std::nullopt;
+                if (!t || !p || *p > UINT32_MAX || !identifier || !identifier->asString() ||
+                    !path || !path->asString() || identifier->asString()->empty()) {
+                    PlatformLog("sandbox", PlatformLogType::Error,
+                                "Skipping malformed sandbox item in %s", file);
+                    continue;
+                }
+                table[Key{*t, *identifier->asString(), static_cast<uint32_t>(*p)}] =
+                    *path->asString();
+            }
         }
-        table[Key{*t, *identifier->asString(), static_cast<uint32_t>(*p)}] = *path->asString();
     }
-    persisted_[uid] = table;
+    _lock_replayJournal(uid, table);
     return table;
 }
 
-int FileSandboxUserState::_lock_writeTable(uint32_t uid) {
+void FileSandboxUserState::_lock_replayJournal(uint32_t uid, Table& table) {
+    std::vector<uint8_t> bytes;
+    const FileURL journal = journalForUID(uid);
+    int err = readAll(journal, kMaxStateFileBytes, &bytes);
+    if (err == ENOENT) return;
+    if (err != 0) {
+        PlatformLog("sandbox", PlatformLogType::Error, "Cannot read sandbox journal %s: %s",
+                    journal, std::strerror(err));
+        return;
+    }
+    size_t offset = 0, records = 0;
+    while (offset < bytes.size()) {
+        if (bytes.size() - offset < 4) break;
+        uint32_t n = 0;
+        for (int i = 0; i < 4; ++i) n |= static_cast<uint32_t>(bytes[offset + i]) << (8 * i);
+        if (n > bytes.size() - offset - 4) break;
+        std::string why;
+        auto record = PlistValue::fromBytes(bytes.data() + offset + 4, n, &why);
+        const PlistValue* type = record ? record->find("Type") : nullptr;
+        const PlistValue* identifier = record ? record->find("Identifier") : nullptr;
+        const PlistValue* persona = record ? record->find("PersonaID") : nullptr;
+        const PlistValue* path = record ? record->find("Path") : nullptr;
+        auto t = type ? type->asUInt64() : std::nullopt;
+        auto p = persona ? persona->asUInt64() : std::nullopt;
+        if (!t || !p || *p > UINT32_MAX || !identifier || !identifier->asString() ||
+            identifier->asString()->empty() || (path && !path->asString()))
+            break;
+        Key key{*t, *identifier->asString(), static_cast<uint32_t>(*p)};
+        if (path)
+            table[key] = *path->asString();
+        else
+            table.erase(key);
+        offset += 4 + n;
+        ++records;
+    }
+    journalRecords_[uid] = records;
+    if (offset < bytes.size()) {
+        PlatformLog("sandbox", PlatformLogType::Error,
+                    "Ignoring %zu bytes of a torn or malformed record at the end of %s",
+                    bytes.size() - offset, journal);
+        // Records appended behind it would never be replayed: the next change
+        // rewrites the snapshot instead. (A reader never writes.)
+        journalRecords_[uid] = kJournalTorn;
+    }
+}
+
+int FileSandboxUserState::_lock_writeSnapshot(uint32_t uid) {
     const Table& table = tables_[uid];
     PlistArray items;
     items.reserve(table.size());
@@ -162,20 +232,38 @@ int FileSandboxUserState::_lock_writeTable(uint32_t uid) {
     int fd = ::mkostemp(tmp.data(), O_CLOEXEC);
     if (fd < 0) return errno;
     int err = writeAll(fd, bytes);
-    if (err == 0 && ::fsync(fd) != 0) err = errno;
     if (::close(fd) != 0 && err == 0) err = errno;
     if (err == 0 && ::rename(tmp.c_str(), file.c_str()) != 0) err = errno;
     if (err != 0) {
         (void)::unlink(tmp.c_str());  // best effort: a leftover temp file is harmless
         return err;
     }
-    persisted_[uid] = table;
-    int dirFd = ::open(directory_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (dirFd >= 0) {
-        if (::fsync(dirFd) != 0) err = errno;
-        ::close(dirFd);
-    }
-    return err;
+    // The snapshot holds everything now; a journal left behind by a failed
+    // unlink would only be replayed to the same effect.
+    if (::unlink(journalForUID(uid).c_str()) != 0 && errno != ENOENT) return errno;
+    journalRecords_[uid] = 0;
+    return 0;
+}
+
+int FileSandboxUserState::_lock_recordChanges(uint32_t uid, const std::vector<Change>& changes) {
+    constexpr size_t kMinJournalRecords = 256;
+    size_t& records = journalRecords_[uid];
+    if (records + changes.size() > std::max(kMinJournalRecords, tables_[uid].size()))
+        return _lock_writeSnapshot(uid);
+    std::vector<uint8_t> bytes;
+    for (const auto& [key, path] : changes)
+        appendRecord(&bytes, std::get<0>(key), std::get<1>(key), std::get<2>(key), path);
+    if (int err = mkdirs(directory_, 0700); err != 0) return err;
+    const FileURL journal = journalForUID(uid);
+    int fd = ::open(journal.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600);
+    if (fd < 0) return errno;
+    int err = writeAll(fd, bytes);
+    if (::close(fd) != 0 && err == 0) err = errno;
+    // After a failed append the journal may end in a torn record, which would
+    // hide every later one: start afresh from a snapshot.
+    if (err != 0) return _lock_writeSnapshot(uid) == 0 ? 0 : err;
+    records += changes.size();
+    return 0;
 }
 
 int FileSandboxUserState::setUserStateItemWithPersona(uint32_t uid, uint32_t personaID,
@@ -185,18 +273,20 @@ int FileSandboxUserState::setUserStateItemWithPersona(uint32_t uid, uint32_t per
     MutexLock lock(mu_);
     Table& table = _lock_tableForUID(uid);
     Key key{itemType, identifier, personaID};
-    if (path) {
-        auto it = table.find(key);
-        if (it != table.end() && it->second == path) return 0;
-        table[key] = path;
-    } else if (table.erase(key) == 0) {
-        return 0;  // nothing to clear, nothing to write
-    }
+    std::optional<std::string> before;
+    if (auto it = table.find(key); it != table.end()) before = it->second;
+    std::optional<std::string> after;
+    if (path) after = path;
+    if (before == after) return 0;
+    if (after)
+        table[key] = *after;
+    else
+        table.erase(key);
     if (batchDepth_ > 0) {
-        dirty_.insert(uid);
+        batchOriginals_[uid].try_emplace(key, std::move(before));
         return 0;
     }
-    int err = _lock_writeTable(uid);
+    int err = _lock_recordChanges(uid, {Change{key, after}});
     if (err != 0)
         PlatformLog("sandbox", PlatformLogType::Error, "Cannot write sandbox state for user %u: %s",
                     uid, std::strerror(err));
@@ -226,18 +316,25 @@ int FileSandboxUserState::endBatch() {
     MutexLock lock(mu_);
     if (batchDepth_ == 0 || --batchDepth_ > 0) return 0;
     int first = 0;
-    for (uint32_t uid : dirty_) {
-        // Pushing what is already recorded (a rebuild after a restart) costs no write.
-        auto persisted = persisted_.find(uid);
-        if (persisted != persisted_.end() && persisted->second == tables_[uid]) continue;
-        int err = _lock_writeTable(uid);
+    for (const auto& [uid, originals] : batchOriginals_) {
+        // Only what the batch changed on balance: re-pushing what is recorded
+        // (a rebuild after a restart) costs no write.
+        const Table& table = tables_[uid];
+        std::vector<Change> changes;
+        for (const auto& [key, before] : originals) {
+            std::optional<std::string> now;
+            if (auto it = table.find(key); it != table.end()) now = it->second;
+            if (now != before) changes.emplace_back(key, std::move(now));
+        }
+        if (changes.empty()) continue;
+        int err = _lock_recordChanges(uid, changes);
         if (err != 0) {
             PlatformLog("sandbox", PlatformLogType::Error,
                         "Cannot write sandbox state for user %u: %s", uid, std::strerror(err));
             if (first == 0) first = err;
         }
     }
-    dirty_.clear();
+    batchOriginals_.clear();
     return first;
 }
 

@@ -2,24 +2,35 @@
 // of items (item type, identifier, path, persona id) that tells the sandbox
 // where a process's containers are without asking the daemon.
 //
-// Linux layer: the daemon keeps the tables itself, one durable file per user
-// in DIR/run/tarnkeeper/sandbox/<uid>.plist (binary property list, written to
-// a temporary file, fsynced, renamed into place, directory fsynced). They
-// survive a daemon restart within one boot, as the kernel's state does, and
-// vanish with DIR/run at reboot. A table is read from its file on first use
-// and kept in memory afterwards; a malformed file counts as an empty table
-// (logged), the way a fresh kernel would answer.
+// Linux layer: the daemon keeps the tables itself, per user in
+// DIR/run/tarnkeeper/sandbox: a snapshot <uid>.plist (binary property list,
+// written to a temporary file and renamed into place) and a journal
+// <uid>.journal of the changes made since, one appended record per change.
+// Loading reads the snapshot and replays the journal; a torn record at the
+// journal's end (the daemon died while appending) ends the replay. When the
+// journal outgrows the table, the snapshot is rewritten and the journal
+// removed; replaying a journal onto a newer snapshot is harmless because
+// every record sets or removes an item outright.
+//
+// Nothing is fsynced: the state stands in for kernel memory, which outlives
+// the daemon (the page cache does too) but not the boot; DIR/run goes at
+// reboot and start-up pushes the mappings again. A creation therefore costs
+// one small append, not a rewrite of every mapping of the user.
+//
+// A table is read on first use and kept in memory afterwards; a malformed
+// snapshot counts as an empty table (logged), the way a fresh kernel would
+// answer.
 //
 // An item is identified by (item type, identifier, persona id): setting it
 // with a path records or replaces the path; setting it without a path
 // removes it. Iteration visits a user's items in (type, identifier, persona)
 // order.
 //
-// Durability batching: while a Batch is open on the instance, changes stay in
-// memory and the touched users' files are written once when the last Batch
-// closes, and not at all when the batch left a table as its file has it. The
-// container cache opens one around a class rebuild, which pushes thousands
-// of items, and around each clear-then-set pair of one push.
+// Batching: while a Batch is open on the instance, changes stay in memory
+// and are appended when the last Batch closes, only those that left an item
+// different from before the batch. The container cache opens one around a
+// class rebuild, which pushes thousands of items, and around each
+// clear-then-set pair of one push.
 //
 // Thread-safe: one mutex per instance guards the tables; callbacks of
 // iterateUserStateItems run with it released on a snapshot.
@@ -33,6 +44,8 @@
 #include <set>
 #include <string>
 #include <tuple>
+#include <utility>
+#include <vector>
 
 #include "Platform/Path.h"
 #include "Platform/ThreadAnnotations.h"
@@ -104,23 +117,32 @@ class FileSandboxUserState : public SandboxUserState {
 
     const FileURL& directory() const { return directory_; }
     FileURL fileForUID(uint32_t uid) const;
+    FileURL journalForUID(uint32_t uid) const;
 
   private:
     using Key = std::tuple<uint64_t, std::string, uint32_t>;  // type, identifier, persona
     using Table = std::map<Key, std::string>;                 // -> path
 
+    // One change: the item's path, or none for a removal.
+    using Change = std::pair<Key, std::optional<std::string>>;
+
     Table& _lock_tableForUID(uint32_t uid) REQUIRES(mu_);
-    int _lock_writeTable(uint32_t uid) REQUIRES(mu_);
+    void _lock_replayJournal(uint32_t uid, Table& table) REQUIRES(mu_);
+    // Appends the changes (or rewrites the snapshot when the journal has grown
+    // past the table); 0 or an errno value.
+    int _lock_recordChanges(uint32_t uid, const std::vector<Change>& changes) REQUIRES(mu_);
+    int _lock_writeSnapshot(uint32_t uid) REQUIRES(mu_);
 
     // Constant after construction.
     const FileURL directory_;
 
     Mutex mu_;
     std::map<uint32_t, Table> tables_ GUARDED_BY(mu_);
-    // What each user's file holds, so a batch that changed nothing on balance writes nothing.
-    std::map<uint32_t, Table> persisted_ GUARDED_BY(mu_);
+    // Records in each user's journal, to know when to rewrite the snapshot.
+    std::map<uint32_t, size_t> journalRecords_ GUARDED_BY(mu_);
     int batchDepth_ GUARDED_BY(mu_) = 0;
-    std::set<uint32_t> dirty_ GUARDED_BY(mu_);
+    // Per user, the items the open batch touched, with their value before it.
+    std::map<uint32_t, std::map<Key, std::optional<std::string>>> batchOriginals_ GUARDED_BY(mu_);
 };
 
 }  // namespace tarn

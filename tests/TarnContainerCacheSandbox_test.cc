@@ -63,22 +63,52 @@ TEST_F(SandboxUserStateTest, ABatchWritesOnceAtItsEnd) {
             ASSERT_EQ(state.setUserStateItemWithPersona(
                           501, 501, 1, ("com.b" + std::to_string(i)).c_str(), "/p"),
                       0);
-        EXPECT_FALSE(fs::exists(state.fileForUID(501))) << "nothing written inside the batch";
+        EXPECT_FALSE(fs::exists(state.journalForUID(501))) << "nothing written inside the batch";
         EXPECT_EQ(items(state, 501).size(), 100u) << "but visible at once";
     }
     FileSandboxUserState restarted(dir());
     EXPECT_EQ(items(restarted, 501).size(), 100u);
 
     // Re-pushing what is recorded (clear, then set the same path) writes nothing.
-    struct stat before, after;
-    ASSERT_EQ(::stat(state.fileForUID(501).c_str(), &before), 0);
+    const auto sizeBefore = fs::file_size(state.journalForUID(501));
     {
         SandboxUserState::Batch batch(restarted);
         ASSERT_EQ(restarted.setUserStateItemWithPersona(501, 501, 1, "com.b7", nullptr), 0);
         ASSERT_EQ(restarted.setUserStateItemWithPersona(501, 501, 1, "com.b7", "/p"), 0);
     }
-    ASSERT_EQ(::stat(state.fileForUID(501).c_str(), &after), 0);
-    EXPECT_EQ(before.st_ino, after.st_ino);
+    EXPECT_EQ(fs::file_size(state.journalForUID(501)), sizeBefore);
+}
+
+TEST_F(SandboxUserStateTest, TheJournalIsFoldedIntoTheSnapshotAndATornTailIsIgnored) {
+    {
+        FileSandboxUserState state(dir());
+        // Many more single changes than the table holds: the journal is folded
+        // into a snapshot now and then instead of growing without bound.
+        for (int i = 0; i < 2000; ++i) {
+            const std::string id = "com.j" + std::to_string(i % 10);
+            ASSERT_EQ(state.setUserStateItemWithPersona(501, 501, 1, id.c_str(),
+                                                        ("/p" + std::to_string(i)).c_str()),
+                      0);
+        }
+        EXPECT_TRUE(fs::exists(state.fileForUID(501)));
+        EXPECT_LT(fs::file_size(state.journalForUID(501)), 300u * 100u);
+        ASSERT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.j0", nullptr), 0);
+    }
+    // The daemon died in the middle of an append.
+    {
+        std::ofstream journal(FileSandboxUserState(dir()).journalForUID(501),
+                              std::ios::binary | std::ios::app);
+        journal.write("\x40\x00\x00\x00bplist", 10);
+    }
+    FileSandboxUserState restarted(dir());
+    const auto all = items(restarted, 501);
+    ASSERT_EQ(all.size(), 9u);
+    EXPECT_EQ(all.front(), "1:com.j1:501=/p1991");
+    EXPECT_EQ(all.back(), "1:com.j9:501=/p1999");
+    // Later changes still count: the next load sees them past the torn record.
+    ASSERT_EQ(restarted.setUserStateItemWithPersona(501, 501, 1, "com.j1", "/new"), 0);
+    FileSandboxUserState again(dir());
+    EXPECT_EQ(items(again, 501).front(), "1:com.j1:501=/new");
 }
 
 TEST_F(SandboxUserStateTest, MalformedStateFilesCountAsEmpty) {

@@ -1,0 +1,292 @@
+// Container requests through a running tarnkeeperd, each against its floor
+// measured in the same run:
+//
+//   1. look-up of an existing container (command 0, no creation) against the
+//      bare SOCK_SEQPACKET echo of the same request record; rounds alternate
+//      back to back, pinned to one CPU and unpinned; medians and ratio;
+//   2. creation of containers (command 0 with "CreateIfNecessary") against the
+//      same file-system work done directly: staging mkdir, metadata written
+//      to a temporary file with fsync, renamed, staging directory fsynced,
+//      moved into the container, standard subdirectories, rename into place.
+//      Batches alternate daemon / direct, each direct batch in fresh
+//      directories; total times and ratio;
+//   3. look-ups per second with 1, 2 and 4 concurrent clients.
+//
+//   container_requests_bench [CONTAINERS] [LOOKUP_ROUNDS]
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <cstring>
+#include <fstream>
+#include <iterator>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+#include <uuid/uuid.h>
+
+#include "Platform/Conduit.h"
+#include "Platform/ConduitHarness.h"
+#include "Platform/ConduitWire.h"
+#include "Platform/ContainerLibrary.h"
+#include "Platform/PlatformLog.h"
+
+using namespace tarn;
+using namespace tarn::conduit;
+using Clock = std::chrono::steady_clock;
+using namespace std::chrono_literals;
+
+namespace {
+
+constexpr uint64_t kClass = 2;  // application data: the most common container
+constexpr uid_t kOwner = 501;
+
+void die(const std::string& what) {
+    std::fprintf(stderr, "%s\n", what.c_str());
+    std::exit(1);
+}
+
+std::string makeScratchRoot() {
+    const char* tmp = std::getenv("TMPDIR");
+    std::string tmpl = std::string(tmp && *tmp ? tmp : "/tmp") + "/tarn-bench-XXXXXX";
+    if (!::mkdtemp(tmpl.data())) return {};
+    namespace fs = std::filesystem;
+    fs::create_directories(tmpl + "/etc/tarnkeeper/codesign");
+    fs::create_directories(tmpl + "/private/var/mobile");
+    fs::create_directories(tmpl + "/private/var/root");
+    std::ofstream(tmpl + "/etc/passwd") << "root:x:0:0:root:/private/var/root:/bin/sh\n"
+                                           "_installd:x:33:33:installd:/private/var/installd:/bin/false\n"
+                                           "mobile:x:501:501:Mobile User:/private/var/mobile:/bin/sh\n";
+    std::ofstream(tmpl + "/etc/group") << "wheel:x:0:\nmobile:x:501:\nsystemusers:x:1020:\n";
+    PlistDict entitlements;
+    entitlements["com.ostrea.private.TarnKeeper.allowed"] = PlistValue(true);
+    PlistDict entry;
+    entry["Executable"] = PlistValue(harness::SelfExecutablePath());
+    entry["SigningIdentifier"] = PlistValue("com.ostrea.tarnkeeperd.bench");
+    entry["Entitlements"] = PlistValue(std::move(entitlements));
+    const auto bytes = PlistValue(std::move(entry)).toBinary();
+    std::ofstream(tmpl + "/etc/tarnkeeper/codesign/bench.plist", std::ios::binary)
+        .write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
+    return tmpl;
+}
+
+PlistValue request0(const std::string& identifier, bool create) {
+    PlistDict d;
+    d["Command"] = PlistValue(uint64_t{0});
+    d["Identifier"] = PlistValue(identifier);
+    d["ContainerClass"] = PlistValue(kClass);
+    d["CreateIfNecessary"] = PlistValue(create);
+    return PlistValue(std::move(d));
+}
+
+// One request; exits on transport failure or an error reply.
+PlistValue send(Client& client, const PlistValue& request) {
+    std::string why;
+    auto reply = client.sendSync(request, 10000ms, &why);
+    if (!reply) die("request failed: " + why);
+    const PlistValue* e = reply->find("ReplyError");
+    if (e && e->asUInt64() != 1) die("daemon answered " + reply->description());
+    return *reply;
+}
+
+double medianUs(std::vector<double> v) {
+    if (v.empty()) return 0;
+    std::sort(v.begin(), v.end());
+    return v[v.size() / 2];
+}
+
+double since(Clock::time_point t0) {
+    return std::chrono::duration<double, std::micro>(Clock::now() - t0).count();
+}
+
+// ---- 1. look-up latency ----
+
+void lookupLatency(const char* config, Client& daemon, const std::vector<uint8_t>& record,
+                   int rounds, int ops) {
+    std::string why;
+    auto echo = harness::SeqpacketEcho::start(&why);
+    if (!echo) die("echo: " + why);
+    const PlistValue lookup = request0("bench.lookup", false);
+    std::vector<double> echoLat, daemonLat;
+    std::vector<uint8_t> back;
+    for (int r = 0; r <= rounds; ++r) {  // round 0 warms up
+        for (int i = 0; i < ops; ++i) {
+            const auto t0 = Clock::now();
+            if (!echo->roundTrip(record, &back)) die("echo failed");
+            if (r) echoLat.push_back(since(t0));
+        }
+        for (int i = 0; i < ops; ++i) {
+            const auto t0 = Clock::now();
+            send(daemon, lookup);
+            if (r) daemonLat.push_back(since(t0));
+        }
+    }
+    const double a = medianUs(echoLat), b = medianUs(daemonLat);
+    std::printf("look-up   %-9s echo %7.2f us | daemon %7.2f us | ratio %.2f (target <= 2)\n",
+                config, a, b, a > 0 ? b / a : 0.0);
+}
+
+// ---- 2. creation ----
+
+std::string newUuid() {
+    uuid_t u;
+    uuid_generate_random(u);
+    char s[37];
+    uuid_unparse_upper(u, s);
+    return s;
+}
+
+void check(bool ok, const char* what) {
+    if (!ok) die(std::string("direct: ") + what + ": " + std::strerror(errno));
+}
+
+void fsyncDir(const std::string& path) {
+    int fd = ::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    check(fd >= 0, "open dir");
+    check(::fsync(fd) == 0, "fsync dir");
+    ::close(fd);
+}
+
+// What the daemon does on disk for one new data container.
+void createDirectly(const std::string& staging, const std::string& live,
+                    const std::vector<uint8_t>& metadata, const std::vector<std::string>& subdirs) {
+    const std::string uuid = newUuid();
+    const std::string dir = staging + "/" + uuid;
+    check(::mkdir(dir.c_str(), 0755) == 0, "mkdir");
+    check(::chown(dir.c_str(), kOwner, kOwner) == 0, "chown");
+    const std::string temp = staging + "/temp_metadata-" + newUuid() + ".plist";
+    const std::string hidden = staging + "/.temp.tmp";
+    int fd = ::open(hidden.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644);
+    check(fd >= 0, "open");
+    check(::write(fd, metadata.data(), metadata.size()) == static_cast<ssize_t>(metadata.size()),
+          "write");
+    check(::fsync(fd) == 0, "fsync");
+    ::close(fd);
+    check(::rename(hidden.c_str(), temp.c_str()) == 0, "rename temp");
+    fsyncDir(staging);
+    check(::rename(temp.c_str(), (dir + "/.com.ostrea.tarn_keeper.metadata.plist").c_str()) == 0,
+          "rename metadata");
+    for (const auto& name : subdirs) {
+        const std::string sub = dir + "/" + name;
+        check(::mkdir(sub.c_str(), 0755) == 0, "mkdir sub");
+        check(::chown(sub.c_str(), kOwner, kOwner) == 0, "chown sub");
+    }
+    check(::rename(dir.c_str(), (live + "/" + uuid).c_str()) == 0, "rename live");
+}
+
+void creation(const char* config, const std::string& root, Client& daemon, int total,
+              const std::vector<uint8_t>& metadata) {
+    std::vector<std::string> subdirs;
+    uint64_t code = 0;
+    if (!ContainerLibrarySubdirectoriesForClass(kClass, &subdirs, &code)) die("no subdirectories");
+    const int batch = 100;
+    double daemonUs = 0, directUs = 0;
+    int made = 0, k = 0;
+    while (made < total) {
+        const int n = std::min(batch, total - made);
+        auto t0 = Clock::now();
+        for (int i = 0; i < n; ++i) send(daemon, request0(std::string("bench.create.") + config + "." + std::to_string(made + i), true));
+        daemonUs += since(t0);
+        const std::string base = root + "/direct/" + config + std::to_string(k++);
+        std::filesystem::create_directories(base + "/staging");
+        std::filesystem::create_directories(base + "/live");
+        t0 = Clock::now();
+        for (int i = 0; i < n; ++i) createDirectly(base + "/staging", base + "/live", metadata, subdirs);
+        directUs += since(t0);
+        made += n;
+    }
+    std::printf("creation  %-9s %d containers: daemon %.1f us each | direct %.1f us each | ratio %.2f "
+                "(target <= 1.5)\n",
+                config, total, daemonUs / total, directUs / total, directUs > 0 ? daemonUs / directUs : 0.0);
+}
+
+// ---- 3. throughput ----
+
+void throughput(const std::string& socket, int clients) {
+    std::atomic<bool> stop{false};
+    std::atomic<uint64_t> done{0};
+    std::vector<std::thread> threads;
+    for (int c = 0; c < clients; ++c) {
+        threads.emplace_back([&] {
+            std::string why;
+            auto client = Client::connect(socket, &why);
+            if (!client) die("connect: " + why);
+            const PlistValue lookup = request0("bench.lookup", false);
+            uint64_t n = 0;
+            while (!stop.load(std::memory_order_relaxed)) {
+                send(*client, lookup);
+                ++n;
+            }
+            done += n;
+        });
+    }
+    std::this_thread::sleep_for(1500ms);
+    stop = true;
+    for (auto& t : threads) t.join();
+    std::printf("look-ups  %d client%s: %8.0f per second\n", clients, clients == 1 ? " " : "s",
+                static_cast<double>(done.load()) / 1.5);
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    const int containers = argc > 1 ? std::max(1, std::atoi(argv[1])) : 2000;
+    const int rounds = argc > 2 ? std::max(1, std::atoi(argv[2])) : 20;
+    PlatformLogSetQuiet(true);
+    std::string why;
+
+    const std::string root = makeScratchRoot();
+    if (root.empty()) die("cannot make a scratch root");
+    harness::ChildProcess::Options opts;
+    opts.stdoutPath = root + "/daemon.out";
+    opts.stderrPath = root + "/daemon.err";
+    auto daemon = harness::ChildProcess::spawn({TARN_BINARY_DIR "/tarnkeeperd", "--root", root},
+                                               opts, &why);
+    if (!daemon) die("cannot start " TARN_BINARY_DIR "/tarnkeeperd: " + why);
+    const std::string socket = root + "/run/com.ostrea.tarnkeeperd.socket";
+    std::unique_ptr<Client> client;
+    for (const auto deadline = Clock::now() + 15s; !client && Clock::now() < deadline;) {
+        client = Client::connect(socket, &why);
+        if (!client && daemon->wait(50ms)) die("the daemon exited; see " + opts.stderrPath);
+    }
+    if (!client) die("no daemon socket: " + why);
+    // The direct side writes the very bytes the daemon wrote for this one.
+    const PlistValue made = send(*client, request0("bench.lookup", true));
+    const PlistValue* path = made.find("ReplyPath");
+    if (!path || !path->isString()) die("no ReplyPath in " + made.description());
+    std::ifstream in(*path->asString() + "/.com.ostrea.tarn_keeper.metadata.plist", std::ios::binary);
+    const std::vector<uint8_t> metadata((std::istreambuf_iterator<char>(in)),
+                                        std::istreambuf_iterator<char>());
+    if (metadata.empty()) die("cannot read the metadata of " + *path->asString());
+
+    std::vector<uint8_t> body;
+    if (!EncodeBody(request0("bench.lookup", false), &body, &why)) die(why);
+    RecordHeader h;
+    h.flags = kFlagRequest;
+    h.messageId = 1;
+    const std::vector<uint8_t> record = BuildRecords(h, body).front();
+
+    const std::vector<int> all = harness::AllowedCpus();
+    if (!harness::SetProcessCpus(::getpid(), {all.front()}, &why) ||
+        !harness::SetProcessCpus(daemon->pid(), {all.front()}, &why))
+        std::fprintf(stderr, "pinning: %s\n", why.c_str());
+    lookupLatency("pinned", *client, record, rounds, 200);
+    creation("pinned", root, *client, containers, metadata);
+    (void)harness::SetProcessCpus(::getpid(), all, &why);
+    (void)harness::SetProcessCpus(daemon->pid(), all, &why);
+    lookupLatency("unpinned", *client, record, rounds, 200);
+    creation("unpinned", root, *client, containers, metadata);
+    for (int clients : {1, 2, 4}) throughput(socket, clients);
+
+    client.reset();
+    daemon->terminate();
+    std::error_code ec;
+    std::filesystem::remove_all(root, ec);
+    return 0;
+}
