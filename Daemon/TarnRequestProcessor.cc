@@ -99,8 +99,12 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
         return;
     }
 
-    SignpostInterval signpost("conduit", "ConduitEventProcessing",
-                              {{"command", std::to_string(command)}});
+    // The attribute strings are built only when someone records signposts.
+    const bool recording = PlatformLogVerbose();
+    SignpostInterval signpost("conduit", recording ? "ConduitEventProcessing" : std::string(),
+                              recording ? std::vector<std::pair<std::string, std::string>>{
+                                              {"command", std::to_string(command)}}
+                                        : std::vector<std::pair<std::string, std::string>>{});
     std::shared_ptr<TarnClientConnection> connection;
     const TarnCommandTableRow* row = nullptr;
     if (command >= kTarnCommandCount) {
@@ -158,7 +162,12 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
 
     std::string client = connection ? connection->clientBundleIdentifier() : "<unknown>";
     if (client.empty()) client = "<unknown>";
-    signpost.end({{"command", std::to_string(command)}, {"clientIdentifier", client}});
+    if (recording)
+        signpost.end({{"command", std::to_string(command)}, {"clientIdentifier", client}});
+    else
+        signpost.end();
+    // Before the reply, so that whoever reads the platform-log file after the
+    // answer finds the line; without a file it is only queued (PlatformLog.h).
     PlatformLog("conduit", PlatformLogType::Default, "command=%llu, client=%@, error=%llu", command,
                 client, error);
     if (!(error == TarnSuccess && row && row->replyOnReturn == 0)) {
@@ -193,7 +202,7 @@ void TarnFatalExceptionReport(const std::exception* exception) {
     text += "\nStack:\n";
     gCrashMu.lock();  // never released: the process ends here
     std::strncpy(gCrashMessage, text.c_str(), sizeof gCrashMessage - 1);
-    PlatformLogWrite("daemon", PlatformLogType::Fault, text);
+    PlatformLogWrite("daemon", PlatformLogType::Fault, text);  // flushes batched lines first
     std::abort();
 }
 

@@ -267,8 +267,8 @@ void Listener::IoLoop::acceptAll() {
         ConnectionRef c;
         {
             MutexLock l(mu);
-            c = std::make_shared<Connection>(Connection::PrivateTag{}, fd, creds->pidfd, cc,
-                                             nextSerial++);
+            c = std::make_shared<Connection>(Connection::PrivateTag{}, fd, creds->pidfd,
+                                             creds->procFd, cc, nextSerial++);
             connections.emplace(c->serial_, c);
             h = handler;
         }
@@ -331,7 +331,13 @@ bool Listener::IoLoop::readConnection(const ConnectionRef& c) {
             const bool ran = c->queue_->runHereIfIdle(
                 [&] { c->deliver(std::move(body), h.flags, h.messageId, h.replyTo, false); });
             if (!returnFromRequest()) return false;
-            if (ran) continue;
+            if (ran) {
+                // A peer waiting for its answer has sent nothing more yet:
+                // re-arm rather than spend a read on finding the socket empty.
+                // A message already there fires at once.
+                arm(c->fd_, c->serial_, false);
+                return true;
+            }
         }
         bool pause;
         {
@@ -352,9 +358,11 @@ bool Listener::IoLoop::readConnection(const ConnectionRef& c) {
 // ---------------------------------------------------------------------------
 // Connection
 
-Connection::Connection(PrivateTag, int fd, int pidfd, const Credentials& creds, uint64_t serial)
+Connection::Connection(PrivateTag, int fd, int pidfd, int procFd, const Credentials& creds,
+                       uint64_t serial)
     : fd_(fd),
       pidfd_(pidfd),
+      procFd_(procFd),
       creds_(creds),
       auditToken_(MakeAuditToken({creds.euid, creds.egid, creds.pid, creds.startTime})),
       serial_(serial),
@@ -363,14 +371,27 @@ Connection::Connection(PrivateTag, int fd, int pidfd, const Credentials& creds, 
 Connection::~Connection() {
     sock::CloseFd(fd_);
     sock::CloseFd(pidfd_);
+    sock::CloseFd(procFd_);
 }
 
 std::optional<std::string> Connection::executablePath() const {
-    auto path = sock::ProcessExecutable(creds_.pid);
-    auto file = sock::ProcessExecutableFile(creds_.pid);
-    // Alive after the reads: the PID still named our peer while we read it.
-    if (!path || !file || !sock::PidfdAlive(pidfd_)) return std::nullopt;
-    {
+    std::optional<std::string> path;
+    std::optional<sock::FileIdentity> file;
+    if (procFd_ >= 0) {
+        // One system call per request. The link read through the peer's own
+        // /proc directory names what that process runs now, so an exec shows
+        // at once, and it cannot be read once the process is gone, even if the
+        // PID is reused. Identity follows the executable's path, so an
+        // unchanged link means an unchanged answer.
+        path = sock::ExecutableLinkAt(procFd_);
+        if (!path) return std::nullopt;
+        MutexLock l(exeMu_);
+        if (exe_ && exe_->link == *path) return exe_->realPath;
+    } else {
+        path = sock::ProcessExecutable(creds_.pid);
+        file = sock::ProcessExecutableFile(creds_.pid);
+        // Alive after the reads: the PID still named our peer while we read it.
+        if (!path || !file || !sock::PidfdAlive(pidfd_)) return std::nullopt;
         MutexLock l(exeMu_);
         if (exe_ && exe_->link == *path && exe_->dev == file->dev && exe_->ino == file->ino)
             return exe_->realPath;
@@ -383,7 +404,7 @@ std::optional<std::string> Connection::executablePath() const {
     auto real = std::filesystem::canonical(*path, ec);
     std::string result = ec ? *path : real.string();
     MutexLock l(exeMu_);
-    exe_ = ExecutableCache{*path, file->dev, file->ino, result};
+    exe_ = ExecutableCache{*path, file ? file->dev : 0, file ? file->ino : 0, result};
     return result;
 }
 

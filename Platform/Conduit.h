@@ -151,7 +151,8 @@ public:
     const DispatchQueueRef& queue() const { return queue_; }
 
     // Internal: made by the Listener's I/O thread.
-    Connection(PrivateTag, int fd, int pidfd, const Credentials& creds, uint64_t serial);
+    Connection(PrivateTag, int fd, int pidfd, int procFd, const Credentials& creds,
+               uint64_t serial);
     ~Connection();
     Connection(const Connection&) = delete;
     Connection& operator=(const Connection&) = delete;
@@ -171,6 +172,7 @@ private:
     // Constant after construction.
     const int fd_;
     const int pidfd_;
+    const int procFd_;  // the peer's /proc directory, or -1 (see sock::PeerCredentials)
     const Credentials creds_;
     const AuditToken auditToken_;
     const uint64_t serial_;  // key in the Listener's I/O table
@@ -192,8 +194,8 @@ private:
     std::atomic<uint64_t> nextId_{1};
 
     // The last executablePath() answer, reused while the peer still runs the
-    // same file under the same link: resolving it again costs a /proc read and
-    // a realpath walk per request.
+    // same link (and, without procFd_, the same file): resolving it again costs
+    // a start-time read and a realpath walk.
     struct ExecutableCache {
         std::string link;
         uint64_t dev = 0;

@@ -174,6 +174,13 @@ std::optional<std::string> ProcessExecutable(pid_t pid) {
     return std::string(buf.data(), static_cast<size_t>(n));
 }
 
+std::optional<std::string> ExecutableLinkAt(int procFd) {
+    char buf[4096];
+    const ssize_t n = ::readlinkat(procFd, "exe", buf, sizeof buf);
+    if (n <= 0 || static_cast<size_t>(n) >= sizeof buf) return std::nullopt;
+    return std::string(buf, static_cast<size_t>(n));
+}
+
 std::optional<FileIdentity> ProcessExecutableFile(pid_t pid) {
     const std::string link = "/proc/" + std::to_string(pid) + "/exe";
     struct stat st;
@@ -209,8 +216,11 @@ std::optional<PeerCredentials> ReadPeerCredentials(int fd, std::string* why) {
         }
     }
     auto startTime = ProcessStartTime(cred.pid);
-    // Alive after the read means the PID named this process while we read it.
+    const std::string procDir = "/proc/" + std::to_string(cred.pid);
+    const int procFd = ::open(procDir.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC);
+    // Alive after the reads means the PID named this process while we read it.
     if (!startTime || !PidfdAlive(pidfd)) {
+        CloseFd(procFd);
         CloseFd(pidfd);
         if (why) *why = "peer exited before its identity could be read";
         return std::nullopt;
@@ -218,6 +228,7 @@ std::optional<PeerCredentials> ReadPeerCredentials(int fd, std::string* why) {
     // Without SO_PEERPIDFD the PID might have been reused between connect and
     // pidfd_open; the connecting process started before we accepted it.
     if (!fromSocket && *startTime > acceptedAt) {
+        CloseFd(procFd);
         CloseFd(pidfd);
         if (why) *why = "peer PID was reused before it could be pinned";
         return std::nullopt;
@@ -225,6 +236,7 @@ std::optional<PeerCredentials> ReadPeerCredentials(int fd, std::string* why) {
     (void)::fcntl(pidfd, F_SETFD, FD_CLOEXEC);  // best effort: pidfds come close-on-exec
     out.startTime = *startTime;
     out.pidfd = pidfd;
+    out.procFd = procFd;  // -1 when /proc could not be opened: callers fall back to the PID
     return out;
 }
 

@@ -35,6 +35,11 @@ struct PeerCredentials {
     pid_t pid = 0;
     uint64_t startTime = 0;  // clock ticks after boot
     int pidfd = -1;          // owned by the caller
+    // The peer's /proc directory (O_PATH), owned by the caller; -1 when it
+    // could not be opened. Opened while the pidfd showed the process alive, so
+    // it names that process and no other, and reads through it fail once the
+    // process is gone even if its PID is reused.
+    int procFd = -1;
 };
 // Takes SO_PEERCRED and the peer's pidfd (SO_PEERPIDFD, or pidfd_open checked
 // against the accept time), and the start time read while the pidfd shows the
@@ -47,6 +52,9 @@ std::optional<uint64_t> ProcessStartTime(pid_t pid);
 bool PidfdAlive(int pidfd);
 // readlink of /proc/PID/exe.
 std::optional<std::string> ProcessExecutable(pid_t pid);
+// The "exe" link in a /proc directory opened as PeerCredentials::procFd: what
+// that process runs now. Empty once the process has exited.
+std::optional<std::string> ExecutableLinkAt(int procFd);
 // Device and inode of the file /proc/PID/exe names: a new exec of another
 // file changes them even when the path stays the same.
 struct FileIdentity {

@@ -26,7 +26,12 @@ void PlatformLogSetFile(const std::string& path);
 bool PlatformLogVerbose();
 // Silences stderr/journald output (tests and tools); the file, if any, still gets lines.
 void PlatformLogSetQuiet(bool quiet);
+// The file gets every line before this returns. Error and Fault lines reach
+// stderr or journald at once too; lower ones are batched and follow within a
+// few tens of milliseconds (and at exit), always in order.
 void PlatformLogWrite(const char* category, PlatformLogType type, const std::string& message);
+// Writes out batched lines now (before a deliberate abort, for example).
+void PlatformLogFlush();
 
 template <class... Args>
 void PlatformLog(const char* category, PlatformLogType type, std::string_view fmt,

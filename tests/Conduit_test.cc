@@ -1,9 +1,15 @@
 #include "Platform/Conduit.h"
 
 #include <gtest/gtest.h>
+#include <pthread.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
@@ -431,6 +437,92 @@ TEST_F(ConduitListenerTest, PeersRunConcurrentlyButEachPeerSerially) {
     EXPECT_EQ(maxInFlightA.load(), 1);
     EXPECT_TRUE(orderedA.load());
     EXPECT_EQ(lastSeqA.load(), 40u);
+}
+
+// A request to an idle peer queue runs on the I/O thread that read it (no
+// hand-off to another thread), still as an item of the peer's queue; a
+// handler there may even cancel the listener without waiting for itself.
+TEST_F(ConduitListenerTest, IdleRequestsRunWhereTheyWereReadAndMayCancelTheListener) {
+    struct Seen {
+        Mutex mu;
+        std::vector<std::string> threads GUARDED_BY(mu);
+        bool onQueue GUARDED_BY(mu) = true;
+    };
+    auto seen = std::make_shared<Seen>();
+    auto listener = listener_;
+    setHandler([seen, listener](const ConnectionRef& c, const MessageRef& m) {
+        char name[32] = {};
+        (void)pthread_getname_np(pthread_self(), name, sizeof name);
+        {
+            MutexLock l(seen->mu);
+            seen->threads.emplace_back(name);
+            seen->onQueue = seen->onQueue && c->queue()->isCurrent();
+        }
+        if (m->body().find("Stop")) listener->cancel();
+        echo(c, m);
+    });
+    listener_->resume();
+    auto client = connect();
+    std::string why;
+    for (uint64_t seq = 1; seq <= 20; ++seq) ASSERT_TRUE(client->sendSync(request(seq), 5000ms, &why)) << why;
+    {
+        MutexLock l(seen->mu);
+        ASSERT_EQ(seen->threads.size(), 20u);
+        for (const auto& t : seen->threads) EXPECT_EQ(t, "tarn-conduit-io");
+        EXPECT_TRUE(seen->onQueue);
+    }
+    PlistValue stop = request(21);
+    stop.set("Stop", PlistValue(true));
+    // The handler's own reply may or may not get out before its connection
+    // is cancelled; what matters is that cancel() returned inside it.
+    (void)client->sendSync(stop, 5000ms, &why);
+    EXPECT_TRUE(eventually([&] { return listener_->TEST_connectionCount() == 0; }));
+    EXPECT_FALSE(Client::connect(listener_->socketPath(), &why));
+}
+
+// The peer connects, then execs another program that inherits the socket:
+// from then on the connection answers with the new executable, and with
+// nothing once the process is gone.
+TEST_F(ConduitListenerTest, AnExecInThePeerShowsInItsExecutable) {
+    const std::string other = "/bin/sleep";
+    if (::access(other.c_str(), X_OK) != 0) GTEST_SKIP() << "needs " << other << " to exec";
+    listener_->resume();
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    std::strncpy(addr.sun_path, listener_->socketPath().c_str(), sizeof addr.sun_path - 1);
+    int go[2];
+    ASSERT_EQ(::pipe(go), 0);
+    const pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        // Async-signal-safe calls only: the parent has threads.
+        ::close(go[1]);
+        const int fd = ::socket(AF_UNIX, SOCK_SEQPACKET, 0);  // kept across exec
+        if (fd < 0 || ::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) ::_exit(2);
+        char byte;
+        if (::read(go[0], &byte, 1) != 1) ::_exit(3);
+        ::execl(other.c_str(), "sleep", "30", static_cast<char*>(nullptr));
+        ::_exit(4);
+    }
+    ::close(go[0]);
+    ASSERT_TRUE(eventually([&] { return server_->connectionCount() == 1; }));
+    ConnectionRef c;
+    {
+        MutexLock l(server_->mu);
+        c = server_->connections.front();
+    }
+    const std::string self = std::filesystem::canonical("/proc/self/exe").string();
+    EXPECT_EQ(c->executablePath(), std::optional<std::string>(self));
+    EXPECT_EQ(c->executablePath(), std::optional<std::string>(self));  // cached answer
+    ASSERT_EQ(::write(go[1], "x", 1), 1);
+    ::close(go[1]);
+    const std::string now = std::filesystem::canonical(other).string();
+    EXPECT_TRUE(eventually([&] { return c->executablePath() == std::optional<std::string>(now); }))
+        << c->executablePath().value_or("(none)");
+    ::kill(child, SIGKILL);
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_FALSE(c->executablePath().has_value());
 }
 
 TEST_F(ConduitListenerTest, ARequestIsAnsweredAtMostOnce) {

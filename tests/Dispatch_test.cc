@@ -207,6 +207,86 @@ TEST(DispatchSuspend, CountedAndHoldsSyncAndQueuesTargetingIt) {
     ASSERT_TRUE(eventually([&] { return ran == 2; }));
 }
 
+// runHereIfIdle takes the queue (and its target chain) only when an item
+// could start now; otherwise it leaves the order to the queue.
+TEST(DispatchRunHere, RunsOnTheCallerOnlyWhenTheWholeChainIsFree) {
+    auto target = DispatchQueue::createSerial("test.here.target");
+    auto queue = DispatchQueue::createSerial("test.here", target);
+    const std::thread::id caller = std::this_thread::get_id();
+    bool ran = false;
+    EXPECT_TRUE(queue->runHereIfIdle([&] {
+        EXPECT_EQ(std::this_thread::get_id(), caller);
+        EXPECT_TRUE(queue->isCurrent());
+        EXPECT_TRUE(target->isCurrent());
+        ran = true;
+    }));
+    EXPECT_TRUE(ran);
+    EXPECT_FALSE(queue->isCurrent());
+
+    auto refused = [](const DispatchQueueRef& q) {
+        std::atomic<bool> ran{false};
+        const bool admitted = q->runHereIfIdle([&] { ran = true; });
+        return !admitted && !ran;
+    };
+    // Busy target, then work pending behind it: both refuse, and the pending
+    // work still runs in order once the target frees up.
+    Event started, release;
+    std::vector<int> order;
+    target->async([&] {
+        started.set();
+        release.wait();
+        order.push_back(1);
+    });
+    ASSERT_TRUE(started.wait());
+    EXPECT_TRUE(refused(queue));
+    EXPECT_TRUE(refused(target));
+    queue->async([&] { order.push_back(2); });
+    release.set();
+    target->sync([] {});
+    queue->sync([] {});
+    EXPECT_EQ(order, (std::vector<int>{1, 2}));
+
+    // Pending work on the queue itself (held by a suspension) keeps its place.
+    queue->suspend();
+    queue->async([&] { order.push_back(3); });
+    EXPECT_TRUE(refused(queue));
+    queue->resume();
+    queue->sync([] {});
+    EXPECT_EQ(order, (std::vector<int>{1, 2, 3}));
+
+    // From inside its own item a serial queue is busy; the main queue belongs
+    // to runMain() only.
+    queue->sync([&] { EXPECT_TRUE(refused(queue)); });
+    EXPECT_TRUE(refused(DispatchQueue::createSerial("test.here.main", DispatchQueue::main())));
+
+    // Many threads racing for one queue: never two inside at once, and no
+    // refused attempt loses its place to a later async.
+    ExclusionProbe probe;
+    std::atomic<int> inline_{0}, handed{0};
+    std::vector<std::thread> threads;
+    for (int t = 0; t < 4; ++t) {
+        threads.emplace_back([&] {
+            for (int i = 0; i < 200; ++i) {
+                auto work = [&] {
+                    probe.enter();
+                    probe.leave();
+                };
+                if (queue->runHereIfIdle(work)) {
+                    inline_++;
+                } else {
+                    handed++;
+                    queue->async(work);
+                }
+            }
+        });
+    }
+    for (auto& t : threads) t.join();
+    queue->sync([] {});
+    EXPECT_EQ(probe.overlaps, 0);
+    EXPECT_EQ(inline_ + handed, 800);
+    EXPECT_GT(inline_, 0);
+}
+
 TEST(DispatchBarrier, RunsAloneBetweenEarlierAndLaterItems) {
     auto queue = DispatchQueue::createConcurrent("test.barrier");
     constexpr int kRounds = 5;
