@@ -176,21 +176,26 @@ bool TarnClientConnection::_passesGroupOwnerRuleForContainerClass(
 bool TarnClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, bool isDir,
                                                     bool startDeletionThread, TarnErrorRef* error) {
     auto& fm = TarnFileManager::defaultManager();
-    TarnErrorRef underlying;
-    // A directory of its own keeps two items of the same name from colliding.
-    auto unique = fm.createTemporaryDirectoryInDirectoryURL(
-        TarnGlobalConfiguration::sharedInstance().deathrowDirectory(), &underlying);
-    if (!unique) {
-        if (error)
-            *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, underlying,
-                                "Failed to create unique directory at: %@", url);
-        return false;
-    }
-    const FileURL destination = PathJoin(*unique, PathLastComponent(url));
-    if (!fm.moveItemAtURL(url, destination, &underlying)) {
+    // A deletion pass running meanwhile may remove the still empty slot before
+    // the rename lands; the item is then still here and needs a new slot.
+    constexpr int kAttempts = 3;
+    for (int attempt = 1;; ++attempt) {
+        TarnErrorRef underlying;
+        // A directory of its own keeps two items of the same name from colliding.
+        auto unique = fm.createTemporaryDirectoryInDirectoryURL(
+            TarnGlobalConfiguration::sharedInstance().deathrowDirectory(), &underlying);
+        if (!unique) {
+            if (error)
+                *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, underlying,
+                                    "Failed to create unique directory at: %@", url);
+            return false;
+        }
+        const FileURL destination = PathJoin(*unique, PathLastComponent(url));
+        if (fm.moveItemAtURL(url, destination, &underlying)) break;
         if (underlying && underlying->posixCode() == ENOENT) {
-            // Already gone; the empty directory goes with the next pass.
-            return true;
+            // Already gone; the empty slot goes with the next pass.
+            if (fm.itemDoesNotExistAtURL(url)) return true;
+            if (attempt < kAttempts) continue;
         }
         if (error)
             *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, underlying,

@@ -7,6 +7,7 @@
 
 #include <barrier>
 #include <filesystem>
+#include <future>
 #include <thread>
 
 #include "Daemon/TarnClientConnection.h"
@@ -236,6 +237,27 @@ TEST_F(TarnCreateOrLookupTest, TransientContainersAreMadeAnewAndTheOldOneGoesToD
         connection_.createOrLookupContainerWithContainerIdentity(id, false, false, true, &code));
     EXPECT_EQ(code, TarnErrorNotFound);
     TarnDeathRowQueue()->resume();
+}
+
+// A deletion pass that empties death row while an old transient container is
+// on its way there must not leave it live next to its successor.
+TEST_F(TarnCreateOrLookupTest, ATransientReplacedDuringADeletionPassLeavesOneLive) {
+    auto id = identity("com.example.transient.pass", 2);
+    auto first = create(id, true);
+    ASSERT_TRUE(first);
+    // The first move is the old container's into its death-row slot.
+    ASSERT_TRUE(FailpointSet("fm.move", "sleep:300@1"));
+    TarnMetadataRef second;
+    std::thread replacing([&] { second = create(id, true); });
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    std::promise<uint64_t> passed;
+    connection_.deleteContainersOnDeathRowWithCompletion(
+        [&passed](uint64_t code) { passed.set_value(code); });
+    EXPECT_EQ(passed.get_future().get(), TarnSuccess);
+    replacing.join();
+    ASSERT_TRUE(second);
+    EXPECT_FALSE(fs::exists(first->url()));
+    EXPECT_EQ(entriesIn(liveFor(2, true)), 1u);
 }
 
 // A failure after the staging directory exists: the half-built container goes
