@@ -25,7 +25,9 @@ std::optional<bool> gPersonasSupported;   // decided once per process
 std::optional<bool> gPersonasSupportedOverride;
 
 // A value made once per root prefix: the root is fixed in production; tests
-// change it and must not see identities of an earlier scratch tree.
+// change it and must not see identities of an earlier scratch tree. Slots are
+// never freed: a flush queued by the roster's watcher can still run while
+// exit() destroys statics.
 struct PerRootIdentity {
     std::mutex lock;
     std::string root;
@@ -108,7 +110,7 @@ TarnUserIdentityCache::~TarnUserIdentityCache() {
 // ---- Class-level answers ----
 
 TarnUserIdentityRef TarnUserIdentityCache::defaultUserIdentity() {
-    static PerRootIdentity slot;
+    static auto& slot = *new PerRootIdentity;
     return perRoot(slot, [] {
         uint32_t uid = 0, gid = 0;
         mobileIds(&uid, &gid);
@@ -122,7 +124,7 @@ TarnUserIdentityRef TarnUserIdentityCache::defaultUserIdentity() {
 }
 
 TarnUserIdentityRef TarnUserIdentityCache::userIdentityForLegacyMobileUser() {
-    static PerRootIdentity slot;
+    static auto& slot = *new PerRootIdentity;
     return perRoot(slot, [] { return TarnUserIdentity::init(); });
 }
 
@@ -564,9 +566,9 @@ void TarnUserIdentityCache::TEST_drainFlushQueue() { flushQueue_->sync([] {}); }
 
 TarnUserIdentitySharedCache& TarnUserIdentitySharedCache::sharedInstance() {
     static std::mutex lock;
-    static std::string root;
     // Never freed: references handed out under an earlier root stay valid, and
     // nothing is torn down at exit while other threads may still use it.
+    static auto& root = *new std::string();
     static auto& made = *new std::vector<std::unique_ptr<TarnUserIdentitySharedCache>>();
     std::lock_guard<std::mutex> guard(lock);
     if (made.empty() || root != RootPrefix()) {

@@ -4,7 +4,9 @@ namespace tarn {
 
 namespace {
 std::string& prefix() {
-    static std::string p = "/";
+    // Never freed: threads still running while exit() destroys statics
+    // (watchers, queued work) resolve paths through it.
+    static auto& p = *new std::string("/");
     return p;
 }
 }  // namespace
