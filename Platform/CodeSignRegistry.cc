@@ -19,9 +19,24 @@ struct CodeSignRegistry::Impl {
     std::mutex mu;
     std::map<std::string, std::shared_ptr<const CodeSignInfo>> byPath;  // guarded by mu
     std::atomic<bool> stale{true};
-    std::unique_ptr<FileWatcher> watcher;
+    std::mutex watchMu;
+    std::string watchedDir;                // guarded by watchMu
+    std::unique_ptr<FileWatcher> watcher;  // guarded by watchMu
 
     std::string dir() const { return RootPath("/etc/tarnkeeper/codesign"); }
+
+    // Follows the root prefix: fixed in the daemon, changed by tests.
+    void ensureWatching() {
+        std::string d = dir();
+        std::lock_guard lock(watchMu);
+        if (watcher && watchedDir == d) return;
+        // The callback only marks the registry stale, so stopping here
+        // cannot wait on anything this thread holds.
+        if (watcher) watcher->stop();
+        watcher = FileWatcher::watchDirectory(d, [this](const std::string&) { stale = true; });
+        watchedDir = d;
+        stale = true;
+    }
 
     static std::string realOrSelf(const std::string& p) {
         std::error_code ec;
@@ -62,11 +77,7 @@ struct CodeSignRegistry::Impl {
     }
 };
 
-CodeSignRegistry::CodeSignRegistry() : impl_(std::make_unique<Impl>()) {
-    Impl* impl = impl_.get();
-    impl_->watcher =
-        FileWatcher::watchDirectory(impl_->dir(), [impl](const std::string&) { impl->stale = true; });
-}
+CodeSignRegistry::CodeSignRegistry() : impl_(std::make_unique<Impl>()) { impl_->ensureWatching(); }
 
 CodeSignRegistry& CodeSignRegistry::shared() {
     static auto* r = new CodeSignRegistry;
@@ -74,6 +85,7 @@ CodeSignRegistry& CodeSignRegistry::shared() {
 }
 
 std::shared_ptr<const CodeSignInfo> CodeSignRegistry::infoForExecutable(const std::string& realPath) {
+    impl_->ensureWatching();
     if (impl_->stale.exchange(false)) impl_->load();
     std::lock_guard lock(impl_->mu);
     auto it = impl_->byPath.find(realPath);
@@ -81,6 +93,7 @@ std::shared_ptr<const CodeSignInfo> CodeSignRegistry::infoForExecutable(const st
 }
 
 void CodeSignRegistry::reload() {
+    impl_->ensureWatching();
     impl_->stale = false;
     impl_->load();
 }

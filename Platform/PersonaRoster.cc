@@ -95,10 +95,11 @@ std::string PersonaListDescription(const std::optional<PersonaAttributesList>& l
 
 PersonaRoster& PersonaRoster::sharedManager() {
     static std::mutex lock;
-    static std::string root;
     // Never freed: references handed out under an earlier root stay valid (the
     // old ones only stop watching a tree that is gone), and nothing is torn
-    // down at exit while other threads may still use it.
+    // down at exit while other threads, the watchers' among them, may still
+    // use it.
+    static auto& root = *new std::string();
     static auto& made = *new std::vector<std::unique_ptr<FilePersonaRoster>>();
     std::lock_guard<std::mutex> guard(lock);
     if (made.empty() || root != RootPrefix()) {
@@ -237,7 +238,8 @@ bool FilePersonaRoster::startWatching(std::string* why) {
     watcher_ = FileWatcher::watchDirectory(
         PathParent(listFile_),
         [this, name](const std::string& changed) {
-            if (changed == name) notifyObservers();
+            // An empty name: the directory itself went or events were lost.
+            if (changed.empty() || changed == name) notifyObservers();
         },
         why);
     return watcher_ != nullptr;
