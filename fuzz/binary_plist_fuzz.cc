@@ -44,7 +44,8 @@ bool same(const tarn::PlistValue& a, const tarn::PlistValue& b) {
                 if (i->first != j->first || !same(i->second, j->second)) return false;
             return true;
         }
-        default: return a == b;
+        default:
+            return a == b;
     }
 }
 

@@ -15,11 +15,11 @@ namespace {
 // Same type and same bits (NaN included), recursively. With `anyDate`, dates
 // the two readers read differently on purpose (negative, clamped, not finite)
 // pass.
-::testing::AssertionResult identical(const PlistValue& a, const PlistValue& b,
-                                     bool anyDate = false, const std::string& at = "root") {
+::testing::AssertionResult identical(const PlistValue& a, const PlistValue& b, bool anyDate = false,
+                                     const std::string& at = "root") {
     if (a.type() != b.type())
-        return ::testing::AssertionFailure() << at << ": types differ: " << a.description()
-                                             << " vs " << b.description();
+        return ::testing::AssertionFailure()
+               << at << ": types differ: " << a.description() << " vs " << b.description();
     bool same = true;
     switch (a.type()) {
         case PlistValue::Type::Real: {
@@ -29,7 +29,8 @@ namespace {
         }
         case PlistValue::Type::Array: {
             const auto &x = *a.asArray(), &y = *b.asArray();
-            if (x.size() != y.size()) return ::testing::AssertionFailure() << at << ": sizes differ";
+            if (x.size() != y.size())
+                return ::testing::AssertionFailure() << at << ": sizes differ";
             for (size_t i = 0; i < x.size(); ++i) {
                 auto r = identical(x[i], y[i], anyDate, at + "[" + std::to_string(i) + "]");
                 if (!r) return r;
@@ -38,11 +39,12 @@ namespace {
         }
         case PlistValue::Type::Dict: {
             const auto &x = *a.asDict(), &y = *b.asDict();
-            if (x.size() != y.size()) return ::testing::AssertionFailure() << at << ": sizes differ";
+            if (x.size() != y.size())
+                return ::testing::AssertionFailure() << at << ": sizes differ";
             for (auto i = x.begin(), j = y.begin(); i != x.end(); ++i, ++j) {
                 if (i->first != j->first)
-                    return ::testing::AssertionFailure() << at << ": keys differ: " << i->first
-                                                         << " vs " << j->first;
+                    return ::testing::AssertionFailure()
+                           << at << ": keys differ: " << i->first << " vs " << j->first;
                 auto r = identical(i->second, j->second, anyDate, at + "." + i->first);
                 if (!r) return r;
             }
@@ -53,11 +55,12 @@ namespace {
             same = x == y || (anyDate && (x < 0 || x >= INT32_MAX || y < 0 || y >= INT32_MAX));
             break;
         }
-        default: same = a == b;
+        default:
+            same = a == b;
     }
     if (same) return ::testing::AssertionSuccess();
-    return ::testing::AssertionFailure() << at << ": " << a.description() << " vs "
-                                         << b.description();
+    return ::testing::AssertionFailure()
+           << at << ": " << a.description() << " vs " << b.description();
 }
 
 // Both readers on the same bytes.
@@ -93,7 +96,8 @@ struct Bplist {
         }
         const uint64_t table = out.size();
         for (uint64_t off : offsets)
-            for (int i = offsetSize - 1; i >= 0; --i) out.push_back(static_cast<uint8_t>(off >> (8 * i)));
+            for (int i = offsetSize - 1; i >= 0; --i)
+                out.push_back(static_cast<uint8_t>(off >> (8 * i)));
         std::vector<uint8_t> trailer(32, 0);
         trailer[6] = offsetSize;
         trailer[7] = refSize;
@@ -136,7 +140,8 @@ std::vector<uint8_t> real8(uint8_t marker, double d) {
 Bplist nestedArrays(int n) {
     Bplist b;
     b.offsetSize = b.refSize = 2;
-    for (int i = 1; i < n; ++i) b.add({0xA1, static_cast<uint8_t>(i >> 8), static_cast<uint8_t>(i)});
+    for (int i = 1; i < n; ++i)
+        b.add({0xA1, static_cast<uint8_t>(i >> 8), static_cast<uint8_t>(i)});
     b.add({0xA0});
     return b;
 }
@@ -145,16 +150,34 @@ Bplist nestedArrays(int n) {
 std::vector<PlistValue> corpus() {
     std::vector<PlistValue> out;
     const std::vector<PlistValue> leaves = {
-        PlistValue(true), PlistValue(false), PlistValue(uint64_t{0}), PlistValue(uint64_t{255}),
-        PlistValue(uint64_t{256}), PlistValue(uint64_t{65536}), PlistValue(uint64_t{1} << 32),
-        PlistValue(uint64_t{INT64_MAX}), PlistValue(UINT64_MAX), PlistValue(int64_t{-1}),
-        PlistValue(INT64_MIN), PlistValue(0.0), PlistValue(-0.0), PlistValue(1.5e300),
-        PlistValue(-3.25), PlistValue(std::nan("")), PlistValue(PlistDate{0}),
-        PlistValue(PlistDate{694224000.123456}), PlistValue(PlistDate{2147483647}),
-        PlistValue(""), PlistValue("ascii"), PlistValue(std::string(300, 'x')),
-        PlistValue("caf\xc3\xa9 \xe6\x97\xa5\xe6\x9c\xac"), PlistValue("\xf0\x9f\x93\xa6 box"),
-        PlistValue("\xef\xbf\xbd\xef\xbf\xbf"), PlistValue(PlistData{}),
-        PlistValue(PlistData{0, 1, 2, 255}), PlistValue(PlistData(5000, 0xAB)),
+        PlistValue(true),
+        PlistValue(false),
+        PlistValue(uint64_t{0}),
+        PlistValue(uint64_t{255}),
+        PlistValue(uint64_t{256}),
+        PlistValue(uint64_t{65536}),
+        PlistValue(uint64_t{1} << 32),
+        PlistValue(uint64_t{INT64_MAX}),
+        PlistValue(UINT64_MAX),
+        PlistValue(int64_t{-1}),
+        PlistValue(INT64_MIN),
+        PlistValue(0.0),
+        PlistValue(-0.0),
+        PlistValue(1.5e300),
+        PlistValue(-3.25),
+        PlistValue(std::nan("")),
+        PlistValue(PlistDate{0}),
+        PlistValue(PlistDate{694224000.123456}),
+        PlistValue(PlistDate{2147483647}),
+        PlistValue(""),
+        PlistValue("ascii"),
+        PlistValue(std::string(300, 'x')),
+        PlistValue("caf\xc3\xa9 \xe6\x97\xa5\xe6\x9c\xac"),
+        PlistValue("\xf0\x9f\x93\xa6 box"),
+        PlistValue("\xef\xbf\xbd\xef\xbf\xbf"),
+        PlistValue(PlistData{}),
+        PlistValue(PlistData{0, 1, 2, 255}),
+        PlistValue(PlistData(5000, 0xAB)),
         PlistValue(*Uuid::parse("12345678-9ABC-DEF0-1234-56789ABCDEF0"))};
     for (const auto& v : leaves) out.push_back(v);
     out.emplace_back(PlistArray(leaves));
@@ -195,15 +218,15 @@ TEST(BinaryPlist, ReadsFormsTheWriterNeverUses) {
     // real, a 16-byte integer, a repeated key, a shared leaf.
     Bplist b;
     b.root = b.add(container(0xD0, {1, 2, 3, 4, 5, 1, 6, 7, 8, 9, 10, 11}, 6));
-    b.add(ascii("k"));                                                    // 1
-    b.add(ascii("s"));                                                    // 2
-    b.add(ascii("u"));                                                    // 3
-    b.add(ascii("f"));                                                    // 4
-    b.add(ascii("i"));                                                    // 5
-    b.add(utf16({u'h', 0xE9, 0xD83D, 0xDCE6}));                           // 6
-    b.add(container(0xC0, {9, 9}, 2));                                    // 7
-    b.add({0x81, 0x01, 0x00});                                            // 8: uid 256
-    b.add({0x22, 0x3F, 0xC0, 0x00, 0x00});                                // 9: 1.5f
+    b.add(ascii("k"));                                                     // 1
+    b.add(ascii("s"));                                                     // 2
+    b.add(ascii("u"));                                                     // 3
+    b.add(ascii("f"));                                                     // 4
+    b.add(ascii("i"));                                                     // 5
+    b.add(utf16({u'h', 0xE9, 0xD83D, 0xDCE6}));                            // 6
+    b.add(container(0xC0, {9, 9}, 2));                                     // 7
+    b.add({0x81, 0x01, 0x00});                                             // 8: uid 256
+    b.add({0x22, 0x3F, 0xC0, 0x00, 0x00});                                 // 9: 1.5f
     b.add({0x14, 0, 0, 0, 0, 0, 0, 0, 1, 0, 0, 0, 0, 0, 0, 0, 42});        // 10
     b.add({0x5A, 'c', 'a', 'f', 0xC3, 0xA9, ' ', 0xE2, 0x82, 0xAC, '!'});  // 11
     Both r = readBoth(b.bytes());
@@ -219,9 +242,15 @@ TEST(BinaryPlist, ReadsFormsTheWriterNeverUses) {
 TEST(BinaryPlist, ReadsDatesWithTheirSignAndClampsThem) {
     // The library loses the sign of the fraction of a negative date; the
     // direct reader keeps it. Out-of-range seconds clamp, non-finite is 0.
-    const std::vector<std::pair<double, double>> cases = {
-        {-1.5, -1.5}, {-0.25, -0.25}, {12.25, 12.25}, {12.0000004, 12}, {1e12, INT32_MAX},
-        {-1e12, INT32_MIN}, {2147483647.5, 2147483647.5}, {INFINITY, 0}, {NAN, 0}};
+    const std::vector<std::pair<double, double>> cases = {{-1.5, -1.5},
+                                                          {-0.25, -0.25},
+                                                          {12.25, 12.25},
+                                                          {12.0000004, 12},
+                                                          {1e12, INT32_MAX},
+                                                          {-1e12, INT32_MIN},
+                                                          {2147483647.5, 2147483647.5},
+                                                          {INFINITY, 0},
+                                                          {NAN, 0}};
     for (auto [stored, expected] : cases) {
         Bplist b;
         b.add(real8(0x33, stored));
