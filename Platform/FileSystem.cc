@@ -206,31 +206,27 @@ int FsMkdir(const std::string& path, mode_t mode) {
 
 int FsMakePath(const std::string& path, mode_t mode) {
     if (path.empty()) return ENOENT;
-    // Walk down from the root; each missing component is made with `mode`.
-    std::string cur;
-    size_t i = 0;
-    if (path[0] == '/') {
-        cur = "/";
-        i = 1;
-    }
-    while (i <= path.size()) {
-        size_t j = path.find('/', i);
-        if (j == std::string::npos) j = path.size();
-        if (j > i) {
-            if (!cur.empty() && cur.back() != '/') cur += '/';
-            cur.append(path, i, j - i);
-            if (::mkdir(cur.c_str(), mode) != 0) {
-                int err = errno;
-                if (err != EEXIST) return err;
-                struct stat s;
-                // An existing non-directory in the way is an error (like mkdir -p).
-                if (::stat(cur.c_str(), &s) != 0) return errnoOr(EIO);
-                if (!S_ISDIR(s.st_mode)) return j >= path.size() ? EEXIST : ENOTDIR;
-            }
+    // Leaf first: the parents nearly always exist, so one mkdir usually
+    // settles it; only a missing parent sends us up the path (like mkdir -p,
+    // each missing component is made with `mode`).
+    if (::mkdir(path.c_str(), mode) == 0) return 0;
+    int err = errno;
+    if (err == ENOENT) {
+        size_t end = path.find_last_not_of('/');
+        size_t slash = end == std::string::npos ? std::string::npos : path.rfind('/', end);
+        if (slash == std::string::npos) return ENOENT;
+        const std::string parent = path.substr(0, slash == 0 ? 1 : slash);
+        if (parent != path) {
+            if (int perr = FsMakePath(parent, mode); perr != 0) return perr;
         }
-        i = j + 1;
+        if (::mkdir(path.c_str(), mode) == 0) return 0;
+        err = errno;
     }
-    return 0;
+    if (err != EEXIST) return err;
+    // An existing directory is success; anything else in the way is not.
+    struct stat s;
+    if (::stat(path.c_str(), &s) != 0) return errnoOr(EIO);
+    return S_ISDIR(s.st_mode) ? 0 : ENOTDIR;
 }
 
 int FsMkdtemp(std::string* pathTemplate) {

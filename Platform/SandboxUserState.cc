@@ -248,7 +248,9 @@ int FileSandboxUserState::_lock_writeSnapshot(uint32_t uid) {
 int FileSandboxUserState::_lock_recordChanges(uint32_t uid, const std::vector<Change>& changes) {
     constexpr size_t kMinJournalRecords = 256;
     size_t& records = journalRecords_[uid];
-    if (records + changes.size() > std::max(kMinJournalRecords, tables_[uid].size()))
+    // Many changes at once (a class rebuild) cost less as one snapshot.
+    if (changes.size() > kMinJournalRecords ||
+        records + changes.size() > std::max(kMinJournalRecords, tables_[uid].size()))
         return _lock_writeSnapshot(uid);
     std::vector<uint8_t> bytes;
     for (const auto& [key, path] : changes)
