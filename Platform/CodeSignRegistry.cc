@@ -18,7 +18,12 @@ namespace tarn {
 struct CodeSignRegistry::Impl {
     std::mutex mu;
     std::map<std::string, std::shared_ptr<const CodeSignInfo>> byPath;  // guarded by mu
-    std::atomic<bool> stale{true};
+    // Bumped by every change the watcher reports; `loaded` is the count the
+    // map reflects. A reader that sees them differ waits for the one load in
+    // progress instead of reading the map that load is about to replace.
+    std::atomic<uint64_t> changes{1};
+    std::atomic<uint64_t> loaded{0};
+    std::mutex loadMu;
     std::mutex watchMu;
     std::string watchedDir;                // guarded by watchMu
     std::unique_ptr<FileWatcher> watcher;  // guarded by watchMu
@@ -33,9 +38,18 @@ struct CodeSignRegistry::Impl {
         // The callback only marks the registry stale, so stopping here
         // cannot wait on anything this thread holds.
         if (watcher) watcher->stop();
-        watcher = FileWatcher::watchDirectory(d, [this](const std::string&) { stale = true; });
+        watcher = FileWatcher::watchDirectory(d, [this](const std::string&) { ++changes; });
         watchedDir = d;
-        stale = true;
+        ++changes;
+    }
+
+    void loadIfChanged(bool always) {
+        if (!always && loaded.load() == changes.load()) return;
+        std::lock_guard lock(loadMu);
+        const uint64_t seen = changes.load();
+        if (!always && loaded.load() == seen) return;  // another thread loaded it meanwhile
+        load();
+        loaded = seen;
     }
 
     static std::string realOrSelf(const std::string& p) {
@@ -86,7 +100,7 @@ CodeSignRegistry& CodeSignRegistry::shared() {
 
 std::shared_ptr<const CodeSignInfo> CodeSignRegistry::infoForExecutable(const std::string& realPath) {
     impl_->ensureWatching();
-    if (impl_->stale.exchange(false)) impl_->load();
+    impl_->loadIfChanged(false);
     std::lock_guard lock(impl_->mu);
     auto it = impl_->byPath.find(realPath);
     return it == impl_->byPath.end() ? nullptr : it->second;
@@ -94,8 +108,7 @@ std::shared_ptr<const CodeSignInfo> CodeSignRegistry::infoForExecutable(const st
 
 void CodeSignRegistry::reload() {
     impl_->ensureWatching();
-    impl_->stale = false;
-    impl_->load();
+    impl_->loadIfChanged(true);
 }
 
 }  // namespace tarn

@@ -3,6 +3,7 @@
 // exits: the watchers must neither crash nor go deaf.
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <cstdlib>
@@ -11,6 +12,7 @@
 #include <set>
 #include <string>
 #include <thread>
+#include <vector>
 
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/CodeSignRegistry.h"
@@ -170,6 +172,24 @@ TEST_F(FileWatcherTeardownTest, PersonaRosterFollowsARemovedAndRecreatedList) {
     std::thread remover([&] { fs::remove_all(root_.at("/etc")); });
     roster.reset();
     remover.join();
+}
+
+TEST_F(FileWatcherTeardownTest, CodeSignRegistryReadersWaitForTheLoadInProgress) {
+    // A new root means a new registry to read; every one of several
+    // concurrent first readers must see it, not the map being replaced.
+    root_.writeFile("/usr/bin/tool", "");
+    root_.writeFile("/etc/tarnkeeper/codesign/tool.plist",
+                    bytesOf(PlistValue(PlistDict{{"Executable", PlistValue("/usr/bin/tool")},
+                                                 {"SigningIdentifier", PlistValue("com.tool")}})));
+    const std::string exe = fs::canonical(root_.at("/usr/bin/tool")).string();
+    std::atomic<int> found{0};
+    std::vector<std::thread> readers;
+    for (int i = 0; i < 8; ++i)
+        readers.emplace_back([&] {
+            if (CodeSignRegistry::shared().infoForExecutable(exe)) ++found;
+        });
+    for (auto& t : readers) t.join();
+    EXPECT_EQ(found.load(), 8);
 }
 
 TEST_F(FileWatcherTeardownTest, CodeSignRegistryReloadsARecreatedDirectory) {
