@@ -28,39 +28,16 @@
 #include "Platform/ConduitHarness.h"
 #include "Platform/ConduitWire.h"
 #include "Platform/PlatformLog.h"
+#include "bench/BenchSupport.h"
 
 using namespace tarn;
 using namespace tarn::conduit;
+using tarn::bench::makeScratchRoot;
+using tarn::bench::medianUs;
 using Clock = std::chrono::steady_clock;
 using namespace std::chrono_literals;
 
 namespace {
-
-std::string makeScratchRoot() {
-    const char* tmp = std::getenv("TMPDIR");
-    std::string tmpl = std::string(tmp && *tmp ? tmp : "/tmp") + "/tarn-bench-XXXXXX";
-    if (!::mkdtemp(tmpl.data())) return {};
-    namespace fs = std::filesystem;
-    fs::create_directories(tmpl + "/etc");
-    fs::create_directories(tmpl + "/private/var/mobile");
-    fs::create_directories(tmpl + "/private/var/root");
-    std::ofstream(tmpl + "/etc/passwd") << "root:x:0:0:root:/private/var/root:/bin/sh\n"
-                                           "_installd:x:33:33:installd:/private/var/installd:/bin/false\n"
-                                           "mobile:x:501:501:Mobile User:/private/var/mobile:/bin/sh\n";
-    std::ofstream(tmpl + "/etc/group") << "wheel:x:0:\nmobile:x:501:\nsystemusers:x:1020:\n";
-    // The daemon answers command 27 only to a client entitled to it.
-    fs::create_directories(tmpl + "/etc/tarnkeeper/codesign");
-    PlistDict entitlements;
-    entitlements["com.ostrea.private.TarnKeeper.allowed"] = PlistValue(true);
-    PlistDict entry;
-    entry["Executable"] = PlistValue(harness::SelfExecutablePath());
-    entry["SigningIdentifier"] = PlistValue("com.ostrea.tarnkeeperd.bench");
-    entry["Entitlements"] = PlistValue(std::move(entitlements));
-    const auto bytes = PlistValue(std::move(entry)).toBinary();
-    std::ofstream(tmpl + "/etc/tarnkeeper/codesign/bench.plist", std::ios::binary)
-        .write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
-    return tmpl;
-}
 
 PlistValue command27() {
     PlistDict d;
@@ -77,12 +54,6 @@ bool daemonAnswers(Client& client, std::string* why) {
         return false;
     }
     return true;
-}
-
-double medianUs(std::vector<double> v) {
-    if (v.empty()) return 0;
-    std::sort(v.begin(), v.end());
-    return v[v.size() / 2];
 }
 
 struct Result {

@@ -23,9 +23,7 @@ constexpr const char* kEnterprise = "ENTERPRISE-0001";
 class ContainerCommandsTest : public test::ScratchRootTest {
   protected:
     void SetUp() override {
-        if (!fs::exists(test::BuiltBinary("tarnkeeperd")) ||
-            !fs::exists(test::BuiltBinary("tarnctl")))
-            GTEST_SKIP() << "tarnkeeperd and tarnctl are not built";
+        TARN_REQUIRE_DAEMON_BINARIES();
         TARN_REQUIRE_ROOT();
         daemon_ = std::make_unique<DaemonHarness>(root_);
         admin_ = daemon_->addPrivilegedClient();

@@ -32,9 +32,7 @@ constexpr int kWorkers = 3;
 class CreateDeleteCrashTest : public test::ScratchRootTest {
   protected:
     void SetUp() override {
-        if (!fs::exists(test::BuiltBinary("tarnkeeperd")) ||
-            !fs::exists(test::BuiltBinary("tarnctl")))
-            GTEST_SKIP() << "tarnkeeperd and tarnctl are not built";
+        TARN_REQUIRE_DAEMON_BINARIES();
         TARN_REQUIRE_ROOT();
         TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
         // Arm this process's failpoints now, so that the variable set for the

@@ -21,9 +21,7 @@ using test::DaemonHarness;
 class DaemonSpineTest : public test::ScratchRootTest {
 protected:
     void SetUp() override {
-        if (!std::filesystem::exists(test::BuiltBinary("tarnkeeperd")) ||
-            !std::filesystem::exists(test::BuiltBinary("tarnctl")))
-            GTEST_SKIP() << "tarnkeeperd and tarnctl are not built";
+        TARN_REQUIRE_DAEMON_BINARIES();
         daemon_ = std::make_unique<DaemonHarness>(root_);
         admin_ = daemon_->addPrivilegedClient();
         guest_ = daemon_->addClient("guest", "com.ostrea.test.guest", PlistValue(PlistDict{}));
@@ -135,9 +133,7 @@ namespace {
 class DaemonCommandsTest : public test::ScratchRootTest {
 protected:
     void SetUp() override {
-        if (!std::filesystem::exists(test::BuiltBinary("tarnkeeperd")) ||
-            !std::filesystem::exists(test::BuiltBinary("tarnctl")))
-            GTEST_SKIP() << "tarnkeeperd and tarnctl are not built";
+        TARN_REQUIRE_DAEMON_BINARIES();
         daemon_ = std::make_unique<test::DaemonHarness>(root_);
         admin_ = daemon_->addPrivilegedClient();
         PlistValue allowedOnly{PlistDict{}};

@@ -29,9 +29,7 @@ struct Container {
 class PerContainerCommandsTest : public test::ScratchRootTest {
   protected:
     void SetUp() override {
-        if (!fs::exists(test::BuiltBinary("tarnkeeperd")) ||
-            !fs::exists(test::BuiltBinary("tarnctl")))
-            GTEST_SKIP() << "tarnkeeperd and tarnctl are not built";
+        TARN_REQUIRE_DAEMON_BINARIES();
         daemon_ = std::make_unique<test::DaemonHarness>(root_);
         admin_ = daemon_->addPrivilegedClient();
     }

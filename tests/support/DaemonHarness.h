@@ -6,6 +6,7 @@
 #include <sys/types.h>
 
 #include <chrono>
+#include <filesystem>
 #include <optional>
 #include <string>
 #include <vector>
@@ -74,3 +75,12 @@ private:
 };
 
 }  // namespace tarn::test
+
+// Skips the test unless the daemon and tarnctl it drives have been built.
+#define TARN_REQUIRE_DAEMON_BINARIES()                                                    \
+    do {                                                                                  \
+        if (!std::filesystem::exists(::tarn::test::BuiltBinary("tarnkeeperd")) ||          \
+            !std::filesystem::exists(::tarn::test::BuiltBinary("tarnctl")))                \
+            GTEST_SKIP() << "tarnkeeperd and tarnctl are not built";                     \
+    } while (0)
+

@@ -1,0 +1,50 @@
+// Shared by the benchmarks that drive a real tarnkeeperd: a scratch root the
+// daemon can run under, with this benchmark registered as a fully entitled
+// client, and the median of a set of latencies.
+#pragma once
+
+#include <stdlib.h>
+
+#include <algorithm>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <string>
+#include <vector>
+
+#include "Platform/ConduitHarness.h"
+#include "Platform/PropertyList.h"
+
+namespace tarn::bench {
+
+inline std::string makeScratchRoot() {
+    const char* tmp = std::getenv("TMPDIR");
+    std::string tmpl = std::string(tmp && *tmp ? tmp : "/tmp") + "/tarn-bench-XXXXXX";
+    if (!::mkdtemp(tmpl.data())) return {};
+    namespace fs = std::filesystem;
+    fs::create_directories(tmpl + "/etc/tarnkeeper/codesign");
+    fs::create_directories(tmpl + "/private/var/mobile");
+    fs::create_directories(tmpl + "/private/var/root");
+    std::ofstream(tmpl + "/etc/passwd") << "root:x:0:0:root:/private/var/root:/bin/sh\n"
+                                           "_installd:x:33:33:installd:/private/var/installd:/bin/false\n"
+                                           "mobile:x:501:501:Mobile User:/private/var/mobile:/bin/sh\n";
+    std::ofstream(tmpl + "/etc/group") << "wheel:x:0:\nmobile:x:501:\nsystemusers:x:1020:\n";
+    PlistDict entitlements;
+    entitlements["com.ostrea.private.TarnKeeper.allowed"] = PlistValue(true);
+    PlistDict entry;
+    entry["Executable"] = PlistValue(conduit::harness::SelfExecutablePath());
+    entry["SigningIdentifier"] = PlistValue("com.ostrea.tarnkeeperd.bench");
+    entry["Entitlements"] = PlistValue(std::move(entitlements));
+    const auto bytes = PlistValue(std::move(entry)).toBinary();
+    std::ofstream(tmpl + "/etc/tarnkeeper/codesign/bench.plist", std::ios::binary)
+        .write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
+    return tmpl;
+}
+
+inline double medianUs(std::vector<double> v) {
+    if (v.empty()) return 0;
+    std::sort(v.begin(), v.end());
+    return v[v.size() / 2];
+}
+
+}  // namespace tarn::bench
