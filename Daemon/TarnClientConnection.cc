@@ -599,6 +599,7 @@ TarnMetadataRef TarnClientConnection::createOrLookupContainerWithContainerIdenti
     if (!result) TarnSetError(error, TarnErrorCodeOf(failure, TarnErrorInvalidArgument));
     return result;
 }
+
 std::optional<std::vector<TarnMetadataRef>> TarnClientConnection::containersWithClass(
     TarnContainerClass containerClass, bool transient, uint64_t* error) {
     if (!TarnContainerClassIsValid(containerClass)) {
