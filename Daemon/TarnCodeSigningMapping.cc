@@ -6,6 +6,7 @@
 #include <iterator>
 #include <mutex>
 #include <system_error>
+#include <vector>
 
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnSQLiteDB.h"
@@ -57,7 +58,11 @@ TarnCodeSigningMapping* TarnCodeSigningMapping::sharedInstance() {
 }
 
 void TarnCodeSigningMapping::TEST_setSharedInstance(std::unique_ptr<TarnCodeSigningMapping> mapping) {
+    // Kept alive, never freed: the container cache of the root it served holds
+    // it by pointer, and queued work of that cache may still run.
+    static auto& retired = *new std::vector<std::unique_ptr<TarnCodeSigningMapping>>();
     std::lock_guard<std::mutex> lock(gSharedMutex);
+    if (gSharedMapping) retired.push_back(std::move(gSharedMapping));
     gSharedMapping = std::move(mapping);
 }
 

@@ -75,6 +75,7 @@ public:
     // tries again).
     static TarnCodeSigningMapping* sharedInstance();
     // Tests: replaces the shared instance (empty: the next call makes a new one).
+    // The one replaced stays alive for the rest of the process.
     static void TEST_setSharedInstance(std::unique_ptr<TarnCodeSigningMapping> mapping);
 
     // initWithUserIdentityCache:queue:mappingDB: imports the legacy mapping
