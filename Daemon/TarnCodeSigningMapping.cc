@@ -23,7 +23,10 @@ constexpr const char* kLegacyMappingFileName = "tarn_code_signing_info.plist";
 FileURL libraryDirectoryURL() { return TarnGlobalConfiguration::sharedInstance().libraryDirectory(); }
 
 std::mutex gSharedMutex;
-std::unique_ptr<TarnCodeSigningMapping> gSharedMapping;
+// Never destroyed: the container cache holds the mapping by pointer, and its
+// queued work (persona-list changes) may still run while the process exits.
+std::unique_ptr<TarnCodeSigningMapping>& gSharedMapping =
+    *new std::unique_ptr<TarnCodeSigningMapping>();
 
 const std::optional<PlistDict> kNoInfo;
 
@@ -58,8 +61,7 @@ TarnCodeSigningMapping* TarnCodeSigningMapping::sharedInstance() {
 }
 
 void TarnCodeSigningMapping::TEST_setSharedInstance(std::unique_ptr<TarnCodeSigningMapping> mapping) {
-    // Kept alive, never freed: the container cache of the root it served holds
-    // it by pointer, and queued work of that cache may still run.
+    // Kept alive for the same reason as the shared one.
     static auto& retired = *new std::vector<std::unique_ptr<TarnCodeSigningMapping>>();
     std::lock_guard<std::mutex> lock(gSharedMutex);
     if (gSharedMapping) retired.push_back(std::move(gSharedMapping));
