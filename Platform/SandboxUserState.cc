@@ -121,6 +121,16 @@ void appendRecord(std::vector<uint8_t>* out, uint64_t type, const std::string& i
 
 }  // namespace
 
+std::vector<const FileSandboxUserState::Table::value_type*> FileSandboxUserState::ordered(
+    const Table& table) {
+    std::vector<const Table::value_type*> entries;
+    entries.reserve(table.size());
+    for (const auto& entry : table) entries.push_back(&entry);
+    std::sort(entries.begin(), entries.end(),
+              [](const auto* a, const auto* b) { return view(a->first) < view(b->first); });
+    return entries;
+}
+
 FileSandboxUserState::Table& FileSandboxUserState::_lock_tableForUID(uint32_t uid) {
     auto it = tables_.find(uid);
     if (it != tables_.end()) return it->second;
@@ -213,7 +223,8 @@ int FileSandboxUserState::_lock_writeSnapshot(uint32_t uid) {
     const Table& table = tables_[uid];
     PlistArray items;
     items.reserve(table.size());
-    for (const auto& [key, path] : table) {
+    for (const auto* entry : ordered(table)) {
+        const auto& [key, path] = *entry;
         items.push_back(PlistValue(PlistDict{
             {"Type", PlistValue(std::get<0>(key))},
             {"Identifier", PlistValue(std::get<1>(key))},
@@ -295,15 +306,29 @@ int FileSandboxUserState::setUserStateItemWithPersona(uint32_t uid, uint32_t per
     return err;
 }
 
+bool FileSandboxUserState::userStateItemIsRecordedWithPersona(uint32_t uid, uint32_t personaID,
+                                                              uint64_t itemType,
+                                                              const char* identifier,
+                                                              const char* path) {
+    if (!identifier || !*identifier) return false;
+    MutexLock lock(mu_);
+    const Table& table = _lock_tableForUID(uid);
+    auto it = table.find(KeyView{itemType, identifier, personaID});
+    if (it == table.end()) return path == nullptr;
+    return path && it->second == path;
+}
+
 int FileSandboxUserState::iterateUserStateItems(uint32_t uid, const ItemCallback& callback) {
     std::vector<std::pair<uint64_t, SandboxUserStateItem>> snapshot;
     {
         MutexLock lock(mu_);
         const Table& table = _lock_tableForUID(uid);
         snapshot.reserve(table.size());
-        for (const auto& [key, path] : table)
+        for (const auto* entry : ordered(table)) {
+            const auto& [key, path] = *entry;
             snapshot.emplace_back(std::get<0>(key),
                                   SandboxUserStateItem{std::get<1>(key), path, std::get<2>(key)});
+        }
     }
     for (const auto& [type, item] : snapshot) callback(type, &item);
     return 0;

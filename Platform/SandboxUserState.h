@@ -43,7 +43,9 @@
 #include <optional>
 #include <set>
 #include <string>
+#include <string_view>
 #include <tuple>
+#include <unordered_map>
 #include <utility>
 #include <vector>
 
@@ -82,6 +84,14 @@ class SandboxUserState {
     // otherwise an errno value; an empty identifier is EINVAL.
     virtual int setUserStateItemWithPersona(uint32_t uid, uint32_t personaID, uint64_t itemType,
                                             const char* identifier, const char* path) = 0;
+    // Whether the item is recorded with exactly `path`: a push that would
+    // change nothing can then be skipped. False when unknown.
+    virtual bool userStateItemIsRecordedWithPersona(uint32_t uid, uint32_t personaID,
+                                                    uint64_t itemType, const char* identifier,
+                                                    const char* path) {
+        (void)uid, (void)personaID, (void)itemType, (void)identifier, (void)path;
+        return false;
+    }
     // Calls `callback` for each item of `uid`. 0 on success, an errno value
     // when the state cannot be read.
     virtual int iterateUserStateItems(uint32_t uid, const ItemCallback& callback) = 0;
@@ -111,6 +121,8 @@ class FileSandboxUserState : public SandboxUserState {
 
     int setUserStateItemWithPersona(uint32_t uid, uint32_t personaID, uint64_t itemType,
                                     const char* identifier, const char* path) override;
+    bool userStateItemIsRecordedWithPersona(uint32_t uid, uint32_t personaID, uint64_t itemType,
+                                            const char* identifier, const char* path) override;
     int iterateUserStateItems(uint32_t uid, const ItemCallback& callback) override;
     void beginBatch() override;
     int endBatch() override;
@@ -121,7 +133,31 @@ class FileSandboxUserState : public SandboxUserState {
 
   private:
     using Key = std::tuple<uint64_t, std::string, uint32_t>;  // type, identifier, persona
-    using Table = std::map<Key, std::string>;                 // -> path
+    using KeyView = std::tuple<uint64_t, std::string_view, uint32_t>;
+    static KeyView view(const Key& k) { return {std::get<0>(k), std::get<1>(k), std::get<2>(k)}; }
+    static const KeyView& view(const KeyView& k) { return k; }
+    // Hashed, with look-ups by view, so that the check of every push of a
+    // rebuild costs one hash and no string copy; ordered only when iterated
+    // or written.
+    struct KeyHash {
+        using is_transparent = void;
+        template <class K>
+        size_t operator()(const K& k) const {
+            const KeyView& v = view(k);
+            return std::hash<std::string_view>()(std::get<1>(v)) ^
+                   (std::get<0>(v) * 0x9E3779B97F4A7C15ull) ^ (size_t{std::get<2>(v)} << 1);
+        }
+    };
+    struct KeyEqual {
+        using is_transparent = void;
+        template <class A, class B>
+        bool operator()(const A& a, const B& b) const {
+            return view(a) == view(b);
+        }
+    };
+    using Table = std::unordered_map<Key, std::string, KeyHash, KeyEqual>;  // -> path
+    // The table's entries in (type, identifier, persona) order.
+    static std::vector<const Table::value_type*> ordered(const Table& table);
 
     // One change: the item's path, or none for a removal.
     using Change = std::pair<Key, std::optional<std::string>>;

@@ -55,6 +55,44 @@ TEST_F(SandboxUserStateTest, ItemsSurviveANewInstanceAndClearsAreDurable) {
     EXPECT_TRUE(fs::exists(dir())) << "state lives below the root's run directory";
 }
 
+TEST_F(SandboxUserStateTest, RecordedItemsAreRecognisedAndIterationStaysOrdered) {
+    FileSandboxUserState state(dir());
+    // Set out of order: the table is hashed, iteration must still be ordered.
+    for (const char* id : {"com.z", "com.a", "com.m"})
+        ASSERT_EQ(state.setUserStateItemWithPersona(501, 501, 1, id, "/c/x"), 0);
+    ASSERT_EQ(state.setUserStateItemWithPersona(501, 7, 1, "com.a", "/e/a"), 0);
+    ASSERT_EQ(state.setUserStateItemWithPersona(501, 501, 2, "com.a", "/g/a"), 0);
+    EXPECT_EQ(items(state, 501),
+              (std::vector<std::string>{"1:com.a:7=/e/a", "1:com.a:501=/c/x", "1:com.m:501=/c/x",
+                                        "1:com.z:501=/c/x", "2:com.a:501=/g/a"}));
+
+    EXPECT_TRUE(state.userStateItemIsRecordedWithPersona(501, 501, 1, "com.a", "/c/x"));
+    EXPECT_FALSE(state.userStateItemIsRecordedWithPersona(501, 501, 1, "com.a", "/c/y"))
+        << "another path";
+    EXPECT_FALSE(state.userStateItemIsRecordedWithPersona(501, 501, 1, "com.a", nullptr))
+        << "present, so not recorded as absent";
+    EXPECT_FALSE(state.userStateItemIsRecordedWithPersona(501, 8, 1, "com.a", "/c/x"))
+        << "another persona";
+    EXPECT_FALSE(state.userStateItemIsRecordedWithPersona(501, 501, 4, "com.a", "/c/x"))
+        << "another type";
+    EXPECT_TRUE(state.userStateItemIsRecordedWithPersona(501, 501, 1, "com.none", nullptr));
+    EXPECT_FALSE(state.userStateItemIsRecordedWithPersona(502, 501, 1, "com.a", "/c/x"))
+        << "another user";
+    EXPECT_FALSE(state.userStateItemIsRecordedWithPersona(501, 501, 1, "", nullptr));
+
+    // The snapshot a big batch writes comes back the same, in order.
+    {
+        SandboxUserState::Batch batch(state);
+        for (int i = 300; i > 0; --i)
+            ASSERT_EQ(state.setUserStateItemWithPersona(
+                          501, 501, 1, ("com.n" + std::to_string(i)).c_str(), "/n"),
+                      0);
+    }
+    FileSandboxUserState restarted(dir());
+    EXPECT_EQ(items(restarted, 501), items(state, 501));
+    EXPECT_TRUE(restarted.userStateItemIsRecordedWithPersona(501, 501, 1, "com.n17", "/n"));
+}
+
 TEST_F(SandboxUserStateTest, ABatchWritesOnceAtItsEnd) {
     FileSandboxUserState state(dir());
     {
