@@ -19,6 +19,8 @@ namespace tarn {
 namespace {
 
 std::atomic<bool> gVerbose{::getenv("TARN_PLATFORM_LOG_VERBOSE") != nullptr};
+// Quiet and no file: no line goes anywhere.
+std::atomic<bool> gSilent{false};
 
 // Lines at Default severity and below reach stderr or journald in batches
 // from a writer thread, at most this long after they were logged: a write per
@@ -85,6 +87,7 @@ void PlatformLogSetFile(const std::string& path) {
     s.file = path.empty() ? nullptr : std::fopen(path.c_str(), "ae");
     if (s.file) std::setvbuf(s.file, nullptr, _IOLBF, 0);
     gVerbose = s.file != nullptr || ::getenv("TARN_PLATFORM_LOG_VERBOSE") != nullptr;
+    gSilent = s.quiet && !s.file;
 }
 
 bool PlatformLogVerbose() { return gVerbose.load(std::memory_order_relaxed); }
@@ -93,6 +96,12 @@ void PlatformLogSetQuiet(bool quiet) {
     auto& s = sink();
     std::lock_guard lock(s.mu);
     s.quiet = quiet;
+    gSilent = s.quiet && !s.file;
+}
+
+bool PlatformLogWanted(PlatformLogType type) {
+    if (type <= PlatformLogType::Info && !PlatformLogVerbose()) return false;
+    return !gSilent.load(std::memory_order_relaxed);
 }
 
 namespace {

@@ -26,6 +26,9 @@ void PlatformLogSetFile(const std::string& path);
 bool PlatformLogVerbose();
 // Silences stderr/journald output (tests and tools); the file, if any, still gets lines.
 void PlatformLogSetQuiet(bool quiet);
+// Whether a line of `type` would reach any sink; when not, PlatformLog does
+// not even format it.
+bool PlatformLogWanted(PlatformLogType type);
 // The file gets every line before this returns. Error and Fault lines reach
 // stderr or journald at once too; lower ones are batched and follow within a
 // few tens of milliseconds (and at exit), always in order.
@@ -36,7 +39,7 @@ void PlatformLogFlush();
 template <class... Args>
 void PlatformLog(const char* category, PlatformLogType type, std::string_view fmt,
                  const Args&... args) {
-    if (type <= PlatformLogType::Info && !PlatformLogVerbose()) return;
+    if (!PlatformLogWanted(type)) return;
     PlatformLogWrite(category, type, Format(fmt, args...));
 }
 
