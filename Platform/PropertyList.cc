@@ -17,13 +17,34 @@ Uuid Uuid::generate() {
     return u;
 }
 
+namespace {
+
+int hexDigit(char c) {
+    if (c >= '0' && c <= '9') return c - '0';
+    if (c >= 'a' && c <= 'f') return c - 'a' + 10;
+    if (c >= 'A' && c <= 'F') return c - 'A' + 10;
+    return -1;
+}
+
+}  // namespace
+
+// The 8-4-4-4-12 form in either case, nothing else: what uuid_parse accepts,
+// without its per-byte strtoul (a class rebuild parses two per container).
 std::optional<Uuid> Uuid::parse(std::string_view text) {
     if (text.size() != 36) return std::nullopt;
-    char buf[37];
-    std::memcpy(buf, text.data(), 36);
-    buf[36] = '\0';
     Uuid u;
-    if (uuid_parse(buf, u.bytes.data()) != 0) return std::nullopt;
+    size_t out = 0;
+    for (size_t i = 0; i < 36;) {
+        if (i == 8 || i == 13 || i == 18 || i == 23) {
+            if (text[i] != '-') return std::nullopt;
+            ++i;
+            continue;
+        }
+        int high = hexDigit(text[i]), low = hexDigit(text[i + 1]);
+        if (high < 0 || low < 0) return std::nullopt;
+        u.bytes[out++] = static_cast<uint8_t>(high << 4 | low);
+        i += 2;
+    }
     return u;
 }
 
@@ -713,7 +734,10 @@ class Reader {
     size_t offsetSize_ = 0;
     size_t refSize_ = 0;
     uint64_t budget_ = 0;
-    uint64_t path_[kMaxDepth + 1] = {};  // object index open at each depth
+    // Object index open at each depth; entries up to the current depth are
+    // written before they are read, so the array is left uninitialised (a
+    // small file would otherwise pay for zeroing all of it).
+    uint64_t path_[kMaxDepth + 1];
     const char* why_ = nullptr;
 };
 
