@@ -103,12 +103,17 @@ std::string TarnContainerCache::_cacheKeyForUserIdentity(const TarnUserIdentityR
 
 bool TarnContainerCache::containerURL(const FileURL& url,
                                       TarnContainerClass isValidForContainerClass) const {
-    const std::string name = PathLastComponent(url);
-    if (Uuid::parse(name)) return true;
+    // The last component without a copy: a rebuild asks this of every entry.
+    std::string_view path = url;
+    while (path.size() > 1 && path.back() == '/') path.remove_suffix(1);
+    if (size_t slash = path.rfind('/'); slash != std::string_view::npos && path.size() > 1)
+        path.remove_prefix(slash + 1);
+    if (Uuid::parse(path)) return true;
     if (isValidForContainerClass == TarnContainerClassSystemData)
-        return TarnWhitelist::sharedWhitelist().systemContainerIdIsWellknown(name);
+        return TarnWhitelist::sharedWhitelist().systemContainerIdIsWellknown(std::string(path));
     if (isValidForContainerClass == TarnContainerClassSystemGroup)
-        return TarnWhitelist::sharedWhitelist().systemGroupContainerIdIsWellknown(name);
+        return TarnWhitelist::sharedWhitelist().systemGroupContainerIdIsWellknown(
+            std::string(path));
     return false;
 }
 
@@ -143,25 +148,48 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
                                 static_cast<int64_t>(contentClass));
         return nullptr;
     }
-    TarnErrorRef listError;
-    auto entries =
-        TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(*directory, &listError);
-    if (!entries) {
-        if (error) *error = listError;
-        return nullptr;
+    // Every metadata file is opened relative to the class directory, held
+    // open, so that the directory's own path is walked once, not once per
+    // container. Should it not open as a directory here (a link, say), the
+    // scan and every read take the full path.
+    auto& fileManager = TarnFileManager::defaultManager();
+    FsFd classDirectory;
+    std::vector<FileURL> entries;
+    if (fileManager.openDirectoryAtURL(*directory, &classDirectory) == 0) {
+        std::string prefix = PathJoin(*directory, "x");  // "<directory>/"
+        prefix.pop_back();
+        const int err =
+            fileManager.forEachNameInDirectory(classDirectory, [&](std::string_view name) {
+                FileURL& entry = entries.emplace_back();
+                entry.reserve(prefix.size() + name.size());
+                entry.append(prefix).append(name);
+            });
+        if (err != 0) classDirectory = FsFd();  // the full listing below reports it
+    }
+    if (!classDirectory) {
+        TarnErrorRef listError;
+        auto listed = fileManager.urlsForItemsInDirectoryAtURL(*directory, &listError);
+        if (!listed) {
+            if (error) *error = listError;
+            return nullptr;
+        }
+        entries = std::move(*listed);
     }
 
     auto dictionary = std::make_shared<TarnContainerClassCache>();
-    dictionary->reserve(entries->size());
+    dictionary->reserve(entries.size());
     // One durable write of the sandbox state for the whole scan, not one per container.
     SandboxUserState::Batch batch(sandboxUserState_);
-    for (const FileURL& entry : *entries) {
+    for (FileURL& entry : entries) {
         if (!containerURL(entry, contentClass)) continue;
-        TarnErrorRef readError;
+        // Not a container of ours when unreadable: the error is of no use here.
         TarnMetadataRef metadata =
-            TarnMetadata::readAndValidateMetadataAtUrl(entry, userIdentity, true, &readError);
-        if (!metadata) continue;  // not a container of ours; the error is of no use here
-        const std::string identifier = metadata->identifier();
+            classDirectory
+                ? TarnMetadata::readAndValidateMetadataInClassDirectory(
+                      classDirectory, std::move(entry), userIdentity, true, nullptr)
+                : TarnMetadata::readAndValidateMetadataAtUrl(entry, userIdentity, true, nullptr);
+        if (!metadata) continue;
+        const std::string& identifier = metadata->identifier();
         (*dictionary)[identifier] = metadata;
         if (populateSandboxCache && !transient &&
             _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier,
@@ -245,11 +273,13 @@ bool TarnContainerCache::_shouldRegister(const TarnUserIdentityRef& userIdentity
             decision = !userIdentity->isEnterprise();
             break;
     }
-    PlatformLog("sandbox", PlatformLogType::Info,
-                "Deciding to register userIdentity: %@, identifier: %@ (%@), containerClass: %llu "
-                "with sandbox: %d because isMulti: %d",
-                userIdentity->shortDescription(), identifier, parent, containerClass, decision,
-                isMulti);
+    // Checked here: the identity's description is made before PlatformLog could look.
+    if (PlatformLogVerbose())
+        PlatformLog("sandbox", PlatformLogType::Info,
+                    "Deciding to register userIdentity: %@, identifier: %@ (%@), containerClass: "
+                    "%llu with sandbox: %d because isMulti: %d",
+                    userIdentity->shortDescription(), identifier, parent, containerClass, decision,
+                    isMulti);
     return decision;
 }
 
@@ -270,27 +300,32 @@ bool TarnContainerCache::setSandboxContainerMappingForUserIdentity(
     const uint64_t itemType = TarnContainerClassSandboxItemType(containerClass);
     const char* path = url ? url->c_str() : "(null)";
 
-    // Clearing first drops any earlier path of this identifier; one batch makes
-    // the pair one durable change.
-    SandboxUserState::Batch batch(sandboxUserState_);
-    int result = sandboxUserState_.setUserStateItemWithPersona(user, persona, itemType,
-                                                               identifier.c_str(), nullptr);
-    if (result != 0) {
-        PlatformLog("sandbox", PlatformLogType::Error,
-                    "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: "
-                    "%llu, path: %s : %d",
-                    user, itemType, identifier, containerClass, path, result);
-        return false;
-    }
-    if (url) {
-        result = sandboxUserState_.setUserStateItemWithPersona(user, persona, itemType,
-                                                               identifier.c_str(), url->c_str());
+    // A push of what is recorded already (a rebuild after a restart) changes
+    // nothing: skip the pair, but still log the push.
+    if (!sandboxUserState_.userStateItemIsRecordedWithPersona(
+            user, persona, itemType, identifier.c_str(), url ? url->c_str() : nullptr)) {
+        // Clearing first drops any earlier path of this identifier; one batch
+        // makes the pair one durable change.
+        SandboxUserState::Batch batch(sandboxUserState_);
+        int result = sandboxUserState_.setUserStateItemWithPersona(user, persona, itemType,
+                                                                   identifier.c_str(), nullptr);
         if (result != 0) {
             PlatformLog("sandbox", PlatformLogType::Error,
-                        "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: "
-                        "%llu, path: %s : %d",
+                        "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, "
+                        "class: %llu, path: %s : %d",
                         user, itemType, identifier, containerClass, path, result);
             return false;
+        }
+        if (url) {
+            result = sandboxUserState_.setUserStateItemWithPersona(
+                user, persona, itemType, identifier.c_str(), url->c_str());
+            if (result != 0) {
+                PlatformLog("sandbox", PlatformLogType::Error,
+                            "Failed to set mapping for user: %u, itemType: %llu, identifier %s, "
+                            "class: %llu, path: %s : %d",
+                            user, itemType, identifier, containerClass, path, result);
+                return false;
+            }
         }
     }
     PlatformLog(

@@ -542,6 +542,24 @@ std::optional<std::string> TarnFileManager::readDataAtURL(const FileURL& url, si
     return out;
 }
 
+int TarnFileManager::readDataInDirectory(const FsFd& directory, const std::string& relativePath,
+                                         size_t maxBytes, std::string* data) {
+    if (!directory) return EBADF;
+    return FsReadFileAt(directory.get(), relativePath, maxBytes, data);
+}
+
+int TarnFileManager::openDirectoryAtURL(const FileURL& url, FsFd* directory) {
+    return FsOpenDirectory(url, directory);
+}
+
+int TarnFileManager::forEachNameInDirectory(const FsFd& directory,
+                                            const std::function<void(std::string_view)>& each) {
+    if (!directory) return EBADF;
+    return FsForEachNameAt(directory.get(), [&each](std::string_view name) {
+        if (!name.empty() && name[0] != '.') each(name);
+    });
+}
+
 // ---- Listing and traversal ----
 
 std::optional<std::vector<FileURL>> TarnFileManager::urlsForItemsInDirectoryAtURL(const FileURL& url,
@@ -554,9 +572,15 @@ std::optional<std::vector<FileURL>> TarnFileManager::urlsForItemsInDirectoryAtUR
     }
     std::vector<FileURL> out;
     out.reserve(entries.size());
+    // PathJoin(url, name) for names without slashes: the joined prefix once,
+    // then one allocation per entry (a class directory lists thousands).
+    std::string prefix = PathJoin(url, "x");
+    prefix.pop_back();
     for (const auto& e : entries) {
         if (e.name.empty() || e.name[0] == '.') continue;
-        out.push_back(PathJoin(url, e.name));
+        FileURL& entry = out.emplace_back();
+        entry.reserve(prefix.size() + e.name.size());
+        entry.append(prefix).append(e.name);
     }
     return out;
 }

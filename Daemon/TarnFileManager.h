@@ -181,6 +181,16 @@ public:
     // Reads a whole regular file (not through a link), at most `maxBytes`.
     std::optional<std::string> readDataAtURL(const FileURL& url, size_t maxBytes,
                                              TarnErrorRef* error);
+    // The same for `relativePath` below `directory`, a directory held open
+    // (openDirectoryAtURL) so that many reads below it do not walk its path
+    // again. On failure the POSIX error value; no error object is made.
+    int readDataInDirectory(const FsFd& directory, const std::string& relativePath, size_t maxBytes,
+                            std::string* data);
+    // The directory itself, not through a final link.
+    int openDirectoryAtURL(const FileURL& url, FsFd* directory);
+    // Names not starting with "." of the open `directory`, in directory order.
+    int forEachNameInDirectory(const FsFd& directory,
+                               const std::function<void(std::string_view name)>& each);
 
     // ---- Listing and traversal ----
 

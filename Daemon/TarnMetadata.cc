@@ -1,5 +1,7 @@
 #include "Daemon/TarnMetadata.h"
 
+#include <cerrno>
+
 #include "Daemon/TarnFileManager.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnLog.h"
@@ -12,6 +14,31 @@ namespace tarn {
 namespace {
 
 std::string describe(const PlistValue* v) { return v ? v->description() : "(null)"; }
+
+// PathParent without the copy.
+std::string_view parentOf(std::string_view path) {
+    while (path.size() > 1 && path.back() == '/') path.remove_suffix(1);
+    auto pos = path.rfind('/');
+    if (pos == std::string_view::npos) return {};
+    if (pos == 0) return "/";
+    return path.substr(0, pos);
+}
+
+// Whether the parent of `container` is PathJoin(grandparent of that parent,
+// `relative`): the class directory a container of that class must sit in.
+// Compared in place, since a rebuild asks it of every container.
+bool isInClassDirectory(std::string_view container, std::string_view relative) {
+    const std::string_view classDirectory = parentOf(container);
+    std::string_view base = parentOf(parentOf(classDirectory));
+    while (!relative.empty() && relative.front() == '/') relative.remove_prefix(1);
+    while (base.size() > 1 && base.back() == '/') base.remove_suffix(1);
+    if (relative.empty()) return classDirectory == base;
+    while (relative.back() == '/') relative.remove_suffix(1);
+    const bool separator = base.empty() || base.back() != '/';
+    return classDirectory.size() == base.size() + separator + relative.size() &&
+           classDirectory.starts_with(base) && (!separator || classDirectory[base.size()] == '/') &&
+           classDirectory.ends_with(relative);
+}
 
 }  // namespace
 
@@ -93,6 +120,10 @@ bool TarnMetadata::writeMetadataToFileURL(const FileURL& fileURL, TarnErrorRef* 
     return true;
 }
 
+FileURL TarnMetadata::MetadataLocation::fileURL() const {
+    return file ? *file : PathJoin(container, kTarnMetadataFileName);
+}
+
 TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtUrl(
     const FileURL& url, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
     TarnErrorRef* error) {
@@ -103,46 +134,75 @@ TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtUrl(
 TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtFileUrl(
     const FileURL& fileURL, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
     TarnErrorRef* error) {
+    std::string bytes;
+    auto data = TarnFileManager::defaultManager().readDataAtURL(fileURL, kMaxPlistBytes, nullptr);
+    if (data) bytes = std::move(*data);
+    return validate(data ? 0 : EIO, bytes, MetadataLocation{PathParent(fileURL), &fileURL},
+                    forUserIdentity, checkClassPath, error);
+}
+
+TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataInClassDirectory(
+    const FsFd& classDirectory, FileURL url, const TarnUserIdentityRef& forUserIdentity,
+    bool checkClassPath, TarnErrorRef* error) {
+    std::string relative = PathLastComponent(url);
+    relative.append("/").append(kTarnMetadataFileName);
+    std::string bytes;
+    int err = TarnFileManager::defaultManager().readDataInDirectory(classDirectory, relative,
+                                                                    kMaxPlistBytes, &bytes);
+    return validate(err, bytes, MetadataLocation{std::move(url), nullptr}, forUserIdentity,
+                    checkClassPath, error);
+}
+
+TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& bytes,
+                                              MetadataLocation where,
+                                              const TarnUserIdentityRef& forUserIdentity,
+                                              bool checkClassPath, TarnErrorRef* error) {
     auto fail = [error](TarnErrorRef e) -> TarnMutableMetadataRef {
         if (error) *error = std::move(e);
         return nullptr;
     };
+    // Only a failure names the file, so only a failure pays for its path.
+    auto fileURL = [&where] { return where.fileURL(); };
 
-    auto dictionary = Tarn_dictionaryWithContentsOfURL(fileURL, 0, nullptr);
-    if (!dictionary) {
+    std::optional<PlistValue> dictionary;
+    if (readError == 0) dictionary = PlistValue::fromBytes(bytes.data(), bytes.size());
+    if (!dictionary || !dictionary->isDict()) {
         return fail(TARN_ERROR(TarnErrorReadFailed, nullptr, "Failed to read metadata at URL %@",
-                               fileURL));
+                               fileURL()));
     }
     PlistValue& dict = *dictionary;
 
     const PlistValue* identifierValue = dict.find(kTarnMetadataIdentifierKey);
     if (!identifierValue || !identifierValue->isString()) {
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata Identifier: %@ at %@",
-                               describe(identifierValue), fileURL));
+        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                               "Invalid metadata Identifier: %@ at %@", describe(identifierValue),
+                               fileURL()));
     }
-    const std::string identifier = *identifierValue->asString();
+    std::string identifier = *identifierValue->asString();
 
     const PlistValue* uuidValue = dict.find(kTarnMetadataUUIDKey);
     if (!uuidValue || !uuidValue->isString()) {
         return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Invalid metadata UUID String: %@ at %@", describe(uuidValue), fileURL));
+                               "Invalid metadata UUID String: %@ at %@", describe(uuidValue),
+                               fileURL()));
     }
     std::optional<Uuid> uuid = Uuid::parse(*uuidValue->asString());
     if (!uuid) {
         return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata UUID: %@ at %@",
-                               *uuidValue->asString(), fileURL));
+                               *uuidValue->asString(), fileURL()));
     }
 
     const PlistValue* classValue = dict.find(kTarnMetadataContentClassKey);
     if (!classValue || !classValue->isNumber()) {
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata Class: %@ at %@",
-                               describe(classValue), fileURL));
+        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                               "Invalid metadata Class: %@ at %@", describe(classValue),
+                               fileURL()));
     }
     auto classNumber = classValue->asInt64();
     if (!classValue->isInteger() || !classNumber || !TarnContainerClassIsValid(*classNumber)) {
         return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                "Invalid metadata Content Class: %ld at %@",
-                               static_cast<long>(classNumber.value_or(-1)), fileURL));
+                               static_cast<long>(classNumber.value_or(-1)), fileURL()));
     }
     const TarnContainerClass containerClass = static_cast<TarnContainerClass>(*classNumber);
 
@@ -155,31 +215,33 @@ TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtFileUrl(
             return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                    "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
                                    describe(dict.find(kTarnMetadataUserIdentityKey)), "(null)",
-                                   identifier, fileURL, uint64_t{TarnSuccess}));
+                                   identifier, fileURL(), uint64_t{TarnSuccess}));
         }
         const uint32_t expectedUID = forUserIdentity->posixUIDForContainerClass(containerClass);
+        const PlistValue* persona = dict.find(kTarnMetadataPersonaKey);
         if (TarnContainerClassIsPerUser(containerClass)) {
-            const PlistValue* persona = dict.find(kTarnMetadataPersonaKey);
             if (!persona) {
-                dict.set(kTarnMetadataPersonaKey, PlistValue(expectedUID));
+                // Absent means the expected user (see below); only the debug
+                // line needs to show it filled in.
+                if (PlatformLogVerbose())
+                    dict.set(kTarnMetadataPersonaKey, PlistValue(expectedUID));
             } else if (persona->asUInt64() != std::optional<uint64_t>(expectedUID) ||
                        !persona->isInteger()) {
                 return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                        "Incorrect UserId: %@, expecting: %u for %@ at %@",
-                                       persona->description(), expectedUID, identifier, fileURL));
+                                       persona->description(), expectedUID, identifier, fileURL()));
             }
         }
         const PlistValue* stored = dict.find(kTarnMetadataUserIdentityKey);
         if (!stored) {
             // Written before identities were stored: the owner's uid is all we have.
-            const PlistValue* persona = dict.find(kTarnMetadataPersonaKey);
             const uint32_t uid = persona ? static_cast<uint32_t>(persona->asUInt64().value_or(0))
                                          : expectedUID;
             owner = cache.userIdentityForPersonalPersonaWithUID(uid, uid);
             if (!owner) {
                 return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                        "Invalid metadata User Identity: %@ for %@ at %@: %llu",
-                                       "(null)", identifier, fileURL, uint64_t{TarnSuccess}));
+                                       "(null)", identifier, fileURL(), uint64_t{TarnSuccess}));
             }
         } else {
             uint64_t code = TarnSuccess;
@@ -187,12 +249,13 @@ TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtFileUrl(
             if (!owner) {
                 return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                        "Invalid metadata User Identity: %@ for %@ at %@: %llu",
-                                       *stored, identifier, fileURL, code));
+                                       *stored, identifier, fileURL(), code));
             }
             if (!owner->isEqualToUserIdentity(*forUserIdentity)) {
-                return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                       "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
-                                       owner, forUserIdentity, identifier, fileURL, code));
+                return fail(
+                    TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                               "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
+                               owner, forUserIdentity, identifier, fileURL(), code));
             }
         }
     }
@@ -200,10 +263,15 @@ TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtFileUrl(
     std::optional<PlistValue> info;
     if (const PlistValue* infoValue = dict.find(kTarnMetadataInfoKey)) {
         if (!infoValue->isDict()) {
-            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata Info: %@ at %@",
-                                   *infoValue, fileURL));
+            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                                   "Invalid metadata Info: %@ at %@", *infoValue, fileURL()));
         }
-        info = *infoValue;
+        // The parsed tree is ours: move the info out unless the debug line below
+        // is going to show the whole dictionary.
+        if (PlatformLogVerbose())
+            info = *infoValue;
+        else
+            info = std::move(dict.asDict()->find(kTarnMetadataInfoKey)->second);
     }
 
     std::optional<std::string> userManagedAssetsDirName;
@@ -211,34 +279,35 @@ TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtFileUrl(
         if (!name->isString()) {
             return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                    "Invalid metadata User Managed Dir Name String: %@ at %@", *name,
-                                   fileURL));
+                                   fileURL()));
         }
         userManagedAssetsDirName = *name->asString();
     }
 
-    const FileURL containerURL = PathParent(fileURL);
     if (checkClassPath) {
-        const FileURL classDirectory = PathParent(containerURL);
-        const FileURL base = PathParent(PathParent(classDirectory));
-        const FileURL expected =
-            PathJoin(base, TarnContainerClassRelativeDirectory(containerClass));
-        if (classDirectory != expected) {
+        const char* relative = TarnContainerClassRelativeDirectory(containerClass);
+        if (!isInClassDirectory(where.container, relative ? relative : "")) {
+            const FileURL classDirectory = PathParent(where.container);
+            const FileURL expected =
+                PathJoin(PathParent(PathParent(classDirectory)), relative ? relative : "");
             return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                   "Invalid metadata-URLs should match: %@ : %@", fileURL, expected));
+                                   "Invalid metadata-URLs should match: %@ : %@", fileURL(),
+                                   expected));
         }
     }
 
     uint64_t code = TarnSuccess;
     auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-        *uuid, owner, identifier, containerClass, &code);
+        *uuid, owner, std::move(identifier), containerClass, &code);
     if (!identity) {
         return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Could not create user identity from %@: %llu", fileURL, code));
+                               "Could not create user identity from %@: %llu", fileURL(), code));
     }
-    auto metadata = std::make_shared<TarnMetadata>(identity, std::move(info), containerURL,
-                                                   std::move(userManagedAssetsDirName));
-    PlatformLog("metadata", PlatformLogType::Debug, "[%s] Read metadata from [%@]: %@ <= %@",
-                __func__, fileURL, *metadata, dict);
+    auto metadata = std::make_shared<TarnMetadata>(
+        identity, std::move(info), std::move(where.container), std::move(userManagedAssetsDirName));
+    if (PlatformLogVerbose())
+        PlatformLog("metadata", PlatformLogType::Debug, "[%s] Read metadata from [%@]: %@ <= %@",
+                    "readAndValidateMetadataAtFileUrl", fileURL(), *metadata, dict);
     return metadata;
 }
 

@@ -25,6 +25,7 @@
 
 namespace tarn {
 
+class FsFd;
 class TarnMetadata;
 using TarnMetadataRef = std::shared_ptr<const TarnMetadata>;
 using TarnMutableMetadataRef = std::shared_ptr<TarnMetadata>;
@@ -75,6 +76,12 @@ public:
     static TarnMutableMetadataRef readAndValidateMetadataAtFileUrl(
         const FileURL& fileURL, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
         TarnErrorRef* error);
+    // The reader of a class rebuild: the answer of readAndValidateMetadataAtUrl
+    // for a container directory `url` directly inside the class directory held
+    // open as `classDirectory`; the file is opened relative to that.
+    static TarnMutableMetadataRef readAndValidateMetadataInClassDirectory(
+        const FsFd& classDirectory, FileURL url, const TarnUserIdentityRef& forUserIdentity,
+        bool checkClassPath, TarnErrorRef* error);
 
     bool transient() const { return transient_; }
     bool existed() const { return existed_; }
@@ -101,15 +108,28 @@ public:
     std::string description() const;
 
 private:
-    bool transient_ = false;
-    bool existed_ = false;
-    const TarnContainerClass containerClass_;
-    const TarnUserIdentityRef userIdentity_;
-    const std::string identifier_;
-    Uuid uuid_;
-    FileURL url_;
-    std::optional<std::string> userManagedAssetsDirName_;
-    std::optional<PlistValue> info_;
+  // Where a metadata file is: its container directory, and the file's own
+  // URL when the caller has one (otherwise the standard name inside).
+  struct MetadataLocation {
+      FileURL container;
+      const FileURL* file = nullptr;
+      FileURL fileURL() const;
+  };
+  // Parses and checks `bytes` (readError: how reading them failed, or 0).
+  static TarnMutableMetadataRef validate(int readError, const std::string& bytes,
+                                         MetadataLocation where,
+                                         const TarnUserIdentityRef& forUserIdentity,
+                                         bool checkClassPath, TarnErrorRef* error);
+
+  bool transient_ = false;
+  bool existed_ = false;
+  const TarnContainerClass containerClass_;
+  const TarnUserIdentityRef userIdentity_;
+  const std::string identifier_;
+  Uuid uuid_;
+  FileURL url_;
+  std::optional<std::string> userManagedAssetsDirName_;
+  std::optional<PlistValue> info_;
 };
 
 }  // namespace tarn

@@ -87,9 +87,9 @@ int openParent(const std::string& path, FsFd* parentFd, std::string* name) {
     return 0;
 }
 
-// Directory names read whole before anything is changed, so that removal
-// and creation inside the directory cannot disturb the listing.
-int readNames(int dirFd, std::vector<std::pair<std::string, unsigned char>>* out) {
+// Every name but "." and ".." with its d_type, in directory order.
+template <class F>
+int forEachName(int dirFd, F each) {
     int dupFd = ::fcntl(dirFd, F_DUPFD_CLOEXEC, 0);
     if (dupFd < 0) return errnoOr(EIO);
     DIR* dir = ::fdopendir(dupFd);
@@ -110,10 +110,17 @@ int readNames(int dirFd, std::vector<std::pair<std::string, unsigned char>>* out
         if (e->d_name[0] == '.' &&
             (e->d_name[1] == 0 || (e->d_name[1] == '.' && e->d_name[2] == 0)))
             continue;
-        out->emplace_back(e->d_name, e->d_type);
+        each(e->d_name, e->d_type);
     }
     ::closedir(dir);
     return err;
+}
+
+// Directory names read whole before anything is changed, so that removal
+// and creation inside the directory cannot disturb the listing.
+int readNames(int dirFd, std::vector<std::pair<std::string, unsigned char>>* out) {
+    return forEachName(
+        dirFd, [out](const char* name, unsigned char type) { out->emplace_back(name, type); });
 }
 
 int openDirAt(int dirFd, const std::string& name, FsFd* fd) {
@@ -272,6 +279,10 @@ int FsOpenParent(const std::string& path, FsFd* parent, std::string* name) {
     return openParent(path, parent, name);
 }
 
+int FsForEachNameAt(int dirFd, const std::function<void(std::string_view name)>& each) {
+    return forEachName(dirFd, [&each](const char* name, unsigned char) { each(name); });
+}
+
 int FsListDirectory(const std::string& path, std::vector<FsDirEntry>* out) {
     FsFd dir;
     int f = noEintr([&] { return ::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC); });
@@ -282,7 +293,7 @@ int FsListDirectory(const std::string& path, std::vector<FsDirEntry>* out) {
     out->clear();
     out->reserve(names.size());
     for (auto& [name, dtype] : names) {
-        FsDirEntry e{name, FsEntryType::Unknown};
+        FsDirEntry e{{}, FsEntryType::Unknown};
         switch (dtype) {
             case DT_DIR: e.type = FsEntryType::Directory; break;
             case DT_REG: e.type = FsEntryType::File; break;
@@ -298,6 +309,7 @@ int FsListDirectory(const std::string& path, std::vector<FsDirEntry>* out) {
             }
             default: e.type = FsEntryType::Other; break;
         }
+        e.name = std::move(name);
         out->push_back(std::move(e));
     }
     return 0;
@@ -1000,6 +1012,28 @@ int FsReadFile(const std::string& path, size_t maxBytes, std::string* out) {
         if (n == 0) break;
         if (out->size() + static_cast<size_t>(n) > maxBytes) return EFBIG;
         out->append(buf, static_cast<size_t>(n));
+    }
+    return 0;
+}
+
+int FsReadFileAt(int dirFd, const std::string& name, size_t maxBytes, std::string* out) {
+    int f = noEintr([&] {
+        return ::openat(dirFd, name.c_str(),
+                        O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC);
+    });
+    if (f < 0) return errnoOr(EIO);
+    FsFd fd(f);
+    out->clear();
+    char buf[16384];
+    for (;;) {
+        ssize_t n = noEintr([&] { return ::read(fd.get(), buf, sizeof buf); });
+        if (n < 0) return errnoOr(EIO);
+        if (out->size() + static_cast<size_t>(n) > maxBytes) return EFBIG;
+        out->append(buf, static_cast<size_t>(n));
+        // A regular file reads short only at its end. Anything else (a FIFO
+        // reads empty or short without blocking) yields bytes its reader
+        // refuses, so it needs no fstat of its own.
+        if (static_cast<size_t>(n) < sizeof buf) break;
     }
     return 0;
 }

@@ -17,6 +17,7 @@
 #include <functional>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 namespace tarn {
@@ -100,6 +101,9 @@ struct FsDirEntry {
 // Every entry except "." and ".."; unknown types are resolved with stat(2)
 // of "dir/name" (following links).
 int FsListDirectory(const std::string& path, std::vector<FsDirEntry>* out);
+// Every name except "." and ".." of the open directory `dirFd`, in directory
+// order, without copies.
+int FsForEachNameAt(int dirFd, const std::function<void(std::string_view name)>& each);
 
 // ---- Ownership and modes, never following a final link ----
 
@@ -192,5 +196,10 @@ int FsWriteFile(const std::string& path, const std::string& data, mode_t mode, b
                 int32_t protectionClass);
 // Reads a regular file opened with O_NOFOLLOW; EFBIG beyond `maxBytes`.
 int FsReadFile(const std::string& path, size_t maxBytes, std::string* out);
+// The same for `name` relative to the open directory `dirFd`, with no fstat:
+// read until a short read, EFBIG beyond `maxBytes`. An item that is not a
+// regular file fails (a directory: EISDIR) or reads as whatever it gives
+// without blocking (a FIFO: nothing), for the caller's parser to refuse.
+int FsReadFileAt(int dirFd, const std::string& name, size_t maxBytes, std::string* out);
 
 }  // namespace tarn

@@ -4,6 +4,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <iterator>
 
 #include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnFileManager.h"
@@ -14,6 +15,7 @@
 #include "Platform/ContainerLibrary.h"
 #include "Platform/Notifications.h"
 #include "Platform/PersonaRoster.h"
+#include "Platform/PlatformLog.h"
 #include "Platform/SandboxUserState.h"
 #include "support/ScratchRoot.h"
 
@@ -240,6 +242,54 @@ TEST_F(TarnContainerCacheTest, PushFailuresKeepTheContainer) {
     EXPECT_TRUE(cache_->setSandboxContainerMappingForUserIdentity(mobile(), "x", 1, "/p"))
         << "bundle classes are never pushed";
     EXPECT_FALSE(cache_->setSandboxContainerMappingForUserIdentity(mobile(), "x", 14, "/p"));
+}
+
+TEST_F(TarnContainerCacheTest, ARebuildOfRecordedMappingsWritesNothingButLogsEveryPush) {
+    const std::string logPath = root_.at("/platform.log");
+    PlatformLogSetFile(logPath);
+    auto a = makeContainer(2, "com.ostrea.one");
+    auto b = makeContainer(2, "com.ostrea.two");
+    uint64_t code = 0;
+    ASSERT_TRUE(lookup(2, "com.ostrea.one", &code)) << code;
+    const int setsAfterFirst = state_->sets;
+    EXPECT_GT(setsAfterFirst, 0);
+
+    // A restart: the state still holds both mappings; one of them now points
+    // elsewhere and must be corrected.
+    ASSERT_EQ(state_->setUserStateItemWithPersona(501, 501, 1, "com.ostrea.two", "/stale"), 0);
+    const int setsBefore = state_->sets;
+    cache_ = makeCache();
+    TarnErrorRef error;
+    ASSERT_TRUE(cache_->containerForContainerIdentity(identity(2, "com.ostrea.one"), false, true,
+                                                      false, &error));
+    EXPECT_EQ(state_->sets - setsBefore, 2) << "only the stale mapping is cleared and set";
+    auto items = itemsOf(*state_, 501);
+    EXPECT_EQ(items["1:com.ostrea.one:501"], a->url());
+    EXPECT_EQ(items["1:com.ostrea.two:501"], b->url());
+    PlatformLogSetFile("");
+
+    std::ifstream in(logPath);
+    std::string text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+    size_t pushes = 0;
+    for (size_t at = 0; (at = text.find("Pushed user: 501, itemType: 1, identifier com.ostrea.one, "
+                                        "class: 2, persona id: 501, path: " +
+                                            a->url(),
+                                        at)) != std::string::npos;
+         ++at)
+        ++pushes;
+    EXPECT_EQ(pushes, 2u) << "an unchanged mapping is still logged as pushed\n" << text;
+}
+
+TEST_F(TarnContainerCacheTest, AClassDirectoryReachedThroughALinkIsScannedByPath) {
+    auto made = makeContainer(2, "com.ostrea.linked");
+    const FileURL directory = base(2);
+    std::filesystem::rename(directory, directory + ".real");
+    std::filesystem::create_directory_symlink(directory + ".real", directory);
+    uint64_t code = 0;
+    auto found = lookup(2, "com.ostrea.linked", &code);
+    ASSERT_TRUE(found) << code;
+    EXPECT_EQ(found->url(), made->url());
+    EXPECT_EQ(itemsOf(*state_, 501)["1:com.ostrea.linked:501"], made->url());
 }
 
 TEST_F(TarnContainerCacheTest, AllContainersDropsEntriesWhoseMetadataIsGone) {

@@ -1,6 +1,7 @@
 #include "Daemon/TarnMetadata.h"
 
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <cstdlib>
 #include <filesystem>
@@ -225,6 +226,65 @@ TEST_F(TarnMetadataTest, ClassPathMustMatchTheClassDirectory) {
     auto placed = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, proper, std::nullopt);
     ASSERT_TRUE(placed->writeMetadataToDiskWithError(nullptr));
     EXPECT_TRUE(TarnMetadata::readAndValidateMetadataAtUrl(proper, mobile(), true, nullptr));
+}
+
+TEST_F(TarnMetadataTest, TheClassDirectoryReaderAnswersAsThePathReader) {
+    auto m = make(2, PlistValue(PlistDict{{kTarnInfoContentProtectionClassKey, PlistValue(3)}}));
+    ASSERT_TRUE(m->writeMetadataToDiskWithError(nullptr));
+    const FileURL classDirectory = PathParent(m->url());
+    FsFd directory;
+    ASSERT_EQ(TarnFileManager::defaultManager().openDirectoryAtURL(classDirectory, &directory), 0);
+
+    auto byPath = TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true, nullptr);
+    auto byDirectory = TarnMetadata::readAndValidateMetadataInClassDirectory(
+        directory, m->url(), mobile(), true, nullptr);
+    ASSERT_TRUE(byPath);
+    ASSERT_TRUE(byDirectory);
+    EXPECT_EQ(byDirectory->url(), byPath->url());
+    EXPECT_EQ(byDirectory->uuid(), byPath->uuid());
+    EXPECT_EQ(byDirectory->identifier(), byPath->identifier());
+    EXPECT_EQ(byDirectory->containerClass(), byPath->containerClass());
+    EXPECT_EQ(byDirectory->info(), byPath->info());
+    EXPECT_EQ(byDirectory->userManagedAssetsDirName(), byPath->userManagedAssetsDirName());
+    EXPECT_TRUE(byDirectory->userIdentity()->isEqualToUserIdentity(*byPath->userIdentity()));
+
+    // What stands in place of the file is refused, never waited on.
+    const FileURL file = PathJoin(m->url(), kTarnMetadataFileName);
+    auto expectUnreadable = [&](const char* what) {
+        TarnErrorRef error;
+        EXPECT_FALSE(TarnMetadata::readAndValidateMetadataInClassDirectory(directory, m->url(),
+                                                                           mobile(), true, &error))
+            << what;
+        ASSERT_TRUE(error) << what;
+        EXPECT_EQ(error->code(), TarnErrorReadFailed) << what;
+        EXPECT_FALSE(TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true, nullptr))
+            << what << ": the path reader agrees";
+    };
+    const FileURL kept = PathJoin(classDirectory, "kept.plist");
+    std::filesystem::rename(file, kept);
+    std::filesystem::create_symlink(kept, file);
+    expectUnreadable("a link");
+    std::filesystem::remove(file);
+    ASSERT_EQ(::mkfifo(file.c_str(), 0600), 0);
+    expectUnreadable("a FIFO without a writer");
+    std::filesystem::remove(file);
+    std::filesystem::create_directory(file);
+    expectUnreadable("a directory");
+    std::filesystem::remove(file);
+    std::ofstream(file).put('\0');
+    expectUnreadable("a file that is no property list");
+    std::filesystem::remove(file);
+    expectUnreadable("no file");
+
+    // A file longer than one read comes back whole.
+    std::filesystem::rename(kept, file);
+    auto big = m->copy();
+    big->setInfo(PlistValue(PlistDict{{"Padding", PlistValue(std::string(100000, 'p'))}}));
+    ASSERT_TRUE(big->writeMetadataToDiskWithError(nullptr));
+    auto read = TarnMetadata::readAndValidateMetadataInClassDirectory(directory, m->url(), mobile(),
+                                                                      true, nullptr);
+    ASSERT_TRUE(read);
+    EXPECT_EQ(read->info(), big->info());
 }
 
 TEST_F(TarnMetadataTest, FailedWriteKeepsTheOldFile) {
