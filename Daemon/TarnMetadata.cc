@@ -144,13 +144,18 @@ TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtFileUrl(
 TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataInClassDirectory(
     const FsFd& classDirectory, FileURL url, const TarnUserIdentityRef& forUserIdentity,
     bool checkClassPath, TarnErrorRef* error) {
-    std::string relative = PathLastComponent(url);
-    relative.append("/").append(kTarnMetadataFileName);
-    std::string bytes;
+    // A rebuild calls this once per container on one thread: the name and the
+    // bytes reuse this thread's buffers instead of allocating per file.
+    thread_local std::string relative;
+    thread_local std::string bytes;
+    relative.assign(PathLastComponent(url)).append("/").append(kTarnMetadataFileName);
     int err = TarnFileManager::defaultManager().readDataInDirectory(classDirectory, relative,
                                                                     kMaxPlistBytes, &bytes);
-    return validate(err, bytes, MetadataLocation{std::move(url), nullptr}, forUserIdentity,
-                    checkClassPath, error);
+    auto metadata = validate(err, bytes, MetadataLocation{std::move(url), nullptr}, forUserIdentity,
+                             checkClassPath, error);
+    // One odd large file must not keep its size for the thread's lifetime.
+    if (bytes.capacity() > 64 * 1024) std::string().swap(bytes);
+    return metadata;
 }
 
 TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& bytes,
