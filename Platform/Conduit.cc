@@ -108,7 +108,15 @@ MessageRef Message::createReply() const {
 // is polling, starting one if none is, so that other peers keep being served.
 // A thread "in the I/O part" is polling, accepting or reading; one running a
 // request is not, and cancel() waits only for the former.
+//
+// After running a request, the thread stays with that peer for a while,
+// blocked in recv as a bare socket server would be: a client that sends its
+// next request soon is served without a trip through epoll (a wake-up and a
+// re-arm per request). The peer's socket is not armed meanwhile, so it still
+// has one reader at a time. At most kMaxLingering threads do this at once.
 constexpr int kMaxIoThreads = 16;
+constexpr int kMaxLingering = kMaxIoThreads - 4;
+constexpr std::chrono::milliseconds kLinger{50};
 // A polling thread idle this long exits when another one polls.
 constexpr int kIdleIoThreadMs = 10000;
 
@@ -128,6 +136,7 @@ struct Listener::IoLoop : std::enable_shared_from_this<Listener::IoLoop> {
     int threads GUARDED_BY(mu) = 0;
     int polling GUARDED_BY(mu) = 0;  // threads in (or on their way to) epoll_wait
     int inIo GUARDED_BY(mu) = 0;     // threads in the I/O part
+    int lingering GUARDED_BY(mu) = 0;  // threads waiting on one peer after its request
 
     ~IoLoop() {
         sock::CloseFd(listenFd);
@@ -145,6 +154,10 @@ struct Listener::IoLoop : std::enable_shared_from_this<Listener::IoLoop> {
     // After the request: false when the loop stopped meanwhile and the thread
     // must end without touching the loop's descriptors again.
     bool returnFromRequest() EXCLUDES(mu);
+    // True when the thread may stay with its peer, some other thread polling
+    // meanwhile; endLinger() when it stops.
+    bool startLinger() EXCLUDES(mu);
+    void endLinger() EXCLUDES(mu);
     void acceptAll();
     // false when the thread must end (see returnFromRequest).
     bool readConnection(const ConnectionRef& c);
@@ -205,6 +218,18 @@ bool Listener::IoLoop::returnFromRequest() {
     return true;
 }
 
+bool Listener::IoLoop::startLinger() {
+    MutexLock l(mu);
+    if (stopped || lingering >= kMaxLingering || (polling == 0 && !spawn())) return false;
+    ++lingering;
+    return true;
+}
+
+void Listener::IoLoop::endLinger() {
+    MutexLock l(mu);
+    --lingering;
+}
+
 void Listener::IoLoop::run() {
     (void)pthread_setname_np(pthread_self(), "tarn-conduit-io");  // for ps and debuggers only
     tInIoOf = this;
@@ -247,7 +272,8 @@ void Listener::IoLoop::run() {
 
 void Listener::IoLoop::acceptAll() {
     for (;;) {
-        const int fd = ::accept4(listenFd, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC);
+        // Blocking, for the linger's recv; every other read and send says MSG_DONTWAIT.
+        const int fd = ::accept4(listenFd, nullptr, nullptr, SOCK_CLOEXEC);
         if (fd < 0) {
             if (errno == EINTR || errno == ECONNABORTED) continue;
             if (errno != EAGAIN && errno != EWOULDBLOCK)
@@ -256,6 +282,12 @@ void Listener::IoLoop::acceptAll() {
             break;
         }
         std::string why;
+        if (!sock::SetReceiveTimeout(fd, kLinger)) {
+            PlatformLog("conduit", PlatformLogType::Error, "Refusing connection: SO_RCVTIMEO: %s",
+                        std::strerror(errno));
+            sock::CloseFd(fd);
+            continue;
+        }
         auto creds = sock::ReadPeerCredentials(fd, &why);
         if (!creds) {
             PlatformLog("conduit", PlatformLogType::Error, "Refusing connection: %s", why);
@@ -268,7 +300,7 @@ void Listener::IoLoop::acceptAll() {
         {
             MutexLock l(mu);
             c = std::make_shared<Connection>(Connection::PrivateTag{}, fd, creds->pidfd,
-                                             creds->procFd, cc, nextSerial++);
+                                             creds->exeLinkFd, cc, nextSerial++);
             connections.emplace(c->serial_, c);
             h = handler;
         }
@@ -289,14 +321,23 @@ void Listener::IoLoop::acceptAll() {
 
 bool Listener::IoLoop::readConnection(const ConnectionRef& c) {
     std::vector<uint8_t> record;
-    // A bounded batch per wake-up keeps one busy peer from starving the others.
-    for (int batch = 0; batch < 16; ++batch) {
+    bool linger = false;
+    struct EndLinger {
+        IoLoop* io;
+        const bool& linger;
+        ~EndLinger() {
+            if (linger) io->endLinger();
+        }
+    } endLinger{this, linger};
+    // A bounded batch per wake-up keeps one busy peer from starving the
+    // others; a lingering thread starves nobody, someone else polls.
+    for (int batch = 0; linger || batch < 16; ++batch) {
         RecordHeader h;
         std::vector<uint8_t> body;
         {
             MutexLock r(c->readMu_);
             std::string why;
-            switch (sock::ReceiveRecord(c->fd_, kMaxRecordBytes, &record, &why)) {
+            switch (sock::ReceiveRecord(c->fd_, kMaxRecordBytes, &record, &why, linger)) {
                 case sock::RecvResult::WouldBlock:
                     arm(c->fd_, c->serial_, false);
                     return true;
@@ -328,10 +369,12 @@ bool Listener::IoLoop::readConnection(const ConnectionRef& c) {
             idle = c->queued_ == 0;  // nothing handed over earlier still waits to run
         }
         if (idle && leaveForRequest()) {
-            const bool ran = c->queue_->runHereIfIdle(
-                [&] { c->deliver(std::move(body), h.flags, h.messageId, h.replyTo, false); });
+            auto work = [&] { c->deliver(std::move(body), h.flags, h.messageId, h.replyTo, false); };
+            // By reference: a std::function holding a reference_wrapper never allocates.
+            const bool ran = c->queue_->runHereIfIdle(std::ref(work));
             if (!returnFromRequest()) return false;
             if (ran) {
+                if (linger || (linger = startLinger())) continue;
                 // A peer waiting for its answer has sent nothing more yet:
                 // re-arm rather than spend a read on finding the socket empty.
                 // A message already there fires at once.
@@ -358,11 +401,11 @@ bool Listener::IoLoop::readConnection(const ConnectionRef& c) {
 // ---------------------------------------------------------------------------
 // Connection
 
-Connection::Connection(PrivateTag, int fd, int pidfd, int procFd, const Credentials& creds,
+Connection::Connection(PrivateTag, int fd, int pidfd, int exeLinkFd, const Credentials& creds,
                        uint64_t serial)
     : fd_(fd),
       pidfd_(pidfd),
-      procFd_(procFd),
+      exeLinkFd_(exeLinkFd),
       creds_(creds),
       auditToken_(MakeAuditToken({creds.euid, creds.egid, creds.pid, creds.startTime})),
       serial_(serial),
@@ -371,19 +414,19 @@ Connection::Connection(PrivateTag, int fd, int pidfd, int procFd, const Credenti
 Connection::~Connection() {
     sock::CloseFd(fd_);
     sock::CloseFd(pidfd_);
-    sock::CloseFd(procFd_);
+    sock::CloseFd(exeLinkFd_);
 }
 
 std::optional<std::string> Connection::executablePath() const {
     std::optional<std::string> path;
     std::optional<sock::FileIdentity> file;
-    if (procFd_ >= 0) {
-        // One system call per request. The link read through the peer's own
-        // /proc directory names what that process runs now, so an exec shows
+    if (exeLinkFd_ >= 0) {
+        // One system call per request. The peer's own /proc exe link, held
+        // since connect, names what that process runs now, so an exec shows
         // at once, and it cannot be read once the process is gone, even if the
         // PID is reused. Identity follows the executable's path, so an
         // unchanged link means an unchanged answer.
-        path = sock::ExecutableLinkAt(procFd_);
+        path = sock::ExecutableLinkAt(exeLinkFd_);
         if (!path) return std::nullopt;
         MutexLock l(exeMu_);
         if (exe_ && exe_->link == *path) return exe_->realPath;
@@ -411,7 +454,7 @@ std::optional<std::string> Connection::executablePath() const {
 void Connection::setEventHandler(std::function<void(const Event&)> handler) {
     MutexLock l(mu_);
     if (finished_ || cancelled_) return;
-    handler_ = std::move(handler);
+    handler_ = handler ? std::make_shared<const EventHandler>(std::move(handler)) : nullptr;
 }
 
 void Connection::setQoSFloor(QoS qos) {
@@ -438,7 +481,7 @@ void Connection::resume() {
 void Connection::cancel() {
     bool deliverInvalid;
     std::shared_ptr<Listener> listener;
-    std::function<void(const Event&)> dropped;
+    std::shared_ptr<const EventHandler> dropped;
     {
         MutexLock l(mu_);
         if (cancelled_) return;
@@ -469,7 +512,7 @@ void Connection::fail(const std::string& reason) {
 }
 
 void Connection::finish() {
-    std::function<void(const Event&)> h;
+    std::shared_ptr<const EventHandler> h;
     {
         MutexLock l(mu_);
         if (finished_) return;
@@ -477,12 +520,12 @@ void Connection::finish() {
         h = std::move(handler_);
         handler_ = nullptr;
     }
-    if (h) h(Event{Event::Kind::ConnectionInvalid, nullptr});
+    if (h) (*h)(Event{Event::Kind::ConnectionInvalid, nullptr});
 }
 
 void Connection::deliver(std::vector<uint8_t> body, uint16_t flags, uint64_t id,
                          uint64_t replyTo, bool handedOver) {
-    std::function<void(const Event&)> h;
+    std::shared_ptr<const EventHandler> h;
     std::string why;
     auto value = DecodeBody(body.data(), body.size(), &why);
     bool tooMany = false;
@@ -505,7 +548,7 @@ void Connection::deliver(std::vector<uint8_t> body, uint16_t flags, uint64_t id,
     }
     auto message = std::make_shared<Message>(Message::PrivateTag{}, weak_from_this(), id, replyTo,
                                               (flags & kFlagRequest) != 0, std::move(*value));
-    if (h) h(Event{Event::Kind::Message, message});
+    if (h) (*h)(Event{Event::Kind::Message, message});
     if (handedOver) onDelivered();
 }
 
@@ -526,9 +569,10 @@ void Connection::onDelivered() {
 
 bool Connection::send(const MessageRef& message) {
     if (!message) return false;
-    std::vector<uint8_t> body;
+    // Per thread, so that a reply costs no allocation once the thread has sent one.
+    thread_local std::vector<uint8_t> encoded;
     std::string why;
-    if (!EncodeBody(message->body(), &body, &why)) {
+    if (!EncodeMessage(message->body(), &encoded, &why)) {
         PlatformLog("conduit", PlatformLogType::Error, "Cannot send message to pid %d: %s",
                     creds_.pid, why);
         return false;
@@ -550,7 +594,7 @@ bool Connection::send(const MessageRef& message) {
     bool ok;
     {
         MutexLock l(sendMu_);
-        ok = sock::SendRecords(fd_, BuildRecords(h, body), kSendTimeout, &why);
+        ok = sock::SendEncodedMessage(fd_, h, &encoded, kSendTimeout, &why);
     }
     if (!ok) {
         PlatformLog("conduit", PlatformLogType::Error, "Send to pid %d failed: %s", creds_.pid,
@@ -690,6 +734,8 @@ void Listener::cancel() {
         connections.swap(io_->connections);
         io_->handler = nullptr;
     }
+    // Lingering readers wake up to end of stream and leave the I/O part.
+    for (auto& [serial, c] : connections) (void)::shutdown(c->fd_, SHUT_RD);
     if (started && io_->wakeFd >= 0) {
         const uint64_t one = 1;
         // Never read, so it wakes every polling thread in turn; cannot fail here.

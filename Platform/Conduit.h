@@ -151,7 +151,7 @@ public:
     const DispatchQueueRef& queue() const { return queue_; }
 
     // Internal: made by the Listener's I/O thread.
-    Connection(PrivateTag, int fd, int pidfd, int procFd, const Credentials& creds,
+    Connection(PrivateTag, int fd, int pidfd, int exeLinkFd, const Credentials& creds,
                uint64_t serial);
     ~Connection();
     Connection(const Connection&) = delete;
@@ -172,14 +172,16 @@ private:
     // Constant after construction.
     const int fd_;
     const int pidfd_;
-    const int procFd_;  // the peer's /proc directory, or -1 (see sock::PeerCredentials)
+    const int exeLinkFd_;  // the peer's /proc/PID/exe link, or -1 (see sock::PeerCredentials)
     const Credentials creds_;
     const AuditToken auditToken_;
     const uint64_t serial_;  // key in the Listener's I/O table
     const DispatchQueueRef queue_;
 
     mutable Mutex mu_;
-    std::function<void(const Event&)> handler_ GUARDED_BY(mu_);
+    using EventHandler = std::function<void(const Event&)>;
+    // Shared, so that taking it for each message copies no closure.
+    std::shared_ptr<const EventHandler> handler_ GUARDED_BY(mu_);
     std::weak_ptr<Listener> listener_ GUARDED_BY(mu_);
     bool resumed_ GUARDED_BY(mu_) = false;
     bool cancelled_ GUARDED_BY(mu_) = false;
@@ -194,7 +196,7 @@ private:
     std::atomic<uint64_t> nextId_{1};
 
     // The last executablePath() answer, reused while the peer still runs the
-    // same link (and, without procFd_, the same file): resolving it again costs
+    // same link (and, without exeLinkFd_, the same file): resolving it again costs
     // a start-time read and a realpath walk.
     struct ExecutableCache {
         std::string link;
@@ -298,10 +300,15 @@ public:
 
 private:
     bool sendMessage(const PlistValue& body, uint16_t flags, uint64_t id, std::string* why);
+    std::optional<Received> receiveUntil(std::chrono::steady_clock::time_point deadline,
+                                         std::string* why);
 
     const int fd_;
     uint64_t nextId_ = 1;
     std::vector<Received> stash_;  // replies received while waiting for another
+    // The socket's SO_RCVTIMEO, set again only when a wait's time left moves
+    // away from it: one blocking recv per reply, as a bare socket user does.
+    std::chrono::milliseconds receiveTimeout_{-1};
     struct Assembly;
     std::unique_ptr<Assembly> assembly_;
 };

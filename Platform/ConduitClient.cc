@@ -19,6 +19,7 @@ namespace {
 constexpr std::chrono::milliseconds kClientSendTimeout{30000};
 // Replies kept for other waiters; a server that sends more than this unasked is misbehaving.
 constexpr size_t kMaxStashedReplies = 256;
+constexpr std::chrono::milliseconds kTimeoutSlack{10};
 
 }  // namespace
 
@@ -57,12 +58,12 @@ std::unique_ptr<Client> Client::connect(const std::string& socketPath, std::stri
 }
 
 bool Client::sendMessage(const PlistValue& body, uint16_t flags, uint64_t id, std::string* why) {
-    std::vector<uint8_t> bytes;
-    if (!EncodeBody(body, &bytes, why)) return false;
+    thread_local std::vector<uint8_t> encoded;
+    if (!EncodeMessage(body, &encoded, why)) return false;
     RecordHeader h;
     h.flags = flags;
     h.messageId = id;
-    return sock::SendRecords(fd_, BuildRecords(h, bytes), kClientSendTimeout, why);
+    return sock::SendEncodedMessage(fd_, h, &encoded, kClientSendTimeout, why);
 }
 
 std::optional<uint64_t> Client::sendRequest(const PlistValue& request, std::string* why) {
@@ -81,15 +82,32 @@ bool Client::sendRaw(const void* bytes, size_t n) {
 
 std::optional<Client::Received> Client::receive(std::chrono::milliseconds timeout,
                                                 std::string* why) {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
-    for (;;) {
+    return receiveUntil(std::chrono::steady_clock::now() + timeout, why);
+}
+
+std::optional<Client::Received> Client::receiveUntil(std::chrono::steady_clock::time_point deadline,
+                                                     std::string* why) {
+    for (bool first = true;; first = false) {
         auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
             deadline - std::chrono::steady_clock::now());
-        if (!sock::WaitReadable(fd_, std::max(left, std::chrono::milliseconds(0)), why))
+        // With no time left, the first try still takes what has arrived.
+        const bool wait = left > std::chrono::milliseconds(0);
+        if (!wait && !first) {
+            if (why) *why = "timed out";
             return std::nullopt;
-        switch (sock::ReceiveRecord(fd_, kMaxRecordBytes, &assembly_->record, why)) {
+        }
+        // A wait may overrun by up to kTimeoutSlack rather than pay a
+        // setsockopt on every reply.
+        if (wait && (receiveTimeout_ < left || receiveTimeout_ > left + kTimeoutSlack)) {
+            if (!sock::SetReceiveTimeout(fd_, left)) {
+                if (why) *why = Format("setsockopt SO_RCVTIMEO: %s", std::strerror(errno));
+                return std::nullopt;
+            }
+            receiveTimeout_ = left;
+        }
+        switch (sock::ReceiveRecord(fd_, kMaxRecordBytes, &assembly_->record, why, wait)) {
             case sock::RecvResult::WouldBlock:
-                continue;
+                continue;  // the time passed; the check above says so
             case sock::RecvResult::Closed:
                 if (why) *why = "connection closed by the peer";
                 return std::nullopt;
@@ -132,9 +150,7 @@ std::optional<PlistValue> Client::waitForReply(uint64_t id, std::chrono::millise
     }
     const auto deadline = std::chrono::steady_clock::now() + timeout;
     for (;;) {
-        auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-            deadline - std::chrono::steady_clock::now());
-        auto m = receive(std::max(left, std::chrono::milliseconds(0)), why);
+        auto m = receiveUntil(deadline, why);
         if (!m) return std::nullopt;
         if (!(m->flags & kFlagReply)) continue;  // nobody asked for it
         if (m->replyTo == id) return std::move(m->body);

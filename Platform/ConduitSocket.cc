@@ -5,6 +5,7 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
+#include <sys/time.h>
 #include <sys/un.h>
 #include <time.h>
 #include <unistd.h>
@@ -43,40 +44,55 @@ uint64_t bootTicksNow() {
 
 }  // namespace
 
-bool SendRecords(int fd, const std::vector<std::vector<uint8_t>>& records,
-                 std::chrono::milliseconds timeout, std::string* why) {
-    for (const auto& r : records) {
-        const auto deadline = std::chrono::steady_clock::now() + timeout;
-        for (;;) {
-            const ssize_t n = ::send(fd, r.data(), r.size(), MSG_NOSIGNAL | MSG_DONTWAIT);
-            if (n == static_cast<ssize_t>(r.size())) break;
-            if (n >= 0) {
-                // SOCK_SEQPACKET sends whole records or nothing.
-                if (why) *why = "short send";
-                return false;
-            }
-            if (errno == EINTR) continue;
-            if (errno != EAGAIN && errno != EWOULDBLOCK) {
-                if (why) *why = errnoText("send");
-                return false;
-            }
-            struct pollfd p = {fd, POLLOUT, 0};
-            const int64_t left = remainingMs(deadline);
-            if (left == 0) {
-                if (why) *why = "peer does not read its messages";
-                return false;
-            }
-            if (::poll(&p, 1, static_cast<int>(std::min<int64_t>(left, 1 << 30))) < 0 &&
-                errno != EINTR) {
-                if (why) *why = errnoText("poll");
-                return false;
-            }
+bool SendRecord(int fd, const uint8_t* data, size_t size, std::chrono::milliseconds timeout,
+                std::string* why) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    for (;;) {
+        const ssize_t n = ::send(fd, data, size, MSG_NOSIGNAL | MSG_DONTWAIT);
+        if (n == static_cast<ssize_t>(size)) return true;
+        if (n >= 0) {
+            // SOCK_SEQPACKET sends whole records or nothing.
+            if (why) *why = "short send";
+            return false;
+        }
+        if (errno == EINTR) continue;
+        if (errno != EAGAIN && errno != EWOULDBLOCK) {
+            if (why) *why = errnoText("send");
+            return false;
+        }
+        struct pollfd p = {fd, POLLOUT, 0};
+        const int64_t left = remainingMs(deadline);
+        if (left == 0) {
+            if (why) *why = "peer does not read its messages";
+            return false;
+        }
+        if (::poll(&p, 1, static_cast<int>(std::min<int64_t>(left, 1 << 30))) < 0 &&
+            errno != EINTR) {
+            if (why) *why = errnoText("poll");
+            return false;
         }
     }
+}
+
+bool SendRecords(int fd, const std::vector<std::vector<uint8_t>>& records,
+                 std::chrono::milliseconds timeout, std::string* why) {
+    for (const auto& r : records)
+        if (!SendRecord(fd, r.data(), r.size(), timeout, why)) return false;
     return true;
 }
 
-RecvResult ReceiveRecord(int fd, size_t limit, std::vector<uint8_t>* buffer, std::string* why) {
+bool SendEncodedMessage(int fd, const RecordHeader& header, std::vector<uint8_t>* encoded,
+                        std::chrono::milliseconds timeout, std::string* why) {
+    const auto split = FrameMessage(header, encoded);
+    const bool ok = split.empty() ? SendRecord(fd, encoded->data(), encoded->size(), timeout, why)
+                                  : SendRecords(fd, split, timeout, why);
+    // A thread's buffer stays small once a big message has gone.
+    if (encoded->capacity() > kMaxRecordBytes) std::vector<uint8_t>().swap(*encoded);
+    return ok;
+}
+
+RecvResult ReceiveRecord(int fd, size_t limit, std::vector<uint8_t>* buffer, std::string* why,
+                         bool wait) {
     // Received into per-thread scratch and copied out at its real length:
     // sizing the caller's vector to the limit first would zero the whole limit
     // (64 KiB) on every call, the last one that finds nothing included.
@@ -89,7 +105,7 @@ RecvResult ReceiveRecord(int fd, size_t limit, std::vector<uint8_t>* buffer, std
     for (;;) {
         // MSG_TRUNC makes recv report the record's real length, so an oversized
         // record is recognised instead of silently cut.
-        const ssize_t n = ::recv(fd, scratch.get(), limit, MSG_DONTWAIT | MSG_TRUNC);
+        const ssize_t n = ::recv(fd, scratch.get(), limit, (wait ? 0 : MSG_DONTWAIT) | MSG_TRUNC);
         if (n > 0) {
             if (static_cast<size_t>(n) > limit) {
                 if (why) *why = Format("record of %zd bytes is larger than the limit", n);
@@ -110,6 +126,13 @@ RecvResult ReceiveRecord(int fd, size_t limit, std::vector<uint8_t>* buffer, std
         if (why) *why = errnoText("recv");
         return RecvResult::Error;
     }
+}
+
+bool SetReceiveTimeout(int fd, std::chrono::milliseconds timeout) {
+    struct timeval tv = {};
+    tv.tv_sec = static_cast<time_t>(timeout.count() / 1000);
+    tv.tv_usec = static_cast<suseconds_t>(timeout.count() % 1000 * 1000);
+    return ::setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv) == 0;
 }
 
 bool WaitReadable(int fd, std::chrono::milliseconds timeout, std::string* why) {
@@ -174,9 +197,9 @@ std::optional<std::string> ProcessExecutable(pid_t pid) {
     return std::string(buf.data(), static_cast<size_t>(n));
 }
 
-std::optional<std::string> ExecutableLinkAt(int procFd) {
+std::optional<std::string> ExecutableLinkAt(int exeLinkFd) {
     char buf[4096];
-    const ssize_t n = ::readlinkat(procFd, "exe", buf, sizeof buf);
+    const ssize_t n = ::readlinkat(exeLinkFd, "", buf, sizeof buf);
     if (n <= 0 || static_cast<size_t>(n) >= sizeof buf) return std::nullopt;
     return std::string(buf, static_cast<size_t>(n));
 }
@@ -216,11 +239,11 @@ std::optional<PeerCredentials> ReadPeerCredentials(int fd, std::string* why) {
         }
     }
     auto startTime = ProcessStartTime(cred.pid);
-    const std::string procDir = "/proc/" + std::to_string(cred.pid);
-    const int procFd = ::open(procDir.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC);
+    const std::string exeLink = "/proc/" + std::to_string(cred.pid) + "/exe";
+    const int exeLinkFd = ::open(exeLink.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC);
     // Alive after the reads means the PID named this process while we read it.
     if (!startTime || !PidfdAlive(pidfd)) {
-        CloseFd(procFd);
+        CloseFd(exeLinkFd);
         CloseFd(pidfd);
         if (why) *why = "peer exited before its identity could be read";
         return std::nullopt;
@@ -228,7 +251,7 @@ std::optional<PeerCredentials> ReadPeerCredentials(int fd, std::string* why) {
     // Without SO_PEERPIDFD the PID might have been reused between connect and
     // pidfd_open; the connecting process started before we accepted it.
     if (!fromSocket && *startTime > acceptedAt) {
-        CloseFd(procFd);
+        CloseFd(exeLinkFd);
         CloseFd(pidfd);
         if (why) *why = "peer PID was reused before it could be pinned";
         return std::nullopt;
@@ -236,7 +259,7 @@ std::optional<PeerCredentials> ReadPeerCredentials(int fd, std::string* why) {
     (void)::fcntl(pidfd, F_SETFD, FD_CLOEXEC);  // best effort: pidfds come close-on-exec
     out.startTime = *startTime;
     out.pidfd = pidfd;
-    out.procFd = procFd;  // -1 when /proc could not be opened: callers fall back to the PID
+    out.exeLinkFd = exeLinkFd;  // -1 when /proc could not be opened: callers fall back to the PID
     return out;
 }
 

@@ -11,6 +11,8 @@
 #include <string>
 #include <vector>
 
+#include "Platform/ConduitWire.h"
+
 namespace tarn::conduit::sock {
 
 // Sends each record as one SOCK_SEQPACKET record. A full send buffer is
@@ -18,10 +20,24 @@ namespace tarn::conduit::sock {
 bool SendRecords(int fd, const std::vector<std::vector<uint8_t>>& records,
                  std::chrono::milliseconds timeout, std::string* why);
 
+// Sends one record (same rules as SendRecords).
+bool SendRecord(int fd, const uint8_t* data, size_t size, std::chrono::milliseconds timeout,
+                std::string* why);
+// Frames and sends a message EncodeMessage() put in `encoded`; keeps the
+// buffer's capacity for the next message unless it grew large.
+bool SendEncodedMessage(int fd, const RecordHeader& header, std::vector<uint8_t>* encoded,
+                        std::chrono::milliseconds timeout, std::string* why);
+
 enum class RecvResult { Record, WouldBlock, Closed, Error };
 // Receives one record into `buffer` (resized to the record). A record longer
 // than `limit` is reported as Error with a reason, without keeping its bytes.
-RecvResult ReceiveRecord(int fd, size_t limit, std::vector<uint8_t>* buffer, std::string* why);
+// Without `wait` it never blocks; with it, a blocking socket waits up to its
+// SO_RCVTIMEO, and WouldBlock then means that time passed with nothing read.
+RecvResult ReceiveRecord(int fd, size_t limit, std::vector<uint8_t>* buffer, std::string* why,
+                         bool wait = false);
+
+// Sets SO_RCVTIMEO (0: wait without limit).
+bool SetReceiveTimeout(int fd, std::chrono::milliseconds timeout);
 
 // Waits until `fd` is readable; false on timeout (why = "timed out") or error.
 bool WaitReadable(int fd, std::chrono::milliseconds timeout, std::string* why);
@@ -35,11 +51,12 @@ struct PeerCredentials {
     pid_t pid = 0;
     uint64_t startTime = 0;  // clock ticks after boot
     int pidfd = -1;          // owned by the caller
-    // The peer's /proc directory (O_PATH), owned by the caller; -1 when it
-    // could not be opened. Opened while the pidfd showed the process alive, so
-    // it names that process and no other, and reads through it fail once the
-    // process is gone even if its PID is reused.
-    int procFd = -1;
+    // The peer's /proc/PID/exe link itself (O_PATH|O_NOFOLLOW), owned by the
+    // caller; -1 when it could not be opened. Opened while the pidfd showed the
+    // process alive, so it names that process and no other: reading it gives
+    // what that process runs now, and fails once the process is gone even if
+    // its PID is reused.
+    int exeLinkFd = -1;
 };
 // Takes SO_PEERCRED and the peer's pidfd (SO_PEERPIDFD, or pidfd_open checked
 // against the accept time), and the start time read while the pidfd shows the
@@ -52,9 +69,9 @@ std::optional<uint64_t> ProcessStartTime(pid_t pid);
 bool PidfdAlive(int pidfd);
 // readlink of /proc/PID/exe.
 std::optional<std::string> ProcessExecutable(pid_t pid);
-// The "exe" link in a /proc directory opened as PeerCredentials::procFd: what
-// that process runs now. Empty once the process has exited.
-std::optional<std::string> ExecutableLinkAt(int procFd);
+// What the link opened as PeerCredentials::exeLinkFd names now: one
+// readlinkat, without a path walk. Empty once the process has exited.
+std::optional<std::string> ExecutableLinkAt(int exeLinkFd);
 // Device and inode of the file /proc/PID/exe names: a new exec of another
 // file changes them even when the path stays the same.
 struct FileIdentity {

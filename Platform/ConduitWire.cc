@@ -35,12 +35,13 @@ void putBytes(std::vector<uint8_t>* out, const void* p, size_t n) {
 
 class Encoder {
 public:
-    explicit Encoder(std::vector<uint8_t>* out) : out_(out) {}
+    // Appends to `out`, whose first `base` bytes are not part of the value.
+    explicit Encoder(std::vector<uint8_t>* out, size_t base = 0) : out_(out), base_(base) {}
 
     bool value(const PlistValue& v, size_t depth, std::string* why) {
         if (depth > kMaxNestingDepth) return fail(why, "nesting deeper than the limit");
         // Checked as we go so that a huge value stops early instead of growing the buffer.
-        if (out_->size() > kMaxBodyBytes) return fail(why, "message larger than 1 MiB");
+        if (out_->size() - base_ > kMaxBodyBytes) return fail(why, "message larger than 1 MiB");
         switch (v.type()) {
             case PlistValue::Type::String: {
                 const std::string& s = *v.asString();
@@ -109,6 +110,7 @@ private:
         return false;
     }
     std::vector<uint8_t>* out_;
+    const size_t base_;
 };
 
 bool validUtf8(const uint8_t* s, size_t n) {
@@ -316,6 +318,31 @@ bool EncodeBody(const PlistValue& value, std::vector<uint8_t>* out, std::string*
         return false;
     }
     return EncodeValue(value, out, why);
+}
+
+bool EncodeMessage(const PlistValue& body, std::vector<uint8_t>* out, std::string* why) {
+    if (!body.isDict()) {
+        if (why) *why = "message body is not a dictionary";
+        return false;
+    }
+    out->resize(kHeaderBytes);
+    if (!Encoder(out, kHeaderBytes).value(body, 1, why)) return false;
+    if (out->size() - kHeaderBytes > kMaxBodyBytes) {
+        if (why) *why = "message larger than 1 MiB";
+        return false;
+    }
+    return true;
+}
+
+std::vector<std::vector<uint8_t>> FrameMessage(RecordHeader header, std::vector<uint8_t>* encoded) {
+    const size_t length = encoded->size() - kHeaderBytes;
+    if (length > kMaxRecordPayload)
+        return BuildRecords(header, std::vector<uint8_t>(encoded->begin() + kHeaderBytes, encoded->end()));
+    header.bodyLength = static_cast<uint32_t>(length);
+    header.bodyOffset = 0;
+    header.flags = static_cast<uint16_t>(header.flags & ~kFlagMore);
+    EncodeHeader(header, encoded->data());
+    return {};
 }
 
 std::optional<PlistValue> DecodeValue(const uint8_t* bytes, size_t length, std::string* why) {

@@ -106,6 +106,14 @@ std::optional<RecordHeader> DecodeHeader(const uint8_t* record, size_t recordLen
 std::vector<std::vector<uint8_t>> BuildRecords(RecordHeader header,
                                                const std::vector<uint8_t>& body);
 
+// Encodes a message body straight after kHeaderBytes of room in `*out`
+// (reusing its capacity); same checks as EncodeBody. FrameMessage() then
+// writes the header: a message that fits one record (nearly all) becomes that
+// record in place, without a copy, and nothing is returned; a larger one is
+// returned split as BuildRecords() would.
+bool EncodeMessage(const PlistValue& body, std::vector<uint8_t>* out, std::string* why);
+std::vector<std::vector<uint8_t>> FrameMessage(RecordHeader header, std::vector<uint8_t>* encoded);
+
 // Joins records back into one message. Feed records in arrival order; a
 // message is ready when add() returns Complete. Any record that breaks the
 // rules above makes add() return Malformed with a reason; the assembler must

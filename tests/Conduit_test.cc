@@ -480,6 +480,23 @@ TEST_F(ConduitListenerTest, IdleRequestsRunWhereTheyWereReadAndMayCancelTheListe
     EXPECT_FALSE(Client::connect(listener_->socketPath(), &why));
 }
 
+// After a request the reading thread waits on that peer for a while; a peer
+// that pauses longer, or another peer meanwhile, is still served: by the
+// polling threads once the wait ends.
+TEST_F(ConduitListenerTest, PausingAndInterleavedPeersAreAllServed) {
+    listener_->resume();
+    auto first = connect();
+    auto second = connect();
+    std::string why;
+    for (uint64_t seq = 1; seq <= 6; ++seq) {
+        auto& client = seq % 2 ? first : second;
+        auto reply = client->sendSync(request(seq), 5000ms, &why);
+        ASSERT_TRUE(reply) << why;
+        EXPECT_EQ(reply->find("Echo")->find("Seq")->asUInt64(), seq);
+        if (seq % 3 == 0) std::this_thread::sleep_for(120ms);  // longer than the wait
+    }
+}
+
 // The peer connects, then execs another program that inherits the socket:
 // from then on the connection answers with the new executable, and with
 // nothing once the process is gone.
