@@ -1,5 +1,7 @@
 #include "Platform/Format.h"
 
+#include <cctype>
+#include <charconv>
 #include <cstdio>
 
 namespace tarn {
@@ -18,9 +20,33 @@ std::string formatInteger(const std::string& directive, char conv, const FormatA
                                                          : 0;
     if (a.kind == FormatArg::Kind::String) {
         // A string where a number was asked for: print the text rather than guess.
-        return a.s;
+        return std::string(a.s);
     }
     char buf[80];
+    if (directive == "%" && conv != 'o') {
+        // The common case, without building a printf format.
+        uint64_t v = raw;
+        bool negative = false;
+        if (isSigned) {
+            int64_t sv = static_cast<int64_t>(raw);
+            if (len == Length::Int) sv = static_cast<int32_t>(raw);
+            if (len == Length::Short) sv = static_cast<int16_t>(raw);
+            if (len == Length::Char) sv = static_cast<int8_t>(raw);
+            negative = sv < 0;
+            v = negative ? 0 - static_cast<uint64_t>(sv) : static_cast<uint64_t>(sv);
+        } else {
+            if (len == Length::Int) v = static_cast<uint32_t>(raw);
+            if (len == Length::Short) v = static_cast<uint16_t>(raw);
+            if (len == Length::Char) v = static_cast<uint8_t>(raw);
+        }
+        char* p = buf;
+        if (negative) *p++ = '-';
+        const int base = conv == 'x' || conv == 'X' ? 16 : 10;
+        char* end = std::to_chars(p, buf + sizeof buf, v, base).ptr;
+        if (conv == 'X')
+            for (char* q = p; q < end; ++q) *q = static_cast<char>(std::toupper(static_cast<unsigned char>(*q)));
+        return std::string(buf, end);
+    }
     std::string f = directive + "ll" + conv;
     if (isSigned) {
         int64_t v = static_cast<int64_t>(raw);
@@ -36,6 +62,25 @@ std::string formatInteger(const std::string& directive, char conv, const FormatA
         std::snprintf(buf, sizeof buf, f.c_str(), static_cast<unsigned long long>(v));
     }
     return buf;
+}
+
+// What %@ and %s print for an argument.
+std::string argumentText(const FormatArg& a) {
+    char buf[32];
+    switch (a.kind) {
+        case FormatArg::Kind::String:
+            return std::string(a.s);
+        case FormatArg::Kind::Signed:
+            return std::string(buf, std::to_chars(buf, buf + sizeof buf, a.i).ptr);
+        case FormatArg::Kind::Unsigned:
+            return std::string(buf, std::to_chars(buf, buf + sizeof buf, a.u).ptr);
+        case FormatArg::Kind::Double:
+            return std::to_string(a.d);
+        case FormatArg::Kind::Pointer:
+            std::snprintf(buf, sizeof buf, "%p", a.p);
+            return buf;
+    }
+    return std::string(a.s);
 }
 
 }  // namespace
@@ -85,13 +130,16 @@ std::string formatArgs(std::string_view fmt, const FormatArg* args, size_t count
         const FormatArg& a = args[next++];
         char buf[512];
         switch (conv) {
-            case '@': out += a.s; break;
+            case '@':
+                if (a.kind == FormatArg::Kind::String) out += a.s;
+                else out += argumentText(a);
+                break;
             case 's': {
                 // Width and precision apply as printf would apply them.
-                if (directive == "%") {
+                if (directive == "%" && a.kind == FormatArg::Kind::String) {
                     out += a.s;
                 } else {
-                    std::snprintf(buf, sizeof buf, (directive + "s").c_str(), a.s.c_str());
+                    std::snprintf(buf, sizeof buf, (directive + "s").c_str(), argumentText(a).c_str());  // NUL-ended copy
                     out += buf;
                 }
                 break;

@@ -18,6 +18,11 @@
 
 namespace tarn {
 
+// Numbers and pointers keep their value only; their text is made when a
+// conversion asks for text (%@, %s), so a log line pays for what it prints.
+// Text arguments are viewed, not copied: a FormatArg lives only inside one
+// Format() call, while its arguments do. Text made here (a description) is
+// kept in `owned` and viewed from there.
 struct FormatArg {
     enum class Kind { Signed, Unsigned, Double, String, Pointer };
     Kind kind = Kind::String;
@@ -25,7 +30,28 @@ struct FormatArg {
     uint64_t u = 0;
     double d = 0;
     const void* p = nullptr;
-    std::string s;
+    std::string_view s;
+    std::string owned;
+
+    FormatArg() = default;
+    FormatArg(const FormatArg&) = delete;
+    FormatArg& operator=(const FormatArg&) = delete;
+    FormatArg(FormatArg&& o) noexcept { *this = std::move(o); }
+    FormatArg& operator=(FormatArg&& o) noexcept {
+        kind = o.kind;
+        i = o.i;
+        u = o.u;
+        d = o.d;
+        p = o.p;
+        const bool own = o.s.data() == o.owned.data();
+        owned = std::move(o.owned);
+        s = own ? std::string_view(owned) : o.s;
+        return *this;
+    }
+    void own(std::string text) {
+        owned = std::move(text);
+        s = owned;
+    }
 };
 
 template <class T>
@@ -40,31 +66,26 @@ FormatArg makeFormatArg(const T& v) {
     if constexpr (std::is_same_v<U, bool>) {
         a.kind = FormatArg::Kind::Signed;
         a.i = v ? 1 : 0;
-        a.s = v ? "1" : "0";
     } else if constexpr (std::is_integral_v<U> && std::is_signed_v<U>) {
         a.kind = FormatArg::Kind::Signed;
         a.i = v;
-        a.s = std::to_string(v);
     } else if constexpr (std::is_integral_v<U>) {
         a.kind = FormatArg::Kind::Unsigned;
         a.u = v;
-        a.s = std::to_string(v);
     } else if constexpr (std::is_enum_v<U>) {
         a.kind = FormatArg::Kind::Signed;
         a.i = static_cast<int64_t>(v);
-        a.s = std::to_string(a.i);
     } else if constexpr (std::is_floating_point_v<U>) {
         a.kind = FormatArg::Kind::Double;
         a.d = v;
-        a.s = std::to_string(v);
     } else if constexpr (std::is_convertible_v<const U&, std::string_view>) {
-        std::string_view sv(v);
-        a.s.assign(sv.data(), sv.size());
         if constexpr (std::is_pointer_v<U>) {
-            if (v == nullptr) a.s = "(null)";
+            a.s = v == nullptr ? std::string_view("(null)") : std::string_view(v);
+        } else {
+            a.s = std::string_view(v);
         }
     } else if constexpr (Describable<U>) {
-        a.s = v.description();
+        a.own(v.description());
     } else if constexpr (requires { v.get(); *v; }) {  // smart pointers
         if (!v)
             a.s = "(null)";
@@ -79,9 +100,6 @@ FormatArg makeFormatArg(const T& v) {
     } else if constexpr (std::is_pointer_v<U>) {
         a.kind = FormatArg::Kind::Pointer;
         a.p = static_cast<const void*>(v);
-        char buf[32];
-        std::snprintf(buf, sizeof buf, "%p", a.p);
-        a.s = buf;
     } else {
         static_assert(sizeof(U) == 0, "type cannot be formatted: give it description()");
     }
