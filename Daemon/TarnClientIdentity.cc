@@ -17,6 +17,12 @@ namespace {
 
 constexpr const char* kInstallerIdentifier = "com.ostrea.installd";
 
+const std::shared_ptr<const PlistValue>& emptyEntitlements() {
+    static const auto* empty = new std::shared_ptr<const PlistValue>(
+        std::make_shared<const PlistValue>(PlistDict{}));  // never freed: used until exit
+    return *empty;
+}
+
 // The installer sends many requests from one process; its identity is kept.
 std::mutex gInstallerMu;
 TarnClientIdentityRef gInstallerIdentity;  // guarded by gInstallerMu
@@ -34,7 +40,25 @@ TarnClientIdentity::TarnClientIdentity(std::string bundleIdentifier, uid_t UID, 
       posixUID_(UID),
       posixGID_(GID),
       bundleIdentifier_(std::move(bundleIdentifier)),
-      entitlements_(entitlements.isDict() ? std::move(entitlements) : PlistValue(PlistDict{})),
+      entitlements_(entitlements.isDict()
+                        ? std::make_shared<const PlistValue>(std::move(entitlements))
+                        : emptyEntitlements()),
+      userIdentity_(std::move(userIdentity)),
+      auditToken_(auditToken) {}
+
+TarnClientIdentity::TarnClientIdentity(std::string bundleIdentifier, uid_t UID, gid_t GID,
+                                       pid_t PID,
+                                       std::shared_ptr<const TarnUserIdentity> userIdentity,
+                                       std::shared_ptr<const PlistValue> entitlements,
+                                       bool sandboxed, TarnAuditToken auditToken, bool kernel)
+    : sandboxed_(sandboxed),
+      kernel_(kernel),
+      posixPID_(PID),
+      posixUID_(UID),
+      posixGID_(GID),
+      bundleIdentifier_(std::move(bundleIdentifier)),
+      entitlements_(entitlements && entitlements->isDict() ? std::move(entitlements)
+                                                           : emptyEntitlements()),
       userIdentity_(std::move(userIdentity)),
       auditToken_(auditToken) {}
 
@@ -48,8 +72,8 @@ TarnClientIdentityRef TarnClientIdentity::initWithBundleIdentifier(
                                                       auditToken, kernel);
 }
 
-bool TarnClientIdentity::boolValueOfEntitlement(const std::string& key) const {
-    const PlistValue* v = entitlements_.find(key);
+bool TarnClientIdentity::boolValueOfEntitlement(std::string_view key) const {
+    const PlistValue* v = entitlements_->find(key);
     if (!v || !(v->isNumber() || v->isBool())) return false;
     return v->truthy();
 }
@@ -67,7 +91,7 @@ std::string TarnClientIdentity::description() const {
         "<%@: %p; bundleIdentifier = %@, userIdentity = %@, posixUID = %u, posixGID = %u, "
         "posixPID = %u, isSandboxed = %d, entitlements = %@>",
         "TarnClientIdentity", static_cast<const void*>(this), bundleIdentifier_, userIdentity_,
-        posixUID_, posixGID_, posixPID_, sandboxed_, entitlements_);
+        posixUID_, posixGID_, posixPID_, sandboxed_, *entitlements_);
 }
 
 std::shared_ptr<const CodeSignInfo> TarnClientIdentity::codeSignInfoForConnection(
@@ -96,12 +120,18 @@ TarnClientIdentityRef TarnClientIdentity::clientIdentityWithConduitConnection(
 
 TarnClientIdentityRef TarnClientIdentity::clientIdentityWithConduitConnection(
     const std::shared_ptr<conduit::Connection>& connection,
-    const std::shared_ptr<const CodeSignInfo>& info) {
+    const std::shared_ptr<const CodeSignInfo>& info, Reuse* reuse) {
     uid_t uid = connection->euid();
     gid_t gid = connection->egid();
     pid_t pid = connection->pid();
     TarnUserIdentityRef userIdentity =
         TarnUserIdentitySharedCache::sharedInstance().userIdentityForCurrentContextWithUID(uid, gid);
+    if (reuse && reuse->identity && info && reuse->codeSignInfo == info &&
+        reuse->userIdentity == userIdentity) {
+        PlatformLog("conduit", PlatformLogType::Info, "[%s] Conduit client identity: %@",
+                    "clientIdentityWithConduitConnection", reuse->identity);
+        return reuse->identity;
+    }
     const TarnAuditToken& token = connection->auditToken();
     std::optional<std::string> identifier;
     TarnErrorRef err;
@@ -117,19 +147,21 @@ TarnClientIdentityRef TarnClientIdentity::clientIdentityWithConduitConnection(
         if (gInstallerIdentity && gInstallerIdentity->auditToken() == token) result = gInstallerIdentity;
     }
     if (!result) {
-        PlistValue entitlements = info ? info->entitlements : PlistValue();
-        bool sandboxed = info && info->sandboxed;
-        if (!entitlements.isDict()) {
+        // The registry's entries never change once made: share, don't copy.
+        std::shared_ptr<const PlistValue> entitlements;
+        if (info && info->entitlements.isDict())
+            entitlements = std::shared_ptr<const PlistValue>(info, &info->entitlements);
+        else
             TarnLog(kLogError, "clientIdentityWithConduitConnection",
                     "Missing or malformed entitlements for pid %d", pid);
-            entitlements = PlistValue(PlistDict{});
-        }
+        bool sandboxed = info && info->sandboxed;
         if (!identifier) {
             TarnLog(kLogError, "clientIdentityWithConduitConnection",
                     "Failed to copy signing ID for pid %d : %@", pid, err);
         } else if (userIdentity) {
-            result = initWithBundleIdentifier(*identifier, uid, gid, pid, userIdentity,
-                                              std::move(entitlements), sandboxed, token, false);
+            result = std::make_shared<const TarnClientIdentity>(*identifier, uid, gid, pid, userIdentity,
+                                                                std::move(entitlements), sandboxed,
+                                                                token, false);
         }
         if (installer) {
             std::lock_guard lock(gInstallerMu);
@@ -138,6 +170,7 @@ TarnClientIdentityRef TarnClientIdentity::clientIdentityWithConduitConnection(
     }
     PlatformLog("conduit", PlatformLogType::Info, "[%s] Conduit client identity: %@",
                 "clientIdentityWithConduitConnection", result);
+    if (reuse) *reuse = Reuse{info, userIdentity, result};
     return result;
 }
 

@@ -9,6 +9,7 @@
 #include <cstdint>
 #include <memory>
 #include <string>
+#include <string_view>
 
 #include "Platform/PropertyList.h"
 
@@ -32,6 +33,11 @@ public:
                        std::shared_ptr<const TarnUserIdentity> userIdentity,
                        PlistValue entitlements, bool sandboxed, TarnAuditToken auditToken,
                        bool kernel);
+    // Shares the entitlements (typically the registry's own), copying nothing.
+    TarnClientIdentity(std::string bundleIdentifier, uid_t UID, gid_t GID, pid_t PID,
+                       std::shared_ptr<const TarnUserIdentity> userIdentity,
+                       std::shared_ptr<const PlistValue> entitlements, bool sandboxed,
+                       TarnAuditToken auditToken, bool kernel);
 
     static TarnClientIdentityRef initWithBundleIdentifier(
         std::string bundleIdentifier, uid_t UID, gid_t GID, pid_t PID,
@@ -45,12 +51,12 @@ public:
     gid_t posixGID() const { return posixGID_; }
     const std::string& bundleIdentifier() const { return bundleIdentifier_; }
     // Always a dictionary (empty when the caller has none).
-    const PlistValue& entitlements() const { return entitlements_; }
+    const PlistValue& entitlements() const { return *entitlements_; }
     const std::shared_ptr<const TarnUserIdentity>& userIdentity() const { return userIdentity_; }
     const TarnAuditToken& auditToken() const { return auditToken_; }
 
     // True only for an entitlement whose value is a number (or boolean) that is non-zero.
-    bool boolValueOfEntitlement(const std::string& key) const;
+    bool boolValueOfEntitlement(std::string_view key) const;
     uid_t posixUIDForContainerClass(uint64_t containerClass) const;
     gid_t posixGIDForContainerClass(uint64_t containerClass) const;
     std::string description() const;
@@ -61,9 +67,19 @@ public:
         const std::shared_ptr<conduit::Connection>& connection);
     // The same with the peer's code-signing registration already looked up
     // (the request processor needs it first, to make the peer's persona current).
+    // `reuse`, when given, is one connection's slot (used only from that
+    // connection's serial queue): the identity made for its last request is
+    // answered again while the registration and user identity behind it are
+    // the same objects, so that a client sending many requests costs no
+    // rebuilding.
+    struct Reuse {
+        std::shared_ptr<const CodeSignInfo> codeSignInfo;
+        std::shared_ptr<const TarnUserIdentity> userIdentity;
+        TarnClientIdentityRef identity;
+    };
     static TarnClientIdentityRef clientIdentityWithConduitConnection(
         const std::shared_ptr<conduit::Connection>& connection,
-        const std::shared_ptr<const CodeSignInfo>& codeSignInfo);
+        const std::shared_ptr<const CodeSignInfo>& codeSignInfo, Reuse* reuse = nullptr);
     // The peer's registration, read once per request through its pidfd.
     static std::shared_ptr<const CodeSignInfo> codeSignInfoForConnection(
         const std::shared_ptr<conduit::Connection>& connection);
@@ -81,7 +97,7 @@ private:
     uid_t posixUID_;
     gid_t posixGID_;
     std::string bundleIdentifier_;
-    PlistValue entitlements_;
+    std::shared_ptr<const PlistValue> entitlements_;  // never null
     std::shared_ptr<const TarnUserIdentity> userIdentity_;
     TarnAuditToken auditToken_;
 };

@@ -52,7 +52,7 @@ TarnEntitlementGate TarnCheckEntitlements(const TarnClientIdentityRef& identity,
         g.admitted = row.anyClient;
         return g;
     }
-    const std::string key = row.entitlement;
+    const std::string_view key = row.entitlement;
     if (identity->boolValueOfEntitlement(kTarnEntitlementAllowed)) {
         g.allowOtherIdLookup = true;
         g.unrestricted = key != kTarnEntitlementTestability;
@@ -85,7 +85,7 @@ std::shared_ptr<TarnDeferredReply> TarnTakeDeferredReply() {
 }
 
 void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
-                             const conduit::Event& event) {
+                             const conduit::Event& event, TarnClientIdentity::Reuse* reuse) {
     if (event.kind != conduit::Event::Kind::Message || !event.message) return;
     uint64_t error = TarnSuccess;
     const PlistValue& request = event.message->body();
@@ -124,7 +124,7 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
         PersonaRoster::setCurrentPersonaUniqueString(
             codeSignInfo ? codeSignInfo->personaUniqueString : std::nullopt);
         TarnClientIdentityRef identity =
-            TarnClientIdentity::clientIdentityWithConduitConnection(peer, codeSignInfo);
+            TarnClientIdentity::clientIdentityWithConduitConnection(peer, codeSignInfo, reuse);
         TarnEntitlementGate gate = TarnCheckEntitlements(identity, *row);
         if (identity && gate.admitted) {
             uint64_t result = TarnCodeSigningMapping::sharedInstance()->processCallerRegisteredEntitlements(
@@ -160,8 +160,11 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
         PersonaRoster::setCurrentPersonaUniqueString(std::nullopt);
     }
 
-    std::string client = connection ? connection->clientBundleIdentifier() : "<unknown>";
-    if (client.empty()) client = "<unknown>";
+    static const std::string kUnknownClient = "<unknown>";
+    const TarnClientIdentityRef* clientIdentity = connection ? &connection->clientIdentity() : nullptr;
+    const std::string& client = clientIdentity && *clientIdentity && !(*clientIdentity)->bundleIdentifier().empty()
+                                    ? (*clientIdentity)->bundleIdentifier()
+                                    : kUnknownClient;
     if (recording)
         signpost.end({{"command", std::to_string(command)}, {"clientIdentifier", client}});
     else

@@ -7,6 +7,7 @@
 #include <memory>
 #include <optional>
 
+#include "Daemon/TarnClientIdentity.h"
 #include "Platform/PropertyList.h"
 
 namespace tarn {
@@ -31,8 +32,11 @@ struct TarnEntitlementGate {
 TarnEntitlementGate TarnCheckEntitlements(const std::shared_ptr<const TarnClientIdentity>& identity,
                                           const TarnCommandTableRow& row);
 
+// `reuse`: the peer connection's identity slot (see TarnClientIdentity), or
+// nullptr to build the identity afresh.
 void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
-                             const conduit::Event& event);
+                             const conduit::Event& event,
+                             TarnClientIdentity::Reuse* reuse = nullptr);
 
 // Turns an exception caught at an operation boundary into a code: on internal
 // builds it ends the process with the fatal report; otherwise it logs

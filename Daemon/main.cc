@@ -28,8 +28,10 @@ std::shared_ptr<conduit::Listener> gListener;
 
 void newConnection(const conduit::ConnectionRef& peer) {
     std::weak_ptr<conduit::Connection> weak = peer;
-    peer->setEventHandler([weak](const conduit::Event& event) {
-        if (auto p = weak.lock()) TarnProcessConduitEvent(p, event);
+    // Events of one peer run one at a time, so the slot needs no lock.
+    auto reuse = std::make_shared<TarnClientIdentity::Reuse>();
+    peer->setEventHandler([weak, reuse](const conduit::Event& event) {
+        if (auto p = weak.lock()) TarnProcessConduitEvent(p, event, reuse.get());
     });
     peer->setQoSFloor(QoS::Default);
     peer->resume();

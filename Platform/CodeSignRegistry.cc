@@ -26,15 +26,18 @@ struct CodeSignRegistry::Impl {
     std::mutex loadMu;
     std::mutex watchMu;
     std::string watchedDir;                // guarded by watchMu
+    std::string watchedRoot;               // guarded by watchMu: the prefix watchedDir is under
     std::unique_ptr<FileWatcher> watcher;  // guarded by watchMu
 
     std::string dir() const { return RootPath("/etc/tarnkeeper/codesign"); }
 
     // Follows the root prefix: fixed in the daemon, changed by tests.
     void ensureWatching() {
-        std::string d = dir();
         std::lock_guard lock(watchMu);
-        if (watcher && watchedDir == d) return;
+        // Compared by prefix, which costs no allocation on every request.
+        if (watcher && watchedRoot == RootPrefix()) return;
+        const std::string d = dir();
+        watchedRoot = RootPrefix();
         // The callback only marks the registry stale, so stopping here
         // cannot wait on anything this thread holds.
         if (watcher) watcher->stop();
