@@ -8,8 +8,10 @@
 //      same file-system work done directly: staging mkdir, metadata written
 //      to a temporary file with fsync, renamed, staging directory fsynced,
 //      moved into the container, standard subdirectories, rename into place.
-//      Batches alternate daemon / direct, each direct batch in fresh
-//      directories; total times and ratio;
+//      Batches alternate daemon / direct. The direct side works in one staging
+//      and one live directory made fresh for this run, so that its directories
+//      grow in step with the daemon's (a large directory costs the file system
+//      more per entry than a small one); total times and ratio;
 //   3. look-ups per second with 1, 2 and 4 concurrent clients.
 //
 //   container_requests_bench [CONTAINERS] [LOOKUP_ROUNDS]
@@ -153,24 +155,21 @@ void createDirectly(const std::string& staging, const std::string& live,
     check(::rename(dir.c_str(), (live + "/" + uuid).c_str()) == 0, "rename live");
 }
 
-void creation(const char* config, const std::string& root, Client& daemon, int total,
+void creation(const char* config, const std::string& directBase, Client& daemon, int total,
               const std::vector<uint8_t>& metadata) {
     std::vector<std::string> subdirs;
     uint64_t code = 0;
     if (!ContainerLibrarySubdirectoriesForClass(kClass, &subdirs, &code)) die("no subdirectories");
     const int batch = 100;
     double daemonUs = 0, directUs = 0;
-    int made = 0, k = 0;
+    int made = 0;
     while (made < total) {
         const int n = std::min(batch, total - made);
         auto t0 = Clock::now();
         for (int i = 0; i < n; ++i) send(daemon, request0(std::string("bench.create.") + config + "." + std::to_string(made + i), true));
         daemonUs += since(t0);
-        const std::string base = root + "/direct/" + config + std::to_string(k++);
-        std::filesystem::create_directories(base + "/staging");
-        std::filesystem::create_directories(base + "/live");
         t0 = Clock::now();
-        for (int i = 0; i < n; ++i) createDirectly(base + "/staging", base + "/live", metadata, subdirs);
+        for (int i = 0; i < n; ++i) createDirectly(directBase + "/staging", directBase + "/live", metadata, subdirs);
         directUs += since(t0);
         made += n;
     }
@@ -249,12 +248,17 @@ int main(int argc, char** argv) {
     if (!harness::SetProcessCpus(::getpid(), {all.front()}, &why) ||
         !harness::SetProcessCpus(daemon->pid(), {all.front()}, &why))
         std::fprintf(stderr, "pinning: %s\n", why.c_str());
+    // Made fresh for this run, like the daemon's own directories; kept for
+    // both configurations, as the daemon's are.
+    const std::string directBase = root + "/direct";
+    std::filesystem::create_directories(directBase + "/staging");
+    std::filesystem::create_directories(directBase + "/live");
     lookupLatency("pinned", *client, record, rounds, 200);
-    creation("pinned", root, *client, containers, metadata);
+    creation("pinned", directBase, *client, containers, metadata);
     (void)harness::SetProcessCpus(::getpid(), all, &why);
     (void)harness::SetProcessCpus(daemon->pid(), all, &why);
     lookupLatency("unpinned", *client, record, rounds, 200);
-    creation("unpinned", root, *client, containers, metadata);
+    creation("unpinned", directBase, *client, containers, metadata);
     for (int clients : {1, 2, 4}) throughput(socket, clients);
 
     client.reset();
