@@ -11,6 +11,7 @@
 #include <thread>
 
 #include "Platform/Conduit.h"
+#include "Platform/ConduitHarness.h"
 #include "support/DaemonHarness.h"
 
 namespace tarn {
@@ -50,6 +51,44 @@ TEST_F(DaemonSpineTest, CommandTableAndGateOverIpc) {
     EXPECT_GE(count("command=0, client="), 1u);
     EXPECT_GE(count("command=27, client=<unknown>, error=55"), 1u);
     EXPECT_GE(count("command=27, client=com.ostrea.test.admin, error=49"), 1u);
+}
+
+// One connection sends many requests; its identity is reused between them,
+// but a change to the peer's registration shows on the very same connection.
+TEST_F(DaemonSpineTest, ARegistrationChangeShowsOnAnOpenConnection) {
+    auto registerSelf = [&](bool allowed) {
+        PlistValue entitlements{PlistDict{}};
+        if (allowed) entitlements.set("com.ostrea.private.TarnKeeper.allowed", true);
+        PlistValue reg{PlistDict{}};
+        reg.set("Executable", conduit::harness::SelfExecutablePath());
+        reg.set("SigningIdentifier", "com.ostrea.test.self");
+        reg.set("Entitlements", entitlements);
+        const auto bytes = reg.toBinary();
+        root_.writeFile("/etc/tarnkeeper/codesign/self.plist", std::string(bytes.begin(), bytes.end()));
+    };
+    registerSelf(false);
+    daemon_->start();
+    std::string why;
+    auto client = conduit::Client::connect(daemon_->socketPath(), &why);
+    ASSERT_TRUE(client) << why;
+    PlistValue request{PlistDict{}};
+    request.set("Command", uint64_t{27});
+    auto answer = [&] {
+        auto reply = client->sendSync(request, std::chrono::seconds(10), &why);
+        const PlistValue* e = reply ? reply->find("ReplyError") : nullptr;
+        return e && e->asUInt64() ? *e->asUInt64() : uint64_t{0};
+    };
+    ASSERT_EQ(answer(), 55u);
+    ASSERT_EQ(answer(), 55u);
+    for (bool allowed : {true, false}) {
+        registerSelf(allowed);
+        const uint64_t want = allowed ? 49 : 55;
+        const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+        uint64_t got = 0;
+        while ((got = answer()) != want && std::chrono::steady_clock::now() < deadline)
+            std::this_thread::sleep_for(std::chrono::milliseconds(20));
+        EXPECT_EQ(got, want) << "allowed=" << allowed;
+    }
 }
 
 TEST_F(DaemonSpineTest, GarbageOnTheSocketOnlyDropsThatPeer) {
