@@ -222,11 +222,11 @@ void PlatformLogWrite(const char* category, PlatformLogType type, const std::str
     }
 }
 
-SignpostInterval::SignpostInterval(const char* category, std::string name,
+SignpostInterval::SignpostInterval(const char* category, std::string_view name,
                                    std::vector<std::pair<std::string, std::string>> attributes)
     : category_(category), recording_(PlatformLogVerbose()) {
     if (!recording_) return;
-    name_ = std::move(name);
+    name_ = std::string(name);
     start_ = std::chrono::steady_clock::now();
     std::string text = "signpost begin " + name_;
     for (auto& [k, v] : attributes) text += " " + k + "=" + v;

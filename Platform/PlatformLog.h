@@ -47,7 +47,8 @@ void PlatformLog(const char* category, PlatformLogType type, std::string_view fm
 // with its attributes when ended (or destroyed without being ended).
 class SignpostInterval {
 public:
-    SignpostInterval(const char* category, std::string name,
+    // `name` is copied only when signposts are recorded.
+    SignpostInterval(const char* category, std::string_view name,
                      std::vector<std::pair<std::string, std::string>> attributes = {});
     ~SignpostInterval();
     SignpostInterval(const SignpostInterval&) = delete;
