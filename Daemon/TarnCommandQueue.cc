@@ -23,7 +23,7 @@ bool TarnCommandQueue::executeNextCommandWithError(uint64_t* error) {
             TarnSetError(error, TarnErrorQueueEmpty);
             return false;
         }
-        next = commands_.front();
+        next = std::move(commands_.front());
         commands_.pop_front();
         if (!queue_) queue_ = DispatchQueue::createSerial("com.ostrea.tarnkeeperd.TarnCommandQueue");
         queue = queue_;

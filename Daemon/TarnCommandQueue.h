@@ -7,7 +7,7 @@
 #pragma once
 
 #include <cstdint>
-#include <deque>
+#include <list>
 #include <memory>
 
 #include "Platform/Dispatch.h"
@@ -44,7 +44,8 @@ private:
     Mutex mu_;
     // Made by the first command that runs: most requests queue none.
     DispatchQueueRef queue_ GUARDED_BY(mu_);
-    std::deque<std::shared_ptr<TarnCommand>> commands_ GUARDED_BY(mu_);
+    // A list, not a deque: an empty deque allocates, and every request makes a queue.
+    std::list<std::shared_ptr<TarnCommand>> commands_ GUARDED_BY(mu_);
 };
 
 }  // namespace tarn

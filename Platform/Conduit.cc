@@ -320,7 +320,9 @@ void Listener::IoLoop::acceptAll() {
 }
 
 bool Listener::IoLoop::readConnection(const ConnectionRef& c) {
-    std::vector<uint8_t> record;
+    // Per thread, reused for every message it reads: no allocation per message.
+    thread_local std::vector<uint8_t> record;
+    thread_local std::vector<uint8_t> body;
     bool linger = false;
     struct EndLinger {
         IoLoop* io;
@@ -333,7 +335,6 @@ bool Listener::IoLoop::readConnection(const ConnectionRef& c) {
     // others; a lingering thread starves nobody, someone else polls.
     for (int batch = 0; linger || batch < 16; ++batch) {
         RecordHeader h;
-        std::vector<uint8_t> body;
         {
             MutexLock r(c->readMu_);
             std::string why;
@@ -360,7 +361,7 @@ bool Listener::IoLoop::readConnection(const ConnectionRef& c) {
                     break;
             }
             h = c->assembler_.header();
-            body = c->assembler_.take();
+            c->assembler_.takeInto(&body);
         }
         bool idle;
         {
@@ -369,7 +370,7 @@ bool Listener::IoLoop::readConnection(const ConnectionRef& c) {
             idle = c->queued_ == 0;  // nothing handed over earlier still waits to run
         }
         if (idle && leaveForRequest()) {
-            auto work = [&] { c->deliver(std::move(body), h.flags, h.messageId, h.replyTo, false); };
+            auto work = [&] { c->deliver(body, h.flags, h.messageId, h.replyTo, false); };
             // By reference: a std::function holding a reference_wrapper never allocates.
             const bool ran = c->queue_->runHereIfIdle(std::ref(work));
             if (!returnFromRequest()) return false;
@@ -390,7 +391,7 @@ bool Listener::IoLoop::readConnection(const ConnectionRef& c) {
             if (pause) c->paused_ = true;
         }
         c->queue_->async([c, body = std::move(body), h]() mutable {
-            c->deliver(std::move(body), h.flags, h.messageId, h.replyTo, true);
+            c->deliver(body, h.flags, h.messageId, h.replyTo, true);
         });
         if (pause) return true;  // re-armed by the queue once it has caught up
     }
@@ -523,7 +524,7 @@ void Connection::finish() {
     if (h) (*h)(Event{Event::Kind::ConnectionInvalid, nullptr});
 }
 
-void Connection::deliver(std::vector<uint8_t> body, uint16_t flags, uint64_t id,
+void Connection::deliver(const std::vector<uint8_t>& body, uint16_t flags, uint64_t id,
                          uint64_t replyTo, bool handedOver) {
     std::shared_ptr<const EventHandler> h;
     std::string why;

@@ -163,7 +163,7 @@ private:
     // On the queue: decodes and hands one message to the handler. `handedOver`
     // when the I/O part queued it (and counted it in queued_) rather than
     // running it on the thread that read it.
-    void deliver(std::vector<uint8_t> body, uint16_t flags, uint64_t id, uint64_t replyTo,
+    void deliver(const std::vector<uint8_t>& body, uint16_t flags, uint64_t id, uint64_t replyTo,
                  bool handedOver);
     void fail(const std::string& reason);
     void finish();  // on the queue: ConnectionInvalid, drop the handler

@@ -26,6 +26,7 @@ constexpr std::chrono::milliseconds kTimeoutSlack{10};
 struct Client::Assembly {
     RecordAssembler assembler;
     std::vector<uint8_t> record;
+    std::vector<uint8_t> body;  // reused for every message
 };
 
 Client::Client(PrivateTag, int fd) : fd_(fd), assembly_(std::make_unique<Assembly>()) {}
@@ -125,7 +126,8 @@ std::optional<Client::Received> Client::receiveUntil(std::chrono::steady_clock::
         }
         if (r == RecordAssembler::Result::NeedMore) continue;
         const RecordHeader h = assembly_->assembler.header();
-        std::vector<uint8_t> body = assembly_->assembler.take();
+        assembly_->assembler.takeInto(&assembly_->body);
+        const std::vector<uint8_t>& body = assembly_->body;
         // Built in place: GCC's -O2 flow analysis misreads a moved-in temporary
         // as uninitialised.
         std::optional<Received> out(std::in_place);

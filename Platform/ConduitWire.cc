@@ -479,4 +479,9 @@ std::vector<uint8_t> RecordAssembler::take() {
     return std::move(body_);
 }
 
+void RecordAssembler::takeInto(std::vector<uint8_t>* out) {
+    inProgress_ = false;
+    body_.swap(*out);
+}
+
 }  // namespace tarn::conduit

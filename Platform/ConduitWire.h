@@ -125,6 +125,9 @@ public:
     // Valid after Complete; take() moves the body out and resets for the next message.
     const RecordHeader& header() const { return header_; }
     std::vector<uint8_t> take();
+    // The same into *out, whose old storage the assembler keeps for the next
+    // message: a reader that reuses `out` allocates nothing per message.
+    void takeInto(std::vector<uint8_t>* out);
 
 private:
     bool inProgress_ = false;

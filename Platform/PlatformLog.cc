@@ -165,7 +165,7 @@ void flushAtExit() {
 
 // Queues a line for the writer thread; false when the caller should write it
 // itself (no thread could be started).
-bool enqueue(Sink& s, const char* category, PlatformLogType type, const std::string& message) {
+bool enqueue(Sink& s, const char* category, PlatformLogType type, std::string& message) {
     bool wake = false, full = false;
     {
         std::lock_guard lock(s.batchMu);
@@ -178,8 +178,8 @@ bool enqueue(Sink& s, const char* category, PlatformLogType type, const std::str
             s.writerStarted = true;
             std::atexit(flushAtExit);
         }
-        s.batch.push_back(Pending{type, category, message});
         s.batchBytes += message.size();
+        s.batch.push_back(Pending{type, category, std::move(message)});
         wake = s.writerIdle;
         s.writerIdle = false;  // one wake-up per batch
         full = s.batchBytes >= kMaxBatchBytes;
@@ -201,7 +201,7 @@ void PlatformLogFlush() {
     if (s.file) std::fflush(s.file);
 }
 
-void PlatformLogWrite(const char* category, PlatformLogType type, const std::string& message) {
+void PlatformLogWrite(const char* category, PlatformLogType type, std::string message) {
     auto& s = sink();
     const char* subsystem = subsystemFor(category);
     bool queue;
@@ -212,10 +212,11 @@ void PlatformLogWrite(const char* category, PlatformLogType type, const std::str
         queue = type <= PlatformLogType::Default;
         if (!queue) {
             flushLocked(s);
-            emit(s, {Pending{type, category, message}});
+            emit(s, {Pending{type, category, std::move(message)}});
             return;
         }
     }
+    // Takes the message when it queues it; leaves it when it returns false.
     if (!enqueue(s, category, type, message)) {
         std::lock_guard lock(s.mu);
         if (!s.quiet) emit(s, {Pending{type, category, message}});

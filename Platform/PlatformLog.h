@@ -32,7 +32,7 @@ bool PlatformLogWanted(PlatformLogType type);
 // The file gets every line before this returns. Error and Fault lines reach
 // stderr or journald at once too; lower ones are batched and follow within a
 // few tens of milliseconds (and at exit), always in order.
-void PlatformLogWrite(const char* category, PlatformLogType type, const std::string& message);
+void PlatformLogWrite(const char* category, PlatformLogType type, std::string message);
 // Writes out batched lines now (before a deliberate abort, for example).
 void PlatformLogFlush();
 
