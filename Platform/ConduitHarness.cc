@@ -141,32 +141,63 @@ bool SetProcessCpus(pid_t pid, const std::vector<int>& cpus, std::string* why) {
     return any || setCpus(pid, cpus, why);
 }
 
-std::unique_ptr<SeqpacketEcho> SeqpacketEcho::start(std::string* why) {
+std::unique_ptr<SeqpacketEcho> SeqpacketEcho::start(std::string* why, bool otherProcess) {
     int fds[2];
     if (::socketpair(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0, fds) != 0) {
         if (why) *why = Format("socketpair: %s", std::strerror(errno));
         return nullptr;
     }
-    return std::make_unique<SeqpacketEcho>(fds[0], fds[1]);
+    auto echo = std::make_unique<SeqpacketEcho>(fds[0], fds[1], otherProcess);
+    if (otherProcess && echo->child_ < 0) {
+        if (why) *why = Format("fork: %s", std::strerror(errno));
+        return nullptr;
+    }
+    return echo;
 }
 
-SeqpacketEcho::SeqpacketEcho(int near, int far) : near_(near), far_(far) {
+namespace {
+
+// Sends every record back until the other end closes. Only system calls:
+// safe in a child forked from a process with threads.
+void echoLoop(int fd, uint8_t* buf, size_t size) {
+    for (;;) {
+        const ssize_t n = ::recv(fd, buf, size, 0);
+        if (n <= 0) {
+            if (n < 0 && errno == EINTR) continue;
+            return;  // the near end closed
+        }
+        if (::send(fd, buf, static_cast<size_t>(n), MSG_NOSIGNAL) != n) return;
+    }
+}
+
+}  // namespace
+
+SeqpacketEcho::SeqpacketEcho(int near, int far, bool otherProcess) : near_(near), far_(far) {
+    if (otherProcess) {
+        std::vector<uint8_t> buf(1 << 20);  // before fork: the child may not allocate
+        child_ = ::fork();
+        if (child_ == 0) {
+            echoLoop(far_, buf.data(), buf.size());
+            ::_exit(0);
+        }
+        sock::CloseFd(far_);  // the child's now
+        far_ = -1;
+        return;
+    }
     thread_ = std::thread([fd = far_] {
         std::vector<uint8_t> buf(1 << 20);
-        for (;;) {
-            const ssize_t n = ::recv(fd, buf.data(), buf.size(), 0);
-            if (n <= 0) {
-                if (n < 0 && errno == EINTR) continue;
-                return;  // the near end closed
-            }
-            if (::send(fd, buf.data(), static_cast<size_t>(n), MSG_NOSIGNAL) != n) return;
-        }
+        echoLoop(fd, buf.data(), buf.size());
     });
 }
 
 SeqpacketEcho::~SeqpacketEcho() {
-    (void)::shutdown(near_, SHUT_RDWR);  // wakes the echo thread with end of stream
-    thread_.join();
+    (void)::shutdown(near_, SHUT_RDWR);  // wakes the echo with end of stream
+    if (thread_.joinable()) thread_.join();
+    if (child_ > 0) {
+        int status;
+        while (::waitpid(child_, &status, 0) < 0 && errno == EINTR) {
+        }
+    }
     sock::CloseFd(near_);
     sock::CloseFd(far_);
 }

@@ -55,22 +55,26 @@ bool SetThreadCpus(const std::vector<int>& cpus, std::string* why);
 // from their creator).
 bool SetProcessCpus(pid_t pid, const std::vector<int>& cpus, std::string* why);
 
-// A SOCK_SEQPACKET socket pair with a thread that sends every record back.
+// A SOCK_SEQPACKET socket pair whose far end sends every record back: from a
+// thread of this process, or from a child process (`otherProcess`), which
+// pays what any server process pays per hop, the switch of address space.
+// The child inherits the calling thread's CPU placement.
 class SeqpacketEcho {
 public:
-    static std::unique_ptr<SeqpacketEcho> start(std::string* why);
+    static std::unique_ptr<SeqpacketEcho> start(std::string* why, bool otherProcess = false);
     // Sends `bytes` and waits for the echo into `reply`.
     bool roundTrip(const std::vector<uint8_t>& bytes, std::vector<uint8_t>* reply);
 
-    SeqpacketEcho(int near, int far);
+    SeqpacketEcho(int near, int far, bool otherProcess);
     ~SeqpacketEcho();
     SeqpacketEcho(const SeqpacketEcho&) = delete;
     SeqpacketEcho& operator=(const SeqpacketEcho&) = delete;
 
 private:
     const int near_;
-    const int far_;
+    int far_;
     std::thread thread_;
+    pid_t child_ = -1;
 };
 
 }  // namespace tarn::conduit::harness

@@ -2,8 +2,9 @@
 // measured in the same run:
 //
 //   1. look-up of an existing container (command 0, no creation) against the
-//      bare SOCK_SEQPACKET echo of the same request record; rounds alternate
-//      back to back, pinned to one CPU and unpinned; medians and ratio;
+//      bare SOCK_SEQPACKET echo of the same request record by another process
+//      (as the daemon is one); rounds alternate back to back, pinned to one
+//      CPU and unpinned; medians and ratio;
 //   2. creation of containers (command 0 with "CreateIfNecessary") against the
 //      same file-system work done directly: staging mkdir, metadata written
 //      to a temporary file with fsync, renamed, staging directory fsynced,
@@ -85,7 +86,7 @@ double since(Clock::time_point t0) {
 void lookupLatency(const char* config, Client& daemon, const std::vector<uint8_t>& record,
                    int rounds, int ops) {
     std::string why;
-    auto echo = harness::SeqpacketEcho::start(&why);
+    auto echo = harness::SeqpacketEcho::start(&why, /*otherProcess=*/true);
     if (!echo) die("echo: " + why);
     const PlistValue lookup = request0("bench.lookup", false);
     std::vector<double> echoLat, daemonLat;

@@ -1,7 +1,9 @@
 // Request round trip: what Conduit and the daemon add on top of the socket.
 //
 //   (a) floor: the bytes of one encoded request record echoed over a bare
-//       SOCK_SEQPACKET socket pair by a thread;
+//       SOCK_SEQPACKET socket pair by another process: the daemon is one, and
+//       each hop to another process switches address space, which a thread
+//       of our own does not (that in-process echo is printed too, as "thread");
 //   (b) the same request ({"Command": 27}, answered with "ReplyError" 49)
 //       through a running tarnkeeperd in a scratch root;
 //   (c) for reference, the same request through an in-process Conduit
@@ -58,6 +60,7 @@ bool daemonAnswers(Client& client, std::string* why) {
 
 struct Result {
     double echoUs = 0;
+    double threadEchoUs = 0;
     double conduitUs = 0;
     double daemonUs = 0;
     bool daemon = false;
@@ -75,29 +78,37 @@ void timeRequests(Client& client, int ops, std::vector<double>* lat) {
     }
 }
 
-Result measure(harness::SeqpacketEcho& echo, Client& conduitEcho, Client* daemon,
-               const std::vector<uint8_t>& record, int rounds, int ops) {
-    std::vector<double> echoLat, conduitLat, daemonLat;
+void timeEcho(harness::SeqpacketEcho& echo, const std::vector<uint8_t>& record, int ops,
+              std::vector<double>* lat) {
     std::vector<uint8_t> back;
-    std::string why;
-    for (int r = 0; r < rounds; ++r) {
-        for (int i = 0; i < ops; ++i) {
-            const auto t0 = Clock::now();
-            if (!echo.roundTrip(record, &back)) {
-                std::fprintf(stderr, "echo failed\n");
-                std::exit(1);
-            }
-            echoLat.push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+    for (int i = 0; i < ops; ++i) {
+        const auto t0 = Clock::now();
+        if (!echo.roundTrip(record, &back)) {
+            std::fprintf(stderr, "echo failed\n");
+            std::exit(1);
         }
+        lat->push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+    }
+}
+
+Result measure(harness::SeqpacketEcho& echo, harness::SeqpacketEcho& threadEcho,
+               Client& conduitEcho, Client* daemon, const std::vector<uint8_t>& record,
+               int rounds, int ops) {
+    std::vector<double> echoLat, threadLat, conduitLat, daemonLat;
+    for (int r = 0; r < rounds; ++r) {
+        timeEcho(echo, record, ops, &echoLat);
+        timeEcho(threadEcho, record, ops, &threadLat);
         timeRequests(conduitEcho, ops, &conduitLat);
         if (daemon) timeRequests(*daemon, ops, &daemonLat);
     }
-    return {medianUs(echoLat), medianUs(conduitLat), medianUs(daemonLat), daemon != nullptr};
+    return {medianUs(echoLat), medianUs(threadLat), medianUs(conduitLat), medianUs(daemonLat),
+            daemon != nullptr};
 }
 
 void report(const char* config, const Result& r) {
-    std::printf("%-9s (a) echo %7.2f us | (c) conduit echo %7.2f us (x%.2f)", config, r.echoUs,
-                r.conduitUs, r.echoUs > 0 ? r.conduitUs / r.echoUs : 0.0);
+    std::printf("%-9s (a) echo %6.2f us (thread %5.2f) | (c) conduit echo %6.2f us (x%.2f)",
+                config, r.echoUs, r.threadEchoUs, r.conduitUs,
+                r.echoUs > 0 ? r.conduitUs / r.echoUs : 0.0);
     if (r.daemon)
         std::printf(" | (b) daemon %7.2f us  ratio b/a %.2f\n", r.daemonUs,
                     r.echoUs > 0 ? r.daemonUs / r.echoUs : 0.0);
@@ -183,18 +194,20 @@ int main(int argc, char** argv) {
             std::fprintf(stderr, "%s\n", why.c_str());
         if (client && !harness::SetProcessCpus(daemon->pid(), {all.front()}, &why))
             std::fprintf(stderr, "%s\n", why.c_str());
-        auto echo = harness::SeqpacketEcho::start(&why);
-        if (!echo) return 1;
-        measure(*echo, *conduitEcho, client.get(), record, 1, ops);  // warm-up
-        report("pinned", measure(*echo, *conduitEcho, client.get(), record, rounds, ops));
+        auto echo = harness::SeqpacketEcho::start(&why, /*otherProcess=*/true);
+        auto threadEcho = harness::SeqpacketEcho::start(&why);
+        if (!echo || !threadEcho) return 1;
+        measure(*echo, *threadEcho, *conduitEcho, client.get(), record, 1, ops);  // warm-up
+        report("pinned", measure(*echo, *threadEcho, *conduitEcho, client.get(), record, rounds, ops));
     }
     {
         (void)harness::SetProcessCpus(::getpid(), all, &why);  // back to every CPU we had
         if (client) (void)harness::SetProcessCpus(daemon->pid(), all, &why);
-        auto echo = harness::SeqpacketEcho::start(&why);
-        if (!echo) return 1;
-        measure(*echo, *conduitEcho, client.get(), record, 1, ops);
-        report("unpinned", measure(*echo, *conduitEcho, client.get(), record, rounds, ops));
+        auto echo = harness::SeqpacketEcho::start(&why, /*otherProcess=*/true);
+        auto threadEcho = harness::SeqpacketEcho::start(&why);
+        if (!echo || !threadEcho) return 1;
+        measure(*echo, *threadEcho, *conduitEcho, client.get(), record, 1, ops);
+        report("unpinned", measure(*echo, *threadEcho, *conduitEcho, client.get(), record, rounds, ops));
     }
 
     client.reset();
