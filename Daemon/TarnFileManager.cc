@@ -1,5 +1,7 @@
 #include "Daemon/TarnFileManager.h"
 
+#include <sys/stat.h>
+
 #include <atomic>
 #include <cerrno>
 #include <cstring>
@@ -75,11 +77,13 @@ bool containsMetadataName(const std::string& path) {
 // Setting a class while locked fails where the platform's does: when the
 // item is or becomes class 1 (complete protection), whose keys are gone.
 int setProtectionClassChecked(int fd, int32_t newClass) {
-    if (LockStateDeviceIsLocked()) {
-        int32_t current = 0;
-        if (int err = FsGetProtectionClass(fd, &current)) return err;
-        if (current == kCompleteProtectionClass || newClass == kCompleteProtectionClass) return EPERM;
-    }
+    // The lock state is asked only when class 1 may be involved: reading it
+    // opens a file, and new directories (most calls) have no class yet.
+    int32_t current = 0;
+    const int getErr = FsGetProtectionClass(fd, &current);
+    const bool mayBeRefused =
+        getErr != 0 || current == kCompleteProtectionClass || newClass == kCompleteProtectionClass;
+    if (mayBeRefused && LockStateDeviceIsLocked()) return getErr ? getErr : EPERM;
     return FsSetProtectionClass(fd, newClass);
 }
 
@@ -332,6 +336,16 @@ bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermed
     if (auto fp = TARN_FAILPOINT("fm.createDirectory")) {
         setError(error, TARN_POSIX_ERROR(*fp, "mkdir of %s failed: %s", url, errText(*fp)));
         return false;
+    }
+    if (dataProtectionClass == kTarnDataProtectionClassUnchanged) {
+        // The daemon's own directories are asked for on every creation and
+        // nearly always exist as asked: one lstat instead of mkdir, stat, open
+        // and chown. Anything else (missing, a link, another owner) takes the
+        // full path below.
+        struct stat st;
+        if (::lstat(url.c_str(), &st) == 0 && S_ISDIR(st.st_mode) &&
+            (owner == 0 || (st.st_uid == owner && st.st_gid == owner)))
+            return true;
     }
     if (withIntermediateDirectories) {
         int err = FsMakePath(url, mode);
