@@ -14,6 +14,7 @@
 #include <cstring>
 #include <fstream>
 #include <memory>
+#include <optional>
 #include <sstream>
 
 #include "Platform/Format.h"
@@ -46,7 +47,8 @@ uint64_t bootTicksNow() {
 
 bool SendRecord(int fd, const uint8_t* data, size_t size, std::chrono::milliseconds timeout,
                 std::string* why) {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    // Set by the first full buffer: a send that goes through reads no clock.
+    std::optional<std::chrono::steady_clock::time_point> deadline;
     for (;;) {
         const ssize_t n = ::send(fd, data, size, MSG_NOSIGNAL | MSG_DONTWAIT);
         if (n == static_cast<ssize_t>(size)) return true;
@@ -61,7 +63,8 @@ bool SendRecord(int fd, const uint8_t* data, size_t size, std::chrono::milliseco
             return false;
         }
         struct pollfd p = {fd, POLLOUT, 0};
-        const int64_t left = remainingMs(deadline);
+        if (!deadline) deadline = std::chrono::steady_clock::now() + timeout;
+        const int64_t left = remainingMs(*deadline);
         if (left == 0) {
             if (why) *why = "peer does not read its messages";
             return false;
