@@ -12,11 +12,6 @@ namespace {
 constexpr const char* kInitTag = "initWithUserIdentity";
 constexpr const char* kConcreteInitTag = "initWithUUID";
 
-std::optional<PlistValue> identifierValue(const std::optional<std::string>& identifier) {
-    if (!identifier) return std::nullopt;
-    return PlistValue(*identifier);
-}
-
 }  // namespace
 
 TarnContainerIdentity::TarnContainerIdentity(PrivateTag, TarnUserIdentityRef userIdentity,
@@ -26,24 +21,17 @@ TarnContainerIdentity::TarnContainerIdentity(PrivateTag, TarnUserIdentityRef use
       containerClass_(containerClass),
       userIdentity_(std::move(userIdentity)) {}
 
-bool TarnContainerIdentity::validate(const TarnUserIdentityRef& userIdentity,
-                                     const PlistValue* identifier,
-                                     TarnContainerClass containerClass, std::string* identifierOut,
-                                     uint64_t* error) {
+bool TarnContainerIdentity::validateText(const TarnUserIdentityRef& userIdentity,
+                                         bool hasIdentifier, TarnContainerClass containerClass,
+                                         uint64_t* error) {
     if (!userIdentity) {
         TarnLog(kLogError, kInitTag, "Invalid object: no user identity");
         TarnSetError(error, TarnErrorInvalidArgument);
         return false;
     }
-    if (!identifier || identifier->isNull()) {
+    if (!hasIdentifier) {
         TarnLog(kLogError, kInitTag, "Invalid object: missing identifier");
         TarnSetError(error, TarnErrorMissingIdentifier);
-        return false;
-    }
-    const std::string* text = identifier->asString();
-    if (!text) {
-        TarnLog(kLogError, kInitTag, "Invalid object: identifier = [%@]", *identifier);
-        TarnSetError(error, TarnErrorInvalidArgument);
         return false;
     }
     if (!TarnContainerClassIsValid(containerClass)) {
@@ -51,6 +39,22 @@ bool TarnContainerIdentity::validate(const TarnUserIdentityRef& userIdentity,
         TarnSetError(error, TarnErrorInvalidArgument);
         return false;
     }
+    return true;
+}
+
+bool TarnContainerIdentity::validate(const TarnUserIdentityRef& userIdentity,
+                                     const PlistValue* identifier,
+                                     TarnContainerClass containerClass, std::string* identifierOut,
+                                     uint64_t* error) {
+    const bool present = identifier && !identifier->isNull();
+    if (!userIdentity || !present) return validateText(userIdentity, present, containerClass, error);
+    const std::string* text = identifier->asString();
+    if (!text) {
+        TarnLog(kLogError, kInitTag, "Invalid object: identifier = [%@]", *identifier);
+        TarnSetError(error, TarnErrorInvalidArgument);
+        return false;
+    }
+    if (!validateText(userIdentity, true, containerClass, error)) return false;
     *identifierOut = *text;
     return true;
 }
@@ -67,9 +71,10 @@ TarnContainerIdentityRef TarnContainerIdentity::containerIdentityWithUserIdentit
 TarnContainerIdentityRef TarnContainerIdentity::containerIdentityWithUserIdentity(
     TarnUserIdentityRef userIdentity, std::optional<std::string> identifier,
     TarnContainerClass containerClass, uint64_t* error) {
-    auto value = identifierValue(identifier);
-    return containerIdentityWithUserIdentity(std::move(userIdentity), value ? &*value : nullptr,
-                                             containerClass, error);
+    // Text already: checked and moved in without a property-list detour.
+    if (!validateText(userIdentity, identifier.has_value(), containerClass, error)) return nullptr;
+    return std::make_shared<const TarnContainerIdentity>(PrivateTag{}, std::move(userIdentity),
+                                                         std::move(*identifier), containerClass);
 }
 
 TarnContainerIdentityRef TarnContainerIdentity::initWithUserIdentity(
@@ -142,11 +147,14 @@ TarnConcreteContainerIdentityRef TarnConcreteContainerIdentity::containerIdentit
 TarnConcreteContainerIdentityRef TarnConcreteContainerIdentity::containerIdentityWithUUID(
     std::optional<Uuid> uuid, TarnUserIdentityRef userIdentity,
     std::optional<std::string> identifier, TarnContainerClass containerClass, uint64_t* error) {
-    auto idValue = identifierValue(identifier);
-    std::optional<PlistValue> uuidValue;
-    if (uuid) uuidValue = PlistValue(*uuid);
-    return containerIdentityWithUUID(uuidValue ? &*uuidValue : nullptr, std::move(userIdentity),
-                                     idValue ? &*idValue : nullptr, containerClass, error);
+    if (!validateText(userIdentity, identifier.has_value(), containerClass, error)) return nullptr;
+    if (!uuid) {
+        TarnLog(kLogError, kConcreteInitTag, "Invalid object: uuid = [%@]", "(null)");
+        TarnSetError(error, TarnErrorInvalidArgument);
+        return nullptr;
+    }
+    return std::make_shared<const TarnConcreteContainerIdentity>(
+        PrivateTag{}, *uuid, std::move(userIdentity), std::move(*identifier), containerClass);
 }
 
 TarnConcreteContainerIdentityRef TarnConcreteContainerIdentity::initWithUUID(

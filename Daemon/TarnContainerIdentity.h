@@ -71,6 +71,9 @@ public:
                           TarnContainerClass containerClass);
 
 protected:
+    // The checks of validate() for an identifier that is text or absent.
+    static bool validateText(const TarnUserIdentityRef& userIdentity, bool hasIdentifier,
+                             TarnContainerClass containerClass, uint64_t* error);
     // Runs the checks of the base identity; on success fills the outputs.
     static bool validate(const TarnUserIdentityRef& userIdentity, const PlistValue* identifier,
                          TarnContainerClass containerClass, std::string* identifierOut,
