@@ -34,6 +34,18 @@ uint32_t sandboxUserForClass(const TarnUserIdentityRef& userIdentity, TarnContai
     return TarnContainerClassIsSystem(c) ? 0 : userIdentity->posixUIDForContainerClass(c);
 }
 
+// PathJoin(container, the metadata file name) in a buffer of the calling
+// thread: every lookup checks that file, and a lookup should not allocate.
+// Valid until the thread's next call.
+const FileURL& metadataFileURL(std::string_view container) {
+    thread_local FileURL buffer;
+    buffer.assign(container);
+    while (buffer.size() > 1 && buffer.back() == '/') buffer.pop_back();
+    if (buffer.empty() || buffer.back() != '/') buffer.push_back('/');
+    buffer.append(kTarnMetadataFileName);
+    return buffer;
+}
+
 TarnErrorRef exceptionError(const char* function, int line, const std::exception* e) {
     return TarnErrorMake(
         function, line, TarnErrorException, nullptr, true,
@@ -101,6 +113,50 @@ std::string TarnContainerCache::_cacheKeyForUserIdentity(const TarnUserIdentityR
     return name;
 }
 
+TarnContainerCache::CacheKeyParts TarnContainerCache::_cacheKeyPartsForUserIdentity(
+    const TarnUserIdentityRef& userIdentity, TarnContainerClass containerClass) {
+    const char* shortName = TarnContainerClassShortName(containerClass);
+    CacheKeyParts parts;
+    parts.shortName = shortName ? shortName : "(null)";
+    parts.perUser = TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass);
+    if (parts.perUser)
+        parts.userIdentifier = userIdentity ? std::string_view(userIdentity->identifier()) : "(null)";
+    return parts;
+}
+
+namespace {
+
+// FNV-1a, fed piece by piece so that the parts of a key hash like its text.
+constexpr uint64_t kFnvOffset = 14695981039346656037ull;
+constexpr uint64_t kFnvPrime = 1099511628211ull;
+uint64_t fnv(uint64_t h, std::string_view bytes) {
+    for (unsigned char c : bytes) h = (h ^ c) * kFnvPrime;
+    return h;
+}
+
+}  // namespace
+
+size_t TarnContainerCache::CacheKeyHash::operator()(std::string_view key) const {
+    return static_cast<size_t>(fnv(kFnvOffset, key));
+}
+
+size_t TarnContainerCache::CacheKeyHash::operator()(const CacheKeyParts& key) const {
+    if (!key.perUser) return static_cast<size_t>(fnv(kFnvOffset, key.shortName));
+    uint64_t h = fnv(kFnvOffset, "[");
+    h = fnv(h, key.userIdentifier);
+    h = fnv(h, "]-");
+    return static_cast<size_t>(fnv(h, key.shortName));
+}
+
+bool TarnContainerCache::CacheKeyEqual::operator()(const CacheKeyParts& a,
+                                                   std::string_view b) const {
+    if (!a.perUser) return b == a.shortName;
+    const size_t user = a.userIdentifier.size();
+    return b.size() == user + 3 + a.shortName.size() && b.front() == '[' &&
+           b.substr(1, user) == a.userIdentifier && b.substr(1 + user, 2) == "]-" &&
+           b.substr(3 + user) == a.shortName;
+}
+
 bool TarnContainerCache::containerURL(const FileURL& url,
                                       TarnContainerClass isValidForContainerClass) const {
     // The last component without a copy: a rebuild asks this of every entry.
@@ -128,10 +184,12 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
 TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
     const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
     bool populateSandboxCache, bool buildCache, TarnErrorRef* error) {
-    const std::string key = _cacheKeyForUserIdentity(userIdentity, contentClass);
     auto& dictionaries = transient ? transientContainerCache_ : liveContainerCache_;
-    if (auto it = dictionaries.find(key); it != dictionaries.end()) return it->second;
+    if (auto it = dictionaries.find(_cacheKeyPartsForUserIdentity(userIdentity, contentClass));
+        it != dictionaries.end())
+        return it->second;
     if (!buildCache) return nullptr;
+    const std::string key = _cacheKeyForUserIdentity(userIdentity, contentClass);
 
     TarnLog(kLogNotice, __func__, "Rebuilding container class cache: %@%@", key,
             transientMarker(transient));
@@ -244,19 +302,17 @@ bool TarnContainerCache::_shouldRegister(const TarnUserIdentityRef& userIdentity
         case TarnContainerClassConduitServiceData:
         case TarnContainerClassDaemonData:
         case TarnContainerClassTempDir: {
-            std::string owner = identifier;
-            // A plug-in's data follows the personas of the application that carries it.
+            // A plug-in's data follows the personas of the application that
+            // carries it. No copy of the identifier: a rebuild asks this of
+            // every container.
             if ((containerClass == TarnContainerClassPluginData ||
                  containerClass == TarnContainerClassVPNPluginData) &&
                 codeSigningMapping_) {
                 std::string p = codeSigningMapping_->parentIdentifierForChildIdentifier(identifier);
-                if (!p.empty()) {
-                    parent = p;
-                    owner = p;
-                }
+                if (!p.empty()) parent = std::move(p);
             }
             TarnUserIdentitySet owners =
-                userIdentityCache_.userIdentitiesForBundleIdentifier(owner);
+                userIdentityCache_.userIdentitiesForBundleIdentifier(parent ? *parent : identifier);
             TarnUserIdentityRef personal = userIdentityCache_.userIdentityForPersonalPersona();
             if (owners.size() >= 2 && personal && owners.count(personal)) {
                 isMulti = true;
@@ -442,7 +498,8 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
     const TarnUserIdentityRef& userIdentity = identity->userIdentity();
     const TarnContainerClass containerClass = identity->containerClass();
     const std::string& identifier = identity->identifier();
-    const std::string key = _cacheKeyForUserIdentity(userIdentity, containerClass);
+    // Only errors and debug lines show the key: a hit builds no text.
+    auto key = [&] { return _cacheKeyForUserIdentity(userIdentity, containerClass); };
     const char* marker = transientMarker(transient);
 
     TarnMetadataRef metadata;
@@ -477,7 +534,7 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
             if (it == dictionary->end()) {
                 if (error)
                     *error = TARN_ERROR(TarnErrorNotFound, nullptr,
-                                        "Cache: %@%@: Container Not Found with ID: %@", key, marker,
+                                        "Cache: %@%@: Container Not Found with ID: %@", key(), marker,
                                         identifier);
                 return nullptr;
             }
@@ -488,17 +545,17 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
     if (metadata->url().empty() || metadata->url()[0] != '/') {
         if (error)
             *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr,
-                                "Cache: %@%@: Invalid URL path string: %@", key, marker,
+                                "Cache: %@%@: Invalid URL path string: %@", key(), marker,
                                 metadata->url());
         return nullptr;
     }
-    const FileURL metadataFile = PathJoin(metadata->url(), kTarnMetadataFileName);
-    if (!TarnFileManager::defaultManager().itemExistsAtURL(metadataFile)) {
+    if (!TarnFileManager::defaultManager().itemExistsAtURL(metadataFileURL(metadata->url()))) {
+        const FileURL metadataFile = PathJoin(metadata->url(), kTarnMetadataFileName);
         if (error)
             *error =
                 TARN_ERROR(TarnErrorCacheInconsistent, nullptr,
                            "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu",
-                           key, marker, metadataFile, identifier, containerClass);
+                           key(), marker, metadataFile, identifier, containerClass);
         TarnErrorRef removeError;
         if (!removeContainerForUserIdentity(userIdentity, containerClass, identifier, transient,
                                             &removeError)) {
@@ -508,7 +565,9 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
         }
         return nullptr;
     }
-    TarnLog(kLogDebug, __func__, "Cache: %@%@: Found Identifier: %@", key, marker, identifier);
+    if (TarnLogShouldWrite(kLogDebug))
+        TarnLog(kLogDebug, __func__, "Cache: %@%@: Found Identifier: %@", key(), marker,
+                identifier);
     return metadata;
 }
 

@@ -38,6 +38,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 #include <vector>
 
@@ -155,6 +156,28 @@ class TarnContainerCache : public TarnUserIdentityCacheObserver,
     static std::string _cacheKeyForUserIdentity(const TarnUserIdentityRef& userIdentity,
                                                 TarnContainerClass containerClass);
 
+    // The same key as its parts, so that a lookup finds its dictionary
+    // without building the text: it hashes and compares like the text
+    // _cacheKeyForUserIdentity makes. Views into the identity; do not keep.
+    struct CacheKeyParts {
+        std::string_view userIdentifier;
+        std::string_view shortName;
+        bool perUser = false;
+    };
+    static CacheKeyParts _cacheKeyPartsForUserIdentity(const TarnUserIdentityRef& userIdentity,
+                                                       TarnContainerClass containerClass);
+    struct CacheKeyHash {
+        using is_transparent = void;
+        size_t operator()(std::string_view key) const;
+        size_t operator()(const CacheKeyParts& key) const;
+    };
+    struct CacheKeyEqual {
+        using is_transparent = void;
+        bool operator()(std::string_view a, std::string_view b) const { return a == b; }
+        bool operator()(const CacheKeyParts& a, std::string_view b) const;
+        bool operator()(std::string_view a, const CacheKeyParts& b) const { return (*this)(b, a); }
+    };
+
     // ---- Test access ----
     // Class directories scanned so far.
     uint64_t TEST_rebuildCount() const { return rebuildCount_.load(); }
@@ -200,10 +223,10 @@ class TarnContainerCache : public TarnUserIdentityCacheObserver,
     std::atomic<uint64_t> kernelHitCount_{0};
 
     mutable Mutex cacheLock_;
-    std::unordered_map<std::string, TarnContainerClassCacheRef> liveContainerCache_
-        GUARDED_BY(cacheLock_);
-    std::unordered_map<std::string, TarnContainerClassCacheRef> transientContainerCache_
-        GUARDED_BY(cacheLock_);
+    using ClassCacheMap =
+        std::unordered_map<std::string, TarnContainerClassCacheRef, CacheKeyHash, CacheKeyEqual>;
+    ClassCacheMap liveContainerCache_ GUARDED_BY(cacheLock_);
+    ClassCacheMap transientContainerCache_ GUARDED_BY(cacheLock_);
 };
 
 }  // namespace tarn

@@ -127,6 +127,32 @@ TEST_F(TarnContainerCacheTest, MetadataDeletedBehindTheDaemonGives44ThenNotFound
     EXPECT_TRUE(itemsOf(*state_, 501).empty()) << "the stale mapping is withdrawn";
 }
 
+// A lookup finds its dictionary by the key's parts; should they hash or
+// compare unlike the key's text, every lookup would rescan its class.
+TEST_F(TarnContainerCacheTest, KeyPartsHashAndCompareLikeTheKeyText) {
+    auto enterprise = TarnUserIdentity::initWithUID(502, 502, root_.at("/private/var/mobile"),
+                                                    "A1B2-persona", TarnPersonaTypeEnterprise, 1001);
+    ASSERT_TRUE(enterprise);
+    const TarnContainerCache::CacheKeyHash hash;
+    const TarnContainerCache::CacheKeyEqual equal;
+    std::vector<std::string> keys;
+    for (const TarnUserIdentityRef& user : {mobile(), enterprise, TarnUserIdentityRef()}) {
+        for (TarnContainerClass c = 0; c <= 14; ++c) {
+            const std::string text = TarnContainerCache::_cacheKeyForUserIdentity(user, c);
+            const auto parts = TarnContainerCache::_cacheKeyPartsForUserIdentity(user, c);
+            EXPECT_EQ(hash(parts), hash(text)) << text;
+            EXPECT_TRUE(equal(parts, text)) << text;
+            EXPECT_TRUE(equal(text, parts)) << text;
+            for (const std::string& other : keys) {
+                if (other == text) continue;  // global classes: one key for every user
+                EXPECT_FALSE(equal(parts, other)) << text << " vs " << other;
+            }
+            keys.push_back(text);
+        }
+    }
+    EXPECT_EQ(TarnContainerCache::_cacheKeyForUserIdentity(enterprise, 2), "[A1B2-persona]-appData");
+}
+
 TEST_F(TarnContainerCacheTest, RebuildKeepsTheLastOfTwoDirectoriesClaimingOneIdentifier) {
     makeContainer(2, "com.ostrea.twice");
     makeContainer(2, "com.ostrea.twice");
