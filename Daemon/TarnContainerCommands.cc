@@ -87,12 +87,16 @@ TarnUserIdentityRef userIdentityForContainerIdentifier(const TarnClientConnectio
                                                        TarnContainerClass containerClass,
                                                        uint64_t* error) {
     TarnUserIdentityRef own = clientUserIdentity(connection);
+    // A caller without a specific persona acts for whichever persona the
+    // application belongs to; global containers have no persona to choose.
+    const bool choosePersona =
+        own && own->isNoSpecificPersona() && TarnContainerClassIsPerUser(containerClass);
+    // Otherwise the caller's own identity is the one candidate: no set needed.
+    if (own && !choosePersona) return own;
     TarnUserIdentitySet candidates;
     if (own) candidates.insert(own);
 
-    // A caller without a specific persona acts for whichever persona the
-    // application belongs to; global containers have no persona to choose.
-    if (own && own->isNoSpecificPersona() && TarnContainerClassIsPerUser(containerClass)) {
+    if (choosePersona) {
         std::optional<std::string> bundleIdentifier = identifier;
         if (containerClass == TarnContainerClassPluginData ||
             containerClass == TarnContainerClassVPNPluginData) {
@@ -174,8 +178,8 @@ TarnContainerIdentityRef validatedContainerIdentity(const PlistValue& request,
     TarnUserIdentityRef user =
         userIdentityForContainerIdentifier(connection, identifier, containerClass, error);
     if (!user) return nullptr;
-    return TarnContainerIdentity::containerIdentityWithUserIdentity(user, identifier,
-                                                                    containerClass, error);
+    return TarnContainerIdentity::containerIdentityWithUserIdentity(
+        std::move(user), std::move(identifier), containerClass, error);
 }
 
 TarnConcreteContainerIdentityRef concreteContainerIdentity(const PlistValue& request,
