@@ -493,6 +493,49 @@ class Reader {
 
     const char* why() const { return why_; }
 
+    // The root dictionary's entries (see PlistBinaryRootEntries): the root
+    // half of parse() for a dictionary, keys kept as views. Every value goes
+    // through parse() with the root open at depth 0, so nesting, cycles and
+    // the expansion budget are checked as for the whole tree.
+    bool runRootEntries(PlistEntries* entries) {
+        if (n_ < kHeaderBytes + kTrailerBytes || std::memcmp(p_, "bplist00", 8) != 0) return false;
+        const uint8_t* trailer = p_ + n_ - kTrailerBytes;
+        offsetSize_ = trailer[6];
+        refSize_ = trailer[7];
+        count_ = bigEndian(trailer + 8, 8);
+        const uint64_t root = bigEndian(trailer + 16, 8);
+        tableAt_ = bigEndian(trailer + 24, 8);
+        const uint64_t trailerAt = n_ - kTrailerBytes;
+        if (offsetSize_ == 0 || offsetSize_ > 8 || refSize_ == 0 || refSize_ > 8) return false;
+        if (count_ == 0 || root >= count_) return false;
+        if (tableAt_ < kHeaderBytes || tableAt_ >= trailerAt ||
+            count_ > (trailerAt - tableAt_) / offsetSize_)
+            return false;
+        budget_ = n_ + kExtraValueBudget;
+
+        --budget_;  // the root itself, as parse() counts it
+        path_[0] = root;
+        uint64_t at;
+        if (!objectAt(root, &at)) return false;
+        const uint8_t marker = p_[at];
+        if ((marker >> 4) != 0xD) return false;
+        uint64_t cursor = at + 1;
+        uint64_t n;
+        if (!count(marker, &cursor, &n)) return false;
+        if (n > (tableAt_ - cursor) / refSize_ / 2) return false;
+        const uint8_t* keys = p_ + cursor;
+        const uint8_t* values = keys + n * refSize_;
+        for (uint64_t i = 0; i < n; ++i) {
+            std::string_view key;
+            if (!dictKeyView(bigEndian(keys + i * refSize_, refSize_), &key)) return false;
+            for (const auto& entry : *entries)
+                if (entry.first == key) return false;
+            PlistValue& value = entries->emplace_back(key, PlistValue()).second;
+            if (!parse(bigEndian(values + i * refSize_, refSize_), 1, value)) return false;
+        }
+        return true;
+    }
+
   private:
     std::nullopt_t refuse(const char* why) {
         if (!why_) why_ = why;
@@ -676,6 +719,24 @@ class Reader {
         return string(p_[at], at + 1, out);
     }
 
+    // dictKey() for a one-byte text key, as a view; false for anything else.
+    bool dictKeyView(uint64_t index, std::string_view* out) {
+        uint64_t at;
+        if (!objectAt(index, &at)) return false;
+        if ((p_[at] >> 4) != 0x5) return false;
+        if (budget_ == 0) return fail("property list expands into too many values");
+        --budget_;
+        uint64_t cursor = at + 1;
+        uint64_t length;
+        if (!count(p_[at], &cursor, &length)) return false;
+        if (!fits(cursor, length)) return fail("string out of bounds");
+        const uint8_t* s = p_ + cursor;
+        for (uint64_t i = 0; i < length; ++i)
+            if (s[i] == 0 || s[i] >= 0x80) return false;
+        *out = std::string_view(reinterpret_cast<const char*>(s), length);
+        return true;
+    }
+
     bool string(uint8_t marker, uint64_t cursor, std::string* out) {
         uint64_t length;
         if (!count(marker, &cursor, &length)) return false;
@@ -758,6 +819,15 @@ std::optional<PlistValue> parseBinary(const uint8_t* bytes, size_t length, std::
 }
 
 }  // namespace
+
+bool PlistBinaryRootEntries(const void* bytes, size_t length, PlistEntries* entries) {
+    entries->clear();
+    if (length == 0 || length > kMaxPlistBytes) return false;
+    Reader reader(static_cast<const uint8_t*>(bytes), length);
+    if (reader.runRootEntries(entries)) return true;
+    entries->clear();
+    return false;
+}
 
 bool PlistIsValidUtf8(std::string_view s) {
     size_t i = 0, n = s.size();

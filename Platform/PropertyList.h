@@ -17,6 +17,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <variant>
 #include <vector>
 
@@ -128,6 +129,18 @@ private:
                  PlistDate, Uuid, PlistArray, PlistDict>
         v_;
 };
+
+// The entries of a binary property list's root dictionary, decoded without
+// the dictionary itself: for readers of many small files who look at a few
+// keys each. Keys are views into the bytes, which must outlive them; values
+// are parsed exactly as fromBytes parses them, with the same checks, so an
+// answer here is the dictionary fromBytes would give, in file order. False
+// whenever fromBytes would refuse the bytes, and also for what only it
+// handles: another format, a root that is not a dictionary, a key that is not
+// one-byte text, a key given twice. The caller then asks fromBytes.
+// `entries` is cleared first; its capacity is kept, so that it can be reused.
+using PlistEntries = std::vector<std::pair<std::string_view, PlistValue>>;
+bool PlistBinaryRootEntries(const void* bytes, size_t length, PlistEntries* entries);
 
 // True when `s` is well-formed UTF-8: no overlong forms, no surrogates, nothing
 // past U+10FFFF.
