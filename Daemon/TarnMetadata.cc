@@ -53,6 +53,18 @@ TarnMetadata::TarnMetadata(const TarnConcreteContainerIdentityRef& containerIden
       userManagedAssetsDirName_(std::move(userManagedAssetsDirName)),
       info_(std::move(info)) {}
 
+TarnMetadata::TarnMetadata(FieldsTag, TarnContainerClass containerClass,
+                           TarnUserIdentityRef userIdentity, std::string identifier,
+                           const Uuid& uuid, std::optional<PlistValue> info, FileURL url,
+                           std::optional<std::string> userManagedAssetsDirName)
+    : containerClass_(containerClass),
+      userIdentity_(std::move(userIdentity)),
+      identifier_(std::move(identifier)),
+      uuid_(uuid),
+      url_(std::move(url)),
+      userManagedAssetsDirName_(std::move(userManagedAssetsDirName)),
+      info_(std::move(info)) {}
+
 TarnMutableMetadataRef TarnMetadata::initWithContainerIdentity(
     const TarnConcreteContainerIdentityRef& containerIdentity, std::optional<PlistValue> info,
     FileURL url, std::optional<std::string> userManagedAssetsDirName) {
@@ -158,34 +170,79 @@ TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataInClassDirectory(
     return metadata;
 }
 
+// The decoded root entries of a metadata file: either a list of entries or,
+// when the whole dictionary had to be built, that dictionary.
+struct TarnMetadata::ParsedFields {
+    PlistEntries* entries = nullptr;
+    PlistValue* dict = nullptr;
+
+    PlistValue* find(std::string_view key) const {
+        if (dict) {
+            PlistDict& d = *dict->asDict();
+            auto it = d.find(key);
+            return it == d.end() ? nullptr : &it->second;
+        }
+        for (auto& [name, value] : *entries)
+            if (name == key) return &value;
+        return nullptr;
+    }
+};
+
 TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& bytes,
                                               MetadataLocation where,
                                               const TarnUserIdentityRef& forUserIdentity,
                                               bool checkClassPath, TarnErrorRef* error) {
+    // A rebuild reads thousands of these files: their few entries are decoded
+    // into this thread's reused list, without a dictionary. Anything that
+    // reader leaves alone (and the debug line, which shows the whole
+    // dictionary) takes the general reader, whose refusals name the file.
+    thread_local PlistEntries entries;
+    if (readError == 0 && !PlatformLogVerbose() &&
+        PlistBinaryRootEntries(bytes.data(), bytes.size(), &entries)) {
+        ParsedFields fields{&entries, nullptr};
+        auto metadata = validateFields(fields, std::move(where), forUserIdentity, checkClassPath,
+                                       error);
+        entries.clear();  // the keys point into `bytes`
+        return metadata;
+    }
+
+    std::optional<PlistValue> dictionary;
+    if (readError == 0) dictionary = PlistValue::fromBytes(bytes.data(), bytes.size());
+    if (!dictionary || !dictionary->isDict()) {
+        if (error)
+            *error = TARN_ERROR(TarnErrorReadFailed, nullptr, "Failed to read metadata at URL %@",
+                                where.fileURL());
+        return nullptr;
+    }
+    ParsedFields fields{nullptr, &*dictionary};
+    return validateFields(fields, std::move(where), forUserIdentity, checkClassPath, error);
+}
+
+TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, MetadataLocation where,
+                                                    const TarnUserIdentityRef& forUserIdentity,
+                                                    bool checkClassPath, TarnErrorRef* error) {
     auto fail = [error](TarnErrorRef e) -> TarnMutableMetadataRef {
         if (error) *error = std::move(e);
         return nullptr;
     };
     // Only a failure names the file, so only a failure pays for its path.
     auto fileURL = [&where] { return where.fileURL(); };
+    // The debug lines show the whole dictionary, when there is one.
+    const bool showDictionary = fields.dict && PlatformLogVerbose();
 
-    std::optional<PlistValue> dictionary;
-    if (readError == 0) dictionary = PlistValue::fromBytes(bytes.data(), bytes.size());
-    if (!dictionary || !dictionary->isDict()) {
-        return fail(TARN_ERROR(TarnErrorReadFailed, nullptr, "Failed to read metadata at URL %@",
-                               fileURL()));
-    }
-    PlistValue& dict = *dictionary;
-
-    const PlistValue* identifierValue = dict.find(kTarnMetadataIdentifierKey);
+    const PlistValue* identifierValue = fields.find(kTarnMetadataIdentifierKey);
     if (!identifierValue || !identifierValue->isString()) {
         return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                "Invalid metadata Identifier: %@ at %@", describe(identifierValue),
                                fileURL()));
     }
-    std::string identifier = *identifierValue->asString();
+    // The parsed tree is ours and not shared: take the identifier out of it
+    // unless the debug line at the end is going to show the whole dictionary.
+    std::string identifier = showDictionary
+                                 ? *identifierValue->asString()
+                                 : std::move(const_cast<std::string&>(*identifierValue->asString()));
 
-    const PlistValue* uuidValue = dict.find(kTarnMetadataUUIDKey);
+    const PlistValue* uuidValue = fields.find(kTarnMetadataUUIDKey);
     if (!uuidValue || !uuidValue->isString()) {
         return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                "Invalid metadata UUID String: %@ at %@", describe(uuidValue),
@@ -197,7 +254,7 @@ TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& 
                                *uuidValue->asString(), fileURL()));
     }
 
-    const PlistValue* classValue = dict.find(kTarnMetadataContentClassKey);
+    const PlistValue* classValue = fields.find(kTarnMetadataContentClassKey);
     if (!classValue || !classValue->isNumber()) {
         return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                "Invalid metadata Class: %@ at %@", describe(classValue),
@@ -219,17 +276,16 @@ TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& 
         if (!forUserIdentity) {
             return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                    "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
-                                   describe(dict.find(kTarnMetadataUserIdentityKey)), "(null)",
+                                   describe(fields.find(kTarnMetadataUserIdentityKey)), "(null)",
                                    identifier, fileURL(), uint64_t{TarnSuccess}));
         }
         const uint32_t expectedUID = forUserIdentity->posixUIDForContainerClass(containerClass);
-        const PlistValue* persona = dict.find(kTarnMetadataPersonaKey);
+        const PlistValue* persona = fields.find(kTarnMetadataPersonaKey);
         if (TarnContainerClassIsPerUser(containerClass)) {
             if (!persona) {
                 // Absent means the expected user (see below); only the debug
                 // line needs to show it filled in.
-                if (PlatformLogVerbose())
-                    dict.set(kTarnMetadataPersonaKey, PlistValue(expectedUID));
+                if (showDictionary) fields.dict->set(kTarnMetadataPersonaKey, PlistValue(expectedUID));
             } else if (persona->asUInt64() != std::optional<uint64_t>(expectedUID) ||
                        !persona->isInteger()) {
                 return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
@@ -237,7 +293,7 @@ TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& 
                                        persona->description(), expectedUID, identifier, fileURL()));
             }
         }
-        const PlistValue* stored = dict.find(kTarnMetadataUserIdentityKey);
+        const PlistValue* stored = fields.find(kTarnMetadataUserIdentityKey);
         if (!stored) {
             // Written before identities were stored: the owner's uid is all we have.
             const uint32_t uid = persona ? static_cast<uint32_t>(persona->asUInt64().value_or(0))
@@ -266,21 +322,21 @@ TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& 
     }
 
     std::optional<PlistValue> info;
-    if (const PlistValue* infoValue = dict.find(kTarnMetadataInfoKey)) {
+    if (const PlistValue* infoValue = fields.find(kTarnMetadataInfoKey)) {
         if (!infoValue->isDict()) {
             return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                    "Invalid metadata Info: %@ at %@", *infoValue, fileURL()));
         }
         // The parsed tree is ours: move the info out unless the debug line below
         // is going to show the whole dictionary.
-        if (PlatformLogVerbose())
+        if (showDictionary)
             info = *infoValue;
         else
-            info = std::move(dict.asDict()->find(kTarnMetadataInfoKey)->second);
+            info = std::move(*fields.find(kTarnMetadataInfoKey));
     }
 
     std::optional<std::string> userManagedAssetsDirName;
-    if (const PlistValue* name = dict.find(kTarnMetadataUserManagedAssetsDirNameKey)) {
+    if (const PlistValue* name = fields.find(kTarnMetadataUserManagedAssetsDirNameKey)) {
         if (!name->isString()) {
             return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                    "Invalid metadata User Managed Dir Name String: %@ at %@", *name,
@@ -301,18 +357,22 @@ TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& 
         }
     }
 
-    uint64_t code = TarnSuccess;
-    auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-        *uuid, owner, std::move(identifier), containerClass, &code);
-    if (!identity) {
+    // Identifier and class are checked above, so only a missing owner can
+    // fail the identity; the factory then reports it (log line and code) as
+    // ever. A good file needs no identity object, only its fields.
+    if (!owner) {
+        uint64_t code = TarnSuccess;
+        (void)TarnConcreteContainerIdentity::containerIdentityWithUUID(
+            *uuid, owner, std::move(identifier), containerClass, &code);
         return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                "Could not create user identity from %@: %llu", fileURL(), code));
     }
     auto metadata = std::make_shared<TarnMetadata>(
-        identity, std::move(info), std::move(where.container), std::move(userManagedAssetsDirName));
-    if (PlatformLogVerbose())
+        FieldsTag{}, containerClass, std::move(owner), std::move(identifier), *uuid,
+        std::move(info), std::move(where.container), std::move(userManagedAssetsDirName));
+    if (showDictionary)
         PlatformLog("metadata", PlatformLogType::Debug, "[%s] Read metadata from [%@]: %@ <= %@",
-                    "readAndValidateMetadataAtFileUrl", fileURL(), *metadata, dict);
+                    "readAndValidateMetadataAtFileUrl", fileURL(), *metadata, *fields.dict);
     return metadata;
 }
 

@@ -48,11 +48,18 @@ inline constexpr const char* kTarnInfoCachedCodeSigningInfoKey =
 inline constexpr const char* kTarnInfoGroupContainerIDsKey = "com.ostrea.Pallet.GroupContainerIDs";
 
 class TarnMetadata {
+    struct FieldsTag {};
+
 public:
     // Copies user identity, UUID, class and identifier from `containerIdentity`.
     TarnMetadata(const TarnConcreteContainerIdentityRef& containerIdentity,
                  std::optional<PlistValue> info, FileURL url,
                  std::optional<std::string> userManagedAssetsDirName);
+    // The fields of an identity already checked (a metadata file read back):
+    // no identity object is made for them. For make_shared only.
+    TarnMetadata(FieldsTag, TarnContainerClass containerClass, TarnUserIdentityRef userIdentity,
+                 std::string identifier, const Uuid& uuid, std::optional<PlistValue> info,
+                 FileURL url, std::optional<std::string> userManagedAssetsDirName);
     static TarnMutableMetadataRef initWithContainerIdentity(
         const TarnConcreteContainerIdentityRef& containerIdentity, std::optional<PlistValue> info,
         FileURL url, std::optional<std::string> userManagedAssetsDirName);
@@ -120,6 +127,11 @@ private:
                                          MetadataLocation where,
                                          const TarnUserIdentityRef& forUserIdentity,
                                          bool checkClassPath, TarnErrorRef* error);
+  struct ParsedFields;
+  // The checks of validate() on the decoded entries; takes values out of them.
+  static TarnMutableMetadataRef validateFields(ParsedFields& fields, MetadataLocation where,
+                                               const TarnUserIdentityRef& forUserIdentity,
+                                               bool checkClassPath, TarnErrorRef* error);
 
   bool transient_ = false;
   bool existed_ = false;

@@ -178,6 +178,30 @@ TEST_F(TarnMetadataTest, EveryMalformedFieldRejectsTheContainer) {
     }
 }
 
+// Most files are decoded entry by entry; what that reader declines (here a
+// key that is not one-byte text) goes through the whole-tree reader and must
+// read the same.
+TEST_F(TarnMetadataTest, AFileTheEntriesReaderDeclinesReadsTheSame) {
+    PlistValue info(PlistDict{{kTarnInfoContentProtectionClassKey, PlistValue(uint64_t{3})}});
+    auto m = make(2, info);
+    PlistValue dict = m->dictionaryRepresentation();
+    for (bool declined : {false, true}) {
+        if (declined) dict.set("\xC3\x9Cnknown", PlistValue("x"));
+        writeDict(m->url(), dict);
+        std::vector<uint8_t> bytes = dict.toBinary();
+        PlistEntries entries;
+        ASSERT_EQ(PlistBinaryRootEntries(bytes.data(), bytes.size(), &entries), !declined);
+        TarnErrorRef error;
+        auto read = TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true, &error);
+        ASSERT_TRUE(read) << (error ? error->description() : "");
+        EXPECT_EQ(read->identifier(), m->identifier());
+        EXPECT_EQ(read->uuid(), m->uuid());
+        EXPECT_EQ(read->info(), info);
+        EXPECT_EQ(read->userManagedAssetsDirName(), "Assets");
+        EXPECT_TRUE(read->userIdentity()->isEqual(*mobile()));
+    }
+}
+
 TEST_F(TarnMetadataTest, OldFormatWithoutUserIdentity) {
     auto m = make(2);
     PlistValue dict = m->dictionaryRepresentation();
