@@ -314,8 +314,10 @@ void TarnLocks::_lock_all_identifiers(bool writing) {
         while (identifierWriterCount != 0 || allReaderWriterState == -1)
             globalReadersCondition.wait(mutex);
         ++allReaderWriterState;
-        globalReadIntervals.push_back(
-            std::make_unique<SignpostInterval>("locking", "GlobalReadLock"));
+        // Only when someone records signposts: every look-up takes this lock.
+        if (PlatformLogVerbose())
+            globalReadIntervals.push_back(
+                std::make_unique<SignpostInterval>("locking", "GlobalReadLock"));
     }
     TarnLog(kLogDebug, "_lock_all_identifiers", "Locked all identifiers for %s", mode);
 }
