@@ -34,17 +34,11 @@ TarnClientIdentity::TarnClientIdentity(std::string bundleIdentifier, uid_t UID, 
                                        std::shared_ptr<const TarnUserIdentity> userIdentity,
                                        PlistValue entitlements, bool sandboxed,
                                        TarnAuditToken auditToken, bool kernel)
-    : sandboxed_(sandboxed),
-      kernel_(kernel),
-      posixPID_(PID),
-      posixUID_(UID),
-      posixGID_(GID),
-      bundleIdentifier_(std::move(bundleIdentifier)),
-      entitlements_(entitlements.isDict()
-                        ? std::make_shared<const PlistValue>(std::move(entitlements))
-                        : emptyEntitlements()),
-      userIdentity_(std::move(userIdentity)),
-      auditToken_(auditToken) {}
+    : TarnClientIdentity(std::move(bundleIdentifier), UID, GID, PID, std::move(userIdentity),
+                         entitlements.isDict()
+                             ? std::make_shared<const PlistValue>(std::move(entitlements))
+                             : nullptr,
+                         sandboxed, auditToken, kernel) {}
 
 TarnClientIdentity::TarnClientIdentity(std::string bundleIdentifier, uid_t UID, gid_t GID,
                                        pid_t PID,
