@@ -18,7 +18,9 @@
 // Threads: a Listener's I/O threads read the sockets. Event handlers always
 // run as items of the connections' queues: on the I/O thread that read the
 // message when that queue is idle (no thread hand-off), otherwise on the
-// queue's own turn. All member functions are thread-safe.
+// queue's own turn. After such a request the thread waits on that peer for a
+// few tens of milliseconds, as a thread-per-client server would, while
+// others poll the rest. All member functions are thread-safe.
 #pragma once
 
 #include <sys/types.h>
