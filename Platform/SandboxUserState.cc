@@ -266,9 +266,17 @@ int FileSandboxUserState::_lock_recordChanges(uint32_t uid, const std::vector<Ch
     std::vector<uint8_t> bytes;
     for (const auto& [key, path] : changes)
         appendRecord(&bytes, std::get<0>(key), std::get<1>(key), std::get<2>(key), path);
-    if (int err = mkdirs(directory_, 0700); err != 0) return err;
     const FileURL journal = journalForUID(uid);
-    int fd = ::open(journal.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600);
+    auto openJournal = [&] {
+        return ::open(journal.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC | O_NOFOLLOW, 0600);
+    };
+    // The directory is made only when missing: an append is one open, not a
+    // mkdir per path component first.
+    int fd = openJournal();
+    if (fd < 0 && errno == ENOENT) {
+        if (int err = mkdirs(directory_, 0700); err != 0) return err;
+        fd = openJournal();
+    }
     if (fd < 0) return errno;
     int err = writeAll(fd, bytes);
     if (::close(fd) != 0 && err == 0) err = errno;

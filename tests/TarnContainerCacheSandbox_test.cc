@@ -149,6 +149,15 @@ TEST_F(SandboxUserStateTest, TheJournalIsFoldedIntoTheSnapshotAndATornTailIsIgno
     EXPECT_EQ(items(again, 501).front(), "1:com.j1:501=/new");
 }
 
+TEST_F(SandboxUserStateTest, AnAppendRemakesADirectoryThatWentAway) {
+    FileSandboxUserState state(dir());
+    ASSERT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.a", "/a"), 0);
+    fs::remove_all(dir());  // the run directory was cleared under the daemon
+    ASSERT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.b", "/b"), 0);
+    FileSandboxUserState restarted(dir());
+    EXPECT_EQ(items(restarted, 501), std::vector<std::string>{"1:com.b:501=/b"});
+}
+
 TEST_F(SandboxUserStateTest, MalformedStateFilesCountAsEmpty) {
     fs::create_directories(dir());
     std::ofstream(PathJoin(dir(), "501.plist")) << "not a property list";
