@@ -497,7 +497,8 @@ class Reader {
     // half of parse() for a dictionary, keys kept as views. Every value goes
     // through parse() with the root open at depth 0, so nesting, cycles and
     // the expansion budget are checked as for the whole tree.
-    bool runRootEntries(PlistEntries* entries) {
+    bool runRootEntries(PlistEntries* entries, std::string_view inlineKey,
+                        PlistEntries* inlined) {
         if (n_ < kHeaderBytes + kTrailerBytes || std::memcmp(p_, "bplist00", 8) != 0) return false;
         const uint8_t* trailer = p_ + n_ - kTrailerBytes;
         offsetSize_ = trailer[6];
@@ -531,8 +532,43 @@ class Reader {
             for (const auto& entry : *entries)
                 if (entry.first == key) return false;
             PlistValue& value = entries->emplace_back(key, PlistValue()).second;
-            if (!parse(bigEndian(values + i * refSize_, refSize_), 1, value)) return false;
+            const uint64_t ref = bigEndian(values + i * refSize_, refSize_);
+            if (inlined && key == inlineKey) {
+                if (!inlineEntries(ref, &value, inlined)) return false;
+            } else if (!parse(ref, 1, value)) {
+                return false;
+            }
         }
+        return true;
+    }
+
+    // A root value that, when it is a dictionary, is decoded like the root:
+    // its entries go to `inlined` and `value` is left an empty dictionary.
+    // The depth, budget and cycle checks are parse()'s for a value at depth 1.
+    bool inlineEntries(uint64_t index, PlistValue* value, PlistEntries* inlined) {
+        uint64_t at;
+        if (!objectAt(index, &at)) return false;
+        const uint8_t marker = p_[at];
+        if ((marker >> 4) != 0xD) return parse(index, 1, *value);
+        if (budget_ == 0) return fail("property list expands into too many values");
+        --budget_;
+        if (path_[0] == index) return fail("object reference cycle");
+        path_[1] = index;
+        uint64_t cursor = at + 1;
+        uint64_t n;
+        if (!count(marker, &cursor, &n)) return false;
+        if (n > (tableAt_ - cursor) / refSize_ / 2) return fail("dictionary out of bounds");
+        const uint8_t* keys = p_ + cursor;
+        const uint8_t* values = keys + n * refSize_;
+        for (uint64_t i = 0; i < n; ++i) {
+            std::string_view key;
+            if (!dictKeyView(bigEndian(keys + i * refSize_, refSize_), &key)) return false;
+            for (const auto& entry : *inlined)
+                if (entry.first == key) return false;
+            PlistValue& nested = inlined->emplace_back(key, PlistValue()).second;
+            if (!parse(bigEndian(values + i * refSize_, refSize_), 2, nested)) return false;
+        }
+        *value = PlistValue(PlistDict());
         return true;
     }
 
@@ -821,11 +857,18 @@ std::optional<PlistValue> parseBinary(const uint8_t* bytes, size_t length, std::
 }  // namespace
 
 bool PlistBinaryRootEntries(const void* bytes, size_t length, PlistEntries* entries) {
+    return PlistBinaryRootEntries(bytes, length, entries, {}, nullptr);
+}
+
+bool PlistBinaryRootEntries(const void* bytes, size_t length, PlistEntries* entries,
+                            std::string_view inlineKey, PlistEntries* inlined) {
     entries->clear();
+    if (inlined) inlined->clear();
     if (length == 0 || length > kMaxPlistBytes) return false;
     Reader reader(static_cast<const uint8_t*>(bytes), length);
-    if (reader.runRootEntries(entries)) return true;
+    if (reader.runRootEntries(entries, inlineKey, inlined)) return true;
     entries->clear();
+    if (inlined) inlined->clear();
     return false;
 }
 

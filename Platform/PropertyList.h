@@ -141,6 +141,12 @@ private:
 // `entries` is cleared first; its capacity is kept, so that it can be reused.
 using PlistEntries = std::vector<std::pair<std::string_view, PlistValue>>;
 bool PlistBinaryRootEntries(const void* bytes, size_t length, PlistEntries* entries);
+// The same, and should the root map `inlineKey` to a dictionary, that
+// dictionary's entries are decoded into `inlined` the same way (views, file
+// order, false for a repeated key) and its root entry is an empty dictionary.
+// `inlined` is cleared first too.
+bool PlistBinaryRootEntries(const void* bytes, size_t length, PlistEntries* entries,
+                            std::string_view inlineKey, PlistEntries* inlined);
 
 // True when `s` is well-formed UTF-8: no overlong forms, no surrogates, nothing
 // past U+10FFFF.

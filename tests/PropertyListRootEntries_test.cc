@@ -141,5 +141,51 @@ TEST(PlistRootEntriesTest, RefusesWhatFromBytesRefuses) {
     }
 }
 
+// One key's dictionary decoded into a list of its own: the same values, the
+// root entry left an empty dictionary; the same refusals one level down.
+TEST(PlistRootEntriesTest, DecodesOneKeysDictionaryIntoASecondList) {
+    PlistDict identity{{"posixUID", PlistValue(uint32_t{501})}, {"version", PlistValue("2")}};
+    PlistDict d{{"Id", PlistValue(identity)},
+                {"Info", PlistValue(identity)},
+                {"Name", PlistValue("com.ostrea.some.long.identifier")}};
+    const std::vector<uint8_t> bytes = PlistValue(d).toBinary();
+    PlistEntries entries, inlined{{"left over", PlistValue(true)}};
+    ASSERT_TRUE(PlistBinaryRootEntries(bytes.data(), bytes.size(), &entries, "Id", &inlined));
+    ASSERT_EQ(entries.size(), 3u);
+    EXPECT_EQ(entries[0].second, PlistValue(PlistDict{}));
+    EXPECT_EQ(entries[1].second, PlistValue(identity)) << "only the named key";
+    ASSERT_EQ(inlined.size(), 2u);
+    EXPECT_EQ(inlined[0].first, "posixUID");
+    EXPECT_EQ(inlined[0].second, PlistValue(uint32_t{501}));
+    EXPECT_EQ(inlined[1].first, "version");
+    EXPECT_EQ(inlined[1].second, PlistValue("2"));
+
+    // Not a dictionary under that key: an ordinary entry, nothing inlined.
+    ASSERT_TRUE(PlistBinaryRootEntries(bytes.data(), bytes.size(), &entries, "Name", &inlined));
+    EXPECT_EQ(entries[2].second, PlistValue("com.ostrea.some.long.identifier"));
+    EXPECT_TRUE(inlined.empty());
+
+    // A nested key given twice declines; a nested reference back to the root
+    // is refused as fromBytes refuses it.
+    HandMadePlist twice;
+    const uint8_t id = twice.string("Id"), key = twice.string("k");
+    const uint8_t nested = twice.dict({{key, twice.integer(1)}, {key, twice.integer(2)}});
+    const auto twiceBytes = twice.bytes(twice.dict({{id, nested}}));
+    ASSERT_TRUE(PlistValue::fromBytes(twiceBytes.data(), twiceBytes.size()));
+    EXPECT_FALSE(PlistBinaryRootEntries(twiceBytes.data(), twiceBytes.size(), &entries, "Id",
+                                        &inlined));
+    EXPECT_TRUE(entries.empty() && inlined.empty());
+
+    HandMadePlist cycle;
+    const uint8_t cid = cycle.string("Id"), self = cycle.string("Self");
+    const uint8_t inner = cycle.add({});
+    const uint8_t root = cycle.dict({{cid, inner}});
+    cycle.replace(inner, {0xD1, self, root});
+    const auto cycleBytes = cycle.bytes(root);
+    EXPECT_FALSE(PlistValue::fromBytes(cycleBytes.data(), cycleBytes.size()));
+    EXPECT_FALSE(PlistBinaryRootEntries(cycleBytes.data(), cycleBytes.size(), &entries, "Id",
+                                        &inlined));
+}
+
 }  // namespace
 }  // namespace tarn
