@@ -175,6 +175,23 @@ TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataInClassDirectory(
 struct TarnMetadata::ParsedFields {
     PlistEntries* entries = nullptr;
     PlistValue* dict = nullptr;
+    // With `entries`: the stored user identity's own entries, when it is a
+    // dictionary (its root entry is then left empty).
+    const PlistEntries* identity = nullptr;
+
+    bool identityInlined(const PlistValue* stored) const {
+        return entries && stored && stored->isDict();
+    }
+    // The stored user identity as the whole-tree reader gives it, for the
+    // dictionary reader and for error lines.
+    const PlistValue* storedIdentity(PlistValue* scratch) {
+        const PlistValue* stored = find(kTarnMetadataUserIdentityKey);
+        if (!identityInlined(stored)) return stored;
+        PlistDict d;
+        for (const auto& [key, value] : *identity) d.emplace(key, value);
+        *scratch = PlistValue(std::move(d));
+        return scratch;
+    }
 
     PlistValue* find(std::string_view key) const {
         if (dict) {
@@ -196,13 +213,19 @@ TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& 
     // into this thread's reused list, without a dictionary. Anything that
     // reader leaves alone (and the debug line, which shows the whole
     // dictionary) takes the general reader, whose refusals name the file.
+    // The stored user identity's entries go to a list of their own, so that
+    // its numbers are read without a nested dictionary either.
     thread_local PlistEntries entries;
+    thread_local PlistEntries identity;
     if (readError == 0 && !PlatformLogVerbose() &&
-        PlistBinaryRootEntries(bytes.data(), bytes.size(), &entries)) {
-        ParsedFields fields{&entries, nullptr};
+        PlistBinaryRootEntries(bytes.data(), bytes.size(), &entries, kTarnMetadataUserIdentityKey,
+                               &identity)) {
+        ParsedFields fields{&entries, nullptr, &identity};
         auto metadata = validateFields(fields, std::move(where), forUserIdentity, checkClassPath,
                                        error);
-        entries.clear();  // the keys point into `bytes`
+        // The keys point into `bytes`.
+        entries.clear();
+        identity.clear();
         return metadata;
     }
 
@@ -274,9 +297,10 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
         owner = TarnUserIdentityCache::defaultUserIdentity();
     } else {
         if (!forUserIdentity) {
+            PlistValue scratch;
             return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                    "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
-                                   describe(fields.find(kTarnMetadataUserIdentityKey)), "(null)",
+                                   describe(fields.storedIdentity(&scratch)), "(null)",
                                    identifier, fileURL(), uint64_t{TarnSuccess}));
         }
         const uint32_t expectedUID = forUserIdentity->posixUIDForContainerClass(containerClass);
@@ -306,11 +330,16 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
             }
         } else {
             uint64_t code = TarnSuccess;
-            owner = TarnUserIdentity::userIdentityWithPlist(*stored, cache, &code);
+            PlistValue scratch;
+            if (!fields.identityInlined(stored) ||
+                !TarnUserIdentity::userIdentityWithEntries(*fields.identity, cache, &owner))
+                owner = TarnUserIdentity::userIdentityWithPlist(*fields.storedIdentity(&scratch),
+                                                                cache, &code);
             if (!owner) {
                 return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                        "Invalid metadata User Identity: %@ for %@ at %@: %llu",
-                                       *stored, identifier, fileURL(), code));
+                                       *fields.storedIdentity(&scratch), identifier, fileURL(),
+                                       code));
             }
             if (!owner->isEqualToUserIdentity(*forUserIdentity)) {
                 return fail(

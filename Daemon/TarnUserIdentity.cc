@@ -145,6 +145,27 @@ TarnUserIdentityRef TarnUserIdentity::userIdentityWithPlist(const PlistValue& pl
     return initWithPlist(plist, cache, error);
 }
 
+bool TarnUserIdentity::userIdentityWithEntries(const PlistEntries& entries,
+                                               TarnUserIdentityCache& cache,
+                                               TarnUserIdentityRef* identity) {
+    const PlistValue *version = nullptr, *uid = nullptr, *gid = nullptr, *type = nullptr;
+    for (const auto& [key, value] : entries) {
+        if (key == "version") version = &value;
+        else if (key == "posixUID") uid = &value;
+        else if (key == "posixGID") gid = &value;
+        else if (key == "type") type = &value;
+    }
+    const std::string* versionString = version ? version->asString() : nullptr;
+    if (!versionString || *versionString != "2") return false;
+    auto u = storedUInt32(uid), g = storedUInt32(gid), t = storedUInt32(type);
+    // An enterprise type may name its persona by its unique string: that
+    // reading, and every refusal, stays with the dictionary reader.
+    if (!u || !g || !t || *t > TarnPersonaTypeUnspecific || *t == TarnPersonaTypeEnterprise)
+        return false;
+    *identity = cache.userIdentityForPersonalPersonaWithUID(*u, *g);
+    return true;
+}
+
 TarnUserIdentityRef TarnUserIdentity::initWithPlist(const PlistValue& plist,
                                                     TarnUserIdentityCache& cache, uint64_t* error) {
     const PlistValue* version = plist.isDict() ? plist.find("version") : nullptr;

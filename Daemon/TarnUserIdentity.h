@@ -71,6 +71,14 @@ public:
     static TarnUserIdentityRef userIdentityWithPlist(const PlistValue& plist,
                                                      TarnUserIdentityCache& cache,
                                                      uint64_t* error);
+    // The common case of userIdentityWithPlist() for a stored identity whose
+    // entries were decoded as a list (a metadata rebuild): a well-formed
+    // version-2 identity that is not enterprise, answered as that would
+    // (nullptr when the cache knows none; its code would be TarnSuccess).
+    // False, with *identity untouched, for anything else: the caller then
+    // asks userIdentityWithPlist(), which reads or reports it.
+    static bool userIdentityWithEntries(const PlistEntries& entries, TarnUserIdentityCache& cache,
+                                        TarnUserIdentityRef* identity);
     static TarnUserIdentityRef initWithPlist(const PlistValue& plist, TarnUserIdentityCache& cache,
                                              uint64_t* error);
     static TarnUserIdentityRef initWithVersion1PlistDictionary(const PlistValue& plist,

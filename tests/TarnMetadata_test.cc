@@ -155,6 +155,13 @@ TEST_F(TarnMetadataTest, EveryMalformedFieldRejectsTheContainer) {
         {kTarnMetadataPersonaKey, PlistValue(uint64_t{502}), "Incorrect UserId"},
         {kTarnMetadataUserIdentityKey, PlistValue(PlistDict{{"version", PlistValue("3")}}),
          "Invalid metadata User Identity"},
+        // The line shows the stored dictionary, however the file was decoded.
+        {kTarnMetadataUserIdentityKey,
+         PlistValue(PlistDict{{"posixGID", PlistValue(uint64_t{501})},
+                              {"posixUID", PlistValue("501")},
+                              {"type", PlistValue(uint64_t{0})},
+                              {"version", PlistValue("2")}}),
+         "posixGID"},
         {kTarnMetadataInfoKey, PlistValue(PlistArray{}), "Invalid metadata Info"},
         {kTarnMetadataUserManagedAssetsDirNameKey, PlistValue(uint64_t{5}),
          "Invalid metadata User Managed Dir Name String"},
