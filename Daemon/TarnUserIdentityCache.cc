@@ -1,5 +1,6 @@
 #include "Daemon/TarnUserIdentityCache.h"
 
+#include <atomic>
 #include <cstdio>
 #include <cstdlib>
 #include <set>
@@ -565,15 +566,25 @@ void TarnUserIdentityCache::TEST_drainFlushQueue() { flushQueue_->sync([] {}); }
 // ---- Shared instance ----
 
 TarnUserIdentitySharedCache& TarnUserIdentitySharedCache::sharedInstance() {
+    // The instance for the root prefix in use, with that prefix: read without
+    // the lock, since every request asks for it twice.
+    struct Current {
+        TarnUserIdentitySharedCache* cache;
+        std::string root;
+    };
+    static std::atomic<const Current*> current{nullptr};
+    if (const Current* c = current.load(std::memory_order_acquire); c && c->root == RootPrefix())
+        return *c->cache;
     static std::mutex lock;
     // Never freed: references handed out under an earlier root stay valid, and
     // nothing is torn down at exit while other threads may still use it.
-    static auto& root = *new std::string();
     static auto& made = *new std::vector<std::unique_ptr<TarnUserIdentitySharedCache>>();
+    static auto& currents = *new std::vector<std::unique_ptr<Current>>();
     std::lock_guard<std::mutex> guard(lock);
-    if (made.empty() || root != RootPrefix()) {
+    if (currents.empty() || currents.back()->root != RootPrefix()) {
         made.push_back(std::make_unique<TarnUserIdentitySharedCache>(PersonaRoster::sharedManager()));
-        root = RootPrefix();
+        currents.push_back(std::make_unique<Current>(Current{made.back().get(), RootPrefix()}));
+        current.store(currents.back().get(), std::memory_order_release);
     }
     return *made.back();
 }
