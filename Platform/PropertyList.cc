@@ -518,28 +518,11 @@ class Reader {
         path_[0] = root;
         uint64_t at;
         if (!objectAt(root, &at)) return false;
-        const uint8_t marker = p_[at];
-        if ((marker >> 4) != 0xD) return false;
-        uint64_t cursor = at + 1;
-        uint64_t n;
-        if (!count(marker, &cursor, &n)) return false;
-        if (n > (tableAt_ - cursor) / refSize_ / 2) return false;
-        const uint8_t* keys = p_ + cursor;
-        const uint8_t* values = keys + n * refSize_;
-        for (uint64_t i = 0; i < n; ++i) {
-            std::string_view key;
-            if (!dictKeyView(bigEndian(keys + i * refSize_, refSize_), &key)) return false;
-            for (const auto& entry : *entries)
-                if (entry.first == key) return false;
-            PlistValue& value = entries->emplace_back(key, PlistValue()).second;
-            const uint64_t ref = bigEndian(values + i * refSize_, refSize_);
-            if (inlined && key == inlineKey) {
-                if (!inlineEntries(ref, &value, inlined)) return false;
-            } else if (!parse(ref, 1, value)) {
-                return false;
-            }
-        }
-        return true;
+        if ((p_[at] >> 4) != 0xD) return false;
+        return dictEntries(at, entries, [&](std::string_view key, uint64_t ref, PlistValue& value) {
+            if (inlined && key == inlineKey) return inlineEntries(ref, &value, inlined);
+            return parse(ref, 1, value);
+        });
     }
 
     // A root value that, when it is a dictionary, is decoded like the root:
@@ -554,6 +537,20 @@ class Reader {
         --budget_;
         if (path_[0] == index) return fail("object reference cycle");
         path_[1] = index;
+        if (!dictEntries(at, inlined, [&](std::string_view, uint64_t ref, PlistValue& nested) {
+                return parse(ref, 2, nested);
+            }))
+            return false;
+        *value = PlistValue(PlistDict());
+        return true;
+    }
+
+    // The entries of the dictionary object at `at`, appended to `out` with
+    // keys as views; a repeated key declines. `decode(key, ref, value)`
+    // decodes each value into its entry.
+    template <class Decode>
+    bool dictEntries(uint64_t at, PlistEntries* out, Decode&& decode) {
+        const uint8_t marker = p_[at];
         uint64_t cursor = at + 1;
         uint64_t n;
         if (!count(marker, &cursor, &n)) return false;
@@ -563,12 +560,11 @@ class Reader {
         for (uint64_t i = 0; i < n; ++i) {
             std::string_view key;
             if (!dictKeyView(bigEndian(keys + i * refSize_, refSize_), &key)) return false;
-            for (const auto& entry : *inlined)
+            for (const auto& entry : *out)
                 if (entry.first == key) return false;
-            PlistValue& nested = inlined->emplace_back(key, PlistValue()).second;
-            if (!parse(bigEndian(values + i * refSize_, refSize_), 2, nested)) return false;
+            PlistValue& value = out->emplace_back(key, PlistValue()).second;
+            if (!decode(key, bigEndian(values + i * refSize_, refSize_), value)) return false;
         }
-        *value = PlistValue(PlistDict());
         return true;
     }
 
