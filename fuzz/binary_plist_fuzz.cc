@@ -15,38 +15,14 @@
 #include <vector>
 
 #include "Platform/PropertyList.h"
+#include "fuzz/PlistSame.h"
 
 namespace {
 
 bool same(const tarn::PlistValue& a, const tarn::PlistValue& b) {
-    using T = tarn::PlistValue::Type;
-    if (a.type() != b.type()) return false;
-    switch (a.type()) {
-        case T::Real: {
-            double x = *a.asReal(), y = *b.asReal();
-            return std::memcmp(&x, &y, sizeof x) == 0;
-        }
-        case T::Date: {
-            double x = a.asDate()->seconds, y = b.asDate()->seconds;
-            return x == y || x < 0 || x >= INT32_MAX || y < 0 || y >= INT32_MAX;
-        }
-        case T::Array: {
-            const auto &x = *a.asArray(), &y = *b.asArray();
-            if (x.size() != y.size()) return false;
-            for (size_t i = 0; i < x.size(); ++i)
-                if (!same(x[i], y[i])) return false;
-            return true;
-        }
-        case T::Dict: {
-            const auto &x = *a.asDict(), &y = *b.asDict();
-            if (x.size() != y.size()) return false;
-            for (auto i = x.begin(), j = y.begin(); i != x.end(); ++i, ++j)
-                if (i->first != j->first || !same(i->second, j->second)) return false;
-            return true;
-        }
-        default:
-            return a == b;
-    }
+    return tarn::fuzz::SamePlist(a, b, [](double x, double y) {
+        return x == y || x < 0 || x >= INT32_MAX || y < 0 || y >= INT32_MAX;
+    });
 }
 
 bool hasDateOrNaN(const tarn::PlistValue& v) {

@@ -15,40 +15,14 @@
 #include <vector>
 
 #include "Platform/PropertyList.h"
+#include "fuzz/PlistSame.h"
 
 namespace {
 // Both readers are ours and read the same bytes, so values must match to the
-// bit, NaN reals included. (Comparing written-out bytes instead is not
-// canonical: the writer may lay out equal values differently.)
+// bit, NaN reals and dates included. (Comparing written-out bytes instead is
+// not canonical: the writer may lay out equal values differently.)
 bool same(const tarn::PlistValue& a, const tarn::PlistValue& b) {
-    using T = tarn::PlistValue::Type;
-    if (a.type() != b.type()) return false;
-    switch (a.type()) {
-        case T::Real: {
-            const double x = *a.asReal(), y = *b.asReal();
-            return std::memcmp(&x, &y, sizeof x) == 0;
-        }
-        case T::Date: {
-            const double x = a.asDate()->seconds, y = b.asDate()->seconds;
-            return std::memcmp(&x, &y, sizeof x) == 0;
-        }
-        case T::Array: {
-            const auto &x = *a.asArray(), &y = *b.asArray();
-            if (x.size() != y.size()) return false;
-            for (size_t i = 0; i < x.size(); ++i)
-                if (!same(x[i], y[i])) return false;
-            return true;
-        }
-        case T::Dict: {
-            const auto &x = *a.asDict(), &y = *b.asDict();
-            if (x.size() != y.size()) return false;
-            for (auto i = x.begin(), j = y.begin(); i != x.end(); ++i, ++j)
-                if (i->first != j->first || !same(i->second, j->second)) return false;
-            return true;
-        }
-        default:
-            return a == b;
-    }
+    return tarn::fuzz::SamePlist(a, b, tarn::fuzz::SameBits);
 }
 }  // namespace
 
