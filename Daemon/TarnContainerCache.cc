@@ -159,17 +159,22 @@ bool TarnContainerCache::CacheKeyEqual::operator()(const CacheKeyParts& a,
 
 bool TarnContainerCache::containerURL(const FileURL& url,
                                       TarnContainerClass isValidForContainerClass) const {
-    // The last component without a copy: a rebuild asks this of every entry.
+    // The last component without a copy.
     std::string_view path = url;
     while (path.size() > 1 && path.back() == '/') path.remove_suffix(1);
     if (size_t slash = path.rfind('/'); slash != std::string_view::npos && path.size() > 1)
         path.remove_prefix(slash + 1);
-    if (Uuid::parse(path)) return true;
+    return containerName(path, isValidForContainerClass);
+}
+
+bool TarnContainerCache::containerName(std::string_view name,
+                                       TarnContainerClass isValidForContainerClass) {
+    if (Uuid::parse(name)) return true;
     if (isValidForContainerClass == TarnContainerClassSystemData)
-        return TarnWhitelist::sharedWhitelist().systemContainerIdIsWellknown(std::string(path));
+        return TarnWhitelist::sharedWhitelist().systemContainerIdIsWellknown(std::string(name));
     if (isValidForContainerClass == TarnContainerClassSystemGroup)
         return TarnWhitelist::sharedWhitelist().systemGroupContainerIdIsWellknown(
-            std::string(path));
+            std::string(name));
     return false;
 }
 
@@ -206,23 +211,51 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
                                 static_cast<int64_t>(contentClass));
         return nullptr;
     }
-    // Every metadata file is opened relative to the class directory, held
-    // open, so that the directory's own path is walked once, not once per
-    // container. Should it not open as a directory here (a link, say), the
-    // scan and every read take the full path.
+    auto dictionary = std::make_shared<TarnContainerClassCache>();
+    // One durable write of the sandbox state for the whole scan, not one per container.
+    SandboxUserState::Batch batch(sandboxUserState_);
     auto& fileManager = TarnFileManager::defaultManager();
     FsFd classDirectory;
-    std::vector<FileURL> entries;
+    auto take = [&](FileURL entry) {
+        // Not a container of ours when unreadable: the error is of no use here.
+        TarnMetadataRef metadata =
+            classDirectory
+                ? TarnMetadata::readAndValidateMetadataInClassDirectory(
+                      classDirectory, std::move(entry), userIdentity, true, nullptr)
+                : TarnMetadata::readAndValidateMetadataAtUrl(entry, userIdentity, true, nullptr);
+        if (!metadata) return;
+        const std::string& identifier = metadata->identifier();
+        if (populateSandboxCache && !transient &&
+            _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier,
+                                                               contentClass) &&
+            !_setSandboxContainerMapping(userIdentity, identifier, contentClass,
+                                         metadata->url().c_str())) {
+            TarnLog(kLogError, __func__,
+                    "Failed to set container mapping during create/lookup operation of %@, %llu",
+                    identifier, contentClass);
+        }
+        (*dictionary)[identifier] = std::move(metadata);
+    };
+    // Each entry is read as it is listed, relative to the class directory held
+    // open: the directory's own path is walked once, not once per container,
+    // and no list of every entry is kept. Should it not open as a directory
+    // here (a link, say), or the listing fail part way, the scan starts over
+    // with full paths and reports what fails.
     if (fileManager.openDirectoryAtURL(*directory, &classDirectory) == 0) {
+        dictionary->reserve(fileManager.subdirectoryCountHint(classDirectory));
         std::string prefix = PathJoin(*directory, "x");  // "<directory>/"
         prefix.pop_back();
         const int err =
             fileManager.forEachNameInDirectory(classDirectory, [&](std::string_view name) {
-                FileURL& entry = entries.emplace_back();
+                if (!containerName(name, contentClass)) return;
+                FileURL entry;
                 entry.reserve(prefix.size() + name.size());
-                entry.append(prefix).append(name);
+                take(std::move(entry.append(prefix).append(name)));
             });
-        if (err != 0) classDirectory = FsFd();  // the full listing below reports it
+        if (err != 0) {
+            classDirectory = FsFd();
+            dictionary->clear();
+        }
     }
     if (!classDirectory) {
         TarnErrorRef listError;
@@ -231,33 +264,8 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
             if (error) *error = listError;
             return nullptr;
         }
-        entries = std::move(*listed);
-    }
-
-    auto dictionary = std::make_shared<TarnContainerClassCache>();
-    dictionary->reserve(entries.size());
-    // One durable write of the sandbox state for the whole scan, not one per container.
-    SandboxUserState::Batch batch(sandboxUserState_);
-    for (FileURL& entry : entries) {
-        if (!containerURL(entry, contentClass)) continue;
-        // Not a container of ours when unreadable: the error is of no use here.
-        TarnMetadataRef metadata =
-            classDirectory
-                ? TarnMetadata::readAndValidateMetadataInClassDirectory(
-                      classDirectory, std::move(entry), userIdentity, true, nullptr)
-                : TarnMetadata::readAndValidateMetadataAtUrl(entry, userIdentity, true, nullptr);
-        if (!metadata) continue;
-        const std::string& identifier = metadata->identifier();
-        (*dictionary)[identifier] = metadata;
-        if (populateSandboxCache && !transient &&
-            _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier,
-                                                               contentClass) &&
-            !setSandboxContainerMappingForUserIdentity(userIdentity, identifier, contentClass,
-                                                       metadata->url())) {
-            TarnLog(kLogError, __func__,
-                    "Failed to set container mapping during create/lookup operation of %@, %llu",
-                    identifier, contentClass);
-        }
+        for (FileURL& entry : *listed)
+            if (containerURL(entry, contentClass)) take(std::move(entry));
     }
     dictionaries[key] = dictionary;
     interval.end(
@@ -311,14 +319,14 @@ bool TarnContainerCache::_shouldRegister(const TarnUserIdentityRef& userIdentity
                 std::string p = codeSigningMapping_->parentIdentifierForChildIdentifier(identifier);
                 if (!p.empty()) parent = std::move(p);
             }
-            TarnUserIdentitySet owners =
-                userIdentityCache_.userIdentitiesForBundleIdentifier(parent ? *parent : identifier);
             TarnUserIdentityRef personal = userIdentityCache_.userIdentityForPersonalPersona();
-            if (owners.size() >= 2 && personal && owners.count(personal)) {
+            const auto owners = userIdentityCache_.ownersOfBundleIdentifier(
+                parent ? *parent : identifier, userIdentity, personal);
+            if (owners.count >= 2 && personal && owners.includesSecond) {
                 isMulti = true;
                 decision = !userIdentity->isEnterprise();
             } else {
-                decision = owners.count(userIdentity) > 0;
+                decision = owners.includesFirst;
             }
             break;
         }
@@ -344,6 +352,14 @@ bool TarnContainerCache::_shouldRegister(const TarnUserIdentityRef& userIdentity
 bool TarnContainerCache::setSandboxContainerMappingForUserIdentity(
     const TarnUserIdentityRef& userIdentity, const std::string& identifier,
     TarnContainerClass containerClass, const std::optional<FileURL>& url) {
+    return _setSandboxContainerMapping(userIdentity, identifier, containerClass,
+                                       url ? url->c_str() : nullptr);
+}
+
+bool TarnContainerCache::_setSandboxContainerMapping(const TarnUserIdentityRef& userIdentity,
+                                                     const std::string& identifier,
+                                                     TarnContainerClass containerClass,
+                                                     const char* url) {
     if (TarnContainerClassIsBundle(containerClass)) return true;
     if (!TarnContainerClassIsValid(containerClass) || !userIdentity) {
         PlatformLog("sandbox", PlatformLogType::Error,
@@ -354,12 +370,12 @@ bool TarnContainerCache::setSandboxContainerMappingForUserIdentity(
     const uint32_t user = sandboxUserForClass(userIdentity, containerClass);
     const uint32_t persona = userIdentity->kernelPersonaID();
     const uint64_t itemType = TarnContainerClassSandboxItemType(containerClass);
-    const char* path = url ? url->c_str() : "(null)";
+    const char* path = url ? url : "(null)";
 
     // A push of what is recorded already (a rebuild after a restart) changes
     // nothing: skip the pair, but still log the push.
     if (!sandboxUserState_.userStateItemIsRecordedWithPersona(
-            user, persona, itemType, identifier.c_str(), url ? url->c_str() : nullptr)) {
+            user, persona, itemType, identifier.c_str(), url)) {
         // Clearing first drops any earlier path of this identifier; one batch
         // makes the pair one durable change.
         SandboxUserState::Batch batch(sandboxUserState_);
@@ -374,7 +390,7 @@ bool TarnContainerCache::setSandboxContainerMappingForUserIdentity(
         }
         if (url) {
             result = sandboxUserState_.setUserStateItemWithPersona(
-                user, persona, itemType, identifier.c_str(), url->c_str());
+                user, persona, itemType, identifier.c_str(), url);
             if (result != 0) {
                 PlatformLog("sandbox", PlatformLogType::Error,
                             "Failed to set mapping for user: %u, itemType: %llu, identifier %s, "

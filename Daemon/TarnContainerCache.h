@@ -142,6 +142,8 @@ class TarnContainerCache : public TarnUserIdentityCacheObserver,
     // Whether a directory entry can be a container of the class: a UUID name,
     // or a well-known name for the system classes.
     bool containerURL(const FileURL& url, TarnContainerClass isValidForContainerClass) const;
+    // The same, of the entry's name alone.
+    static bool containerName(std::string_view name, TarnContainerClass isValidForContainerClass);
 
     // ---- Invalidation ----
 
@@ -206,6 +208,11 @@ class TarnContainerCache : public TarnUserIdentityCacheObserver,
 
     bool _shouldRegister(const TarnUserIdentityRef& userIdentity, const std::string& identifier,
                          TarnContainerClass containerClass);
+    // setSandboxContainerMappingForUserIdentity with the path as it is held
+    // (nullptr: none), so that a rebuild copies no path to push it.
+    bool _setSandboxContainerMapping(const TarnUserIdentityRef& userIdentity,
+                                     const std::string& identifier,
+                                     TarnContainerClass containerClass, const char* url);
     TarnMetadataRef _containerForContainerIdentity(const TarnContainerIdentityRef& identity,
                                                    bool transient, bool updateSandbox,
                                                    bool allowKernelLookup, TarnErrorRef* error);

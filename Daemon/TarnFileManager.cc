@@ -566,6 +566,12 @@ int TarnFileManager::openDirectoryAtURL(const FileURL& url, FsFd* directory) {
     return FsOpenDirectory(url, directory);
 }
 
+uint64_t TarnFileManager::subdirectoryCountHint(const FsFd& directory) {
+    FsStat st;
+    if (!directory || FsStatAt(directory.get(), ".", &st) != 0 || st.nlink < 2) return 0;
+    return std::min<uint64_t>(st.nlink - 2, uint64_t{1} << 20);
+}
+
 int TarnFileManager::forEachNameInDirectory(const FsFd& directory,
                                             const std::function<void(std::string_view)>& each) {
     if (!directory) return EBADF;

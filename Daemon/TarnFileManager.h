@@ -188,6 +188,10 @@ public:
                             std::string* data);
     // The directory itself, not through a final link.
     int openDirectoryAtURL(const FileURL& url, FsFd* directory);
+    // How many subdirectories the open `directory` holds, as its link count
+    // tells; 0 where the file system does not count them. A hint for sizing,
+    // not a listing.
+    uint64_t subdirectoryCountHint(const FsFd& directory);
     // Names not starting with "." of the open `directory`, in directory order.
     int forEachNameInDirectory(const FsFd& directory,
                                const std::function<void(std::string_view name)>& each);

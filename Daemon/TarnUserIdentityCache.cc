@@ -464,10 +464,26 @@ TarnUserIdentitySet TarnUserIdentityCache::userIdentitiesForBundleIdentifier(
     return TarnUserIdentitySet{lock_userIdentityForPersonalPersona_};
 }
 
+TarnUserIdentityCache::BundleOwners TarnUserIdentityCache::ownersOfBundleIdentifier(
+    const std::string& bundleIdentifier, const TarnUserIdentityRef& first,
+    const TarnUserIdentityRef& second) {
+    const TarnRefEqual<TarnUserIdentity> same;
+    MutexLock guard(lock_);
+    _lock_ensureValid();
+    auto it = lock_bundleToEnterpriseIdentitiesMap_.find(bundleIdentifier);
+    if (it == lock_bundleToEnterpriseIdentitiesMap_.end()) {
+        const TarnUserIdentityRef& personal = lock_userIdentityForPersonalPersona_;
+        return {1, same(personal, first), same(personal, second)};
+    }
+    const TarnUserIdentitySet& owners = it->second;
+    return {owners.size(), owners.count(first) > 0, owners.count(second) > 0};
+}
+
 bool TarnUserIdentityCache::isBundleIdentifier(const std::string& bundleIdentifier,
                                                const TarnUserIdentityRef& associatedWithUserIdentity) {
     if (!personasAreSupported()) return true;
-    return userIdentitiesForBundleIdentifier(bundleIdentifier).count(associatedWithUserIdentity) > 0;
+    return ownersOfBundleIdentifier(bundleIdentifier, associatedWithUserIdentity, nullptr)
+        .includesFirst;
 }
 
 void TarnUserIdentityCache::forEachAccessibleUserIdentitySynchronouslyExecuteBlock(

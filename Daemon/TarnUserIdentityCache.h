@@ -80,6 +80,17 @@ public:
     // The identities an application belongs to; the personal one when no
     // persona lists it.
     TarnUserIdentitySet userIdentitiesForBundleIdentifier(const std::string& bundleIdentifier);
+    // What the sandbox registration rule asks of those identities, under one
+    // lock and without copying them: how many there are, and whether each of
+    // two given identities is among them.
+    struct BundleOwners {
+        size_t count = 0;
+        bool includesFirst = false;
+        bool includesSecond = false;
+    };
+    BundleOwners ownersOfBundleIdentifier(const std::string& bundleIdentifier,
+                                          const TarnUserIdentityRef& first,
+                                          const TarnUserIdentityRef& second);
     bool isBundleIdentifier(const std::string& bundleIdentifier,
                             const TarnUserIdentityRef& associatedWithUserIdentity);
     // Calls `block` once per known identity, outside the cache lock.
