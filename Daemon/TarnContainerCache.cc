@@ -159,12 +159,7 @@ bool TarnContainerCache::CacheKeyEqual::operator()(const CacheKeyParts& a,
 
 bool TarnContainerCache::containerURL(const FileURL& url,
                                       TarnContainerClass isValidForContainerClass) const {
-    // The last component without a copy.
-    std::string_view path = url;
-    while (path.size() > 1 && path.back() == '/') path.remove_suffix(1);
-    if (size_t slash = path.rfind('/'); slash != std::string_view::npos && path.size() > 1)
-        path.remove_prefix(slash + 1);
-    return containerName(path, isValidForContainerClass);
+    return containerName(PathLastComponentView(url), isValidForContainerClass);
 }
 
 bool TarnContainerCache::containerName(std::string_view name,
@@ -319,9 +314,13 @@ bool TarnContainerCache::_shouldRegister(const TarnUserIdentityRef& userIdentity
                 std::string p = codeSigningMapping_->parentIdentifierForChildIdentifier(identifier);
                 if (!p.empty()) parent = std::move(p);
             }
-            TarnUserIdentityRef personal = userIdentityCache_.userIdentityForPersonalPersona();
-            const auto owners = userIdentityCache_.ownersOfBundleIdentifier(
-                parent ? *parent : identifier, userIdentity, personal);
+            // The personal persona matters only to a bundle of several
+            // identities, which is rare: asked for then, and only then.
+            const std::string& bundle = parent ? *parent : identifier;
+            auto owners = userIdentityCache_.ownersOfBundleIdentifier(bundle, userIdentity, nullptr);
+            TarnUserIdentityRef personal;
+            if (owners.count >= 2 && (personal = userIdentityCache_.userIdentityForPersonalPersona()))
+                owners = userIdentityCache_.ownersOfBundleIdentifier(bundle, userIdentity, personal);
             if (owners.count >= 2 && personal && owners.includesSecond) {
                 isMulti = true;
                 decision = !userIdentity->isEnterprise();

@@ -160,7 +160,7 @@ TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataInClassDirectory(
     // bytes reuse this thread's buffers instead of allocating per file.
     thread_local std::string relative;
     thread_local std::string bytes;
-    relative.assign(PathLastComponent(url)).append("/").append(kTarnMetadataFileName);
+    relative.assign(PathLastComponentView(url)).append("/").append(kTarnMetadataFileName);
     int err = TarnFileManager::defaultManager().readDataInDirectory(classDirectory, relative,
                                                                     kMaxPlistBytes, &bytes);
     auto metadata = validate(err, bytes, MetadataLocation{std::move(url), nullptr}, forUserIdentity,

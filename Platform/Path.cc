@@ -14,11 +14,14 @@ std::string PathJoin(std::string_view base, std::string_view component) {
 }
 
 std::string PathLastComponent(std::string_view path) {
+    return std::string(PathLastComponentView(path));
+}
+
+std::string_view PathLastComponentView(std::string_view path) {
     while (path.size() > 1 && path.back() == '/') path.remove_suffix(1);
     auto pos = path.rfind('/');
-    if (pos == std::string_view::npos) return std::string(path);
-    if (path.size() == 1) return "/";
-    return std::string(path.substr(pos + 1));
+    if (pos == std::string_view::npos || path.size() == 1) return path;
+    return path.substr(pos + 1);
 }
 
 std::string PathParent(std::string_view path) {

@@ -13,6 +13,8 @@ using FileURL = std::string;
 
 std::string PathJoin(std::string_view base, std::string_view component);
 std::string PathLastComponent(std::string_view path);
+// The same as a view into `path`, for callers that only look at it.
+std::string_view PathLastComponentView(std::string_view path);
 std::string PathParent(std::string_view path);  // "/" for "/x"; "" for ""
 std::vector<std::string> PathComponents(std::string_view path);  // no empty components
 // Removes "." components, duplicate and trailing slashes; keeps "..".
