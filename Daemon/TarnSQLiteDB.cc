@@ -142,6 +142,8 @@ sqlite3* TarnSQLiteDB::openDBWithURL(const FileURL& url) {
 void TarnSQLiteDB::closeDB() {
     if (!db_) return;
     TarnLog(kLogDebug, "closeDB", "closing %@", url_);
+    if (selectEntry_) finalize(selectEntry_);
+    selectEntry_ = nullptr;
     int rc = sqlite3_close(db_);
     if (rc != SQLITE_OK) TarnLog(kLogError, "closeDB", "sqlite3_close for %@ failed: %d", url_, rc);
     db_ = nullptr;
@@ -434,8 +436,14 @@ std::shared_ptr<TarnCodeSigningEntry> TarnSQLiteDB::_selectCodeSigningEntryWithI
     const std::string& identifier, TarnErrorRef* error) {
     TarnErrorRef e;
     std::shared_ptr<TarnCodeSigningEntry> entry;
-    sqlite3_stmt* statement = nullptr;
-    if (!db_ || sqlite3_prepare_v2(db_, kSelectEntry, -1, &statement, nullptr) != SQLITE_OK) {
+    // Every request that checks entitlements asks this: the statement is
+    // compiled once and reset after each use.
+    if (db_ && !selectEntry_ &&
+        sqlite3_prepare_v3(db_, kSelectEntry, -1, SQLITE_PREPARE_PERSISTENT, &selectEntry_, nullptr) !=
+            SQLITE_OK)
+        selectEntry_ = nullptr;
+    sqlite3_stmt* statement = selectEntry_;
+    if (!statement) {
         e = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_, errmsg());
     } else if (sqlite3_bind_text(statement, 1, identifier.c_str(), -1, SQLITE_TRANSIENT) != SQLITE_OK) {
         e = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_bind_text for code_signing_id_text=%@ at %@ failed: %s",
@@ -448,7 +456,11 @@ std::shared_ptr<TarnCodeSigningEntry> TarnSQLiteDB::_selectCodeSigningEntryWithI
             e = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_step for %@ failed: %s", url_, errmsg());
         }
     }
-    if (statement) finalize(statement);
+    // Reset at once: a statement left mid-step would hold its read snapshot.
+    if (statement) {
+        sqlite3_reset(statement);
+        sqlite3_clear_bindings(statement);
+    }
     if (e && error) *error = e;
     return entry;
 }

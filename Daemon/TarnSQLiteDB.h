@@ -132,6 +132,8 @@ private:
     const FileURL url_;
     // Cleared by closeDB().
     sqlite3* db_ = nullptr;
+    // The compiled entry look-up, made on first use; finalized by closeDB().
+    sqlite3_stmt* selectEntry_ = nullptr;
 };
 
 }  // namespace tarn
