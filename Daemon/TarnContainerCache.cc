@@ -212,6 +212,7 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
     auto& fileManager = TarnFileManager::defaultManager();
     FsFd classDirectory;
     auto take = [&](FileURL entry) {
+        cacheLock_.assertHeld();  // called only from this function, lock held
         // Not a container of ours when unreadable: the error is of no use here.
         TarnMetadataRef metadata =
             classDirectory
