@@ -1,10 +1,12 @@
 #include "Platform/PropertyList.h"
 
 #include <plist/plist.h>
+#include <sys/random.h>
 #include <uuid/uuid.h>
 
 #include <algorithm>
 #include <array>
+#include <cerrno>
 #include <cmath>
 #include <cstring>
 
@@ -13,8 +15,23 @@ namespace tarn {
 // ---- Uuid ----
 
 Uuid Uuid::generate() {
+    // A version 4 UUID straight from the kernel's generator: one system call,
+    // where the library makes six (it mixes in process ids for a fallback
+    // generator we never need). Nothing is buffered, so a forked child never
+    // repeats its parent's UUIDs.
     Uuid u;
-    uuid_generate_random(u.bytes.data());
+    size_t got = 0;
+    while (got < u.bytes.size()) {
+        const ssize_t n = ::getrandom(u.bytes.data() + got, u.bytes.size() - got, 0);
+        if (n > 0) {
+            got += static_cast<size_t>(n);
+        } else if (n < 0 && errno != EINTR) {
+            uuid_generate_random(u.bytes.data());
+            return u;
+        }
+    }
+    u.bytes[6] = static_cast<uint8_t>((u.bytes[6] & 0x0F) | 0x40);  // version 4
+    u.bytes[8] = static_cast<uint8_t>((u.bytes[8] & 0x3F) | 0x80);  // RFC 4122 variant
     return u;
 }
 

@@ -1,10 +1,11 @@
 // Uuid::parse takes the text form exactly as uuid_parse does; the library is
-// the reference.
+// the reference. Uuid::generate makes random version 4 UUIDs.
 #include <gtest/gtest.h>
 #include <uuid/uuid.h>
 
 #include <cstring>
 #include <random>
+#include <set>
 #include <string>
 
 #include "Platform/PropertyList.h"
@@ -53,6 +54,25 @@ TEST(UuidParseTest, AcceptsAndRefusesWhatTheLibraryDoes) {
     std::string withNul = valid;
     withNul[5] = '\0';
     EXPECT_FALSE(Uuid::parse(withNul));
+}
+
+TEST(UuidGenerateTest, RandomVersionFourWithTheStandardVariantAndNoRepeats) {
+    std::set<std::string> seen;
+    int highBitsSet = 0;
+    for (int i = 0; i < 2000; ++i) {
+        const Uuid u = Uuid::generate();
+        ASSERT_EQ(u.bytes[6] >> 4, 4);
+        ASSERT_EQ(u.bytes[8] >> 6, 2);
+        // The library agrees on what it is.
+        EXPECT_EQ(uuid_type(u.bytes.data()), UUID_TYPE_DCE_RANDOM);
+        EXPECT_EQ(uuid_variant(u.bytes.data()), UUID_VARIANT_DCE);
+        ASSERT_TRUE(seen.insert(u.string()).second) << u.string();
+        highBitsSet += u.bytes[0] >> 7;
+    }
+    // The random bits are random: the top bit of the first byte is set about
+    // half the time (far outside this band means a constant or a stuck source).
+    EXPECT_GT(highBitsSet, 800);
+    EXPECT_LT(highBitsSet, 1200);
 }
 
 }  // namespace
