@@ -464,19 +464,21 @@ void Connection::setQoSFloor(QoS qos) {
     if (!resumed_ && !cancelled_) queue_->setTarget(DispatchQueue::global(qos));
 }
 
-void Connection::resume() {
+bool Connection::resume() {
     std::shared_ptr<Listener> listener;
     {
         MutexLock l(mu_);
-        if (resumed_ || cancelled_) return;
+        if (cancelled_) return false;
+        if (resumed_) return true;
         resumed_ = true;
         listener = listener_.lock();
     }
     if (!listener) {
-        cancel();
-        return;
+        cancel();  // resumed: the handler hears ConnectionInvalid
+        return true;
     }
     listener->io_->arm(fd_, serial_, true);
+    return true;
 }
 
 void Connection::cancel() {

@@ -139,7 +139,9 @@ public:
     void setEventHandler(std::function<void(const Event&)> handler);
     // Events run at least at this QoS. Effective when called before resume().
     void setQoSFloor(QoS qos);
-    void resume();
+    // false when the connection was cancelled first: it then never hears an
+    // event, so whoever set up state for it cleans up now.
+    bool resume();
     // Stops delivery and closes the socket. The handler gets ConnectionInvalid
     // if the connection had been resumed. Idempotent.
     void cancel();

@@ -261,10 +261,6 @@ struct Server : std::enable_shared_from_this<Server> {
         listener.setNewConnectionHandler([weak](const ConnectionRef& c) {
             auto self = weak.lock();
             if (!self) return c->cancel();
-            {
-                MutexLock l(self->mu);
-                self->connections.push_back(c);
-            }
             std::weak_ptr<Connection> wc = c;
             c->setEventHandler([self, wc](const Event& e) {
                 if (e.kind != Event::Kind::Message) {
@@ -280,7 +276,12 @@ struct Server : std::enable_shared_from_this<Server> {
                 if (auto c = wc.lock()) h(c, e.message);
             });
             c->setQoSFloor(QoS::Default);
-            c->resume();
+            // Counted only when resumed: one cancelled first (the listener
+            // going away meanwhile) never hears ConnectionInvalid.
+            if (c->resume()) {
+                MutexLock l(self->mu);
+                self->connections.push_back(c);
+            }
         });
     }
 
