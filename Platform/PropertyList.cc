@@ -494,22 +494,8 @@ class Reader {
     Reader(const uint8_t* bytes, size_t length) : p_(bytes), n_(length) {}
 
     std::optional<PlistValue> run() {
-        if (n_ < kHeaderBytes + kTrailerBytes || std::memcmp(p_, "bplist00", 8) != 0)
-            return refuse("not a binary property list");
-        const uint8_t* trailer = p_ + n_ - kTrailerBytes;
-        offsetSize_ = trailer[6];
-        refSize_ = trailer[7];
-        count_ = bigEndian(trailer + 8, 8);
-        const uint64_t root = bigEndian(trailer + 16, 8);
-        tableAt_ = bigEndian(trailer + 24, 8);
-        const uint64_t trailerAt = n_ - kTrailerBytes;
-        if (offsetSize_ == 0 || offsetSize_ > 8 || refSize_ == 0 || refSize_ > 8)
-            return refuse("bad offset or reference size");
-        if (count_ == 0 || root >= count_) return refuse("bad object count or root");
-        if (tableAt_ < kHeaderBytes || tableAt_ >= trailerAt ||
-            count_ > (trailerAt - tableAt_) / offsetSize_)
-            return refuse("offset table out of bounds");
-        budget_ = n_ + kExtraValueBudget;
+        uint64_t root;
+        if (!readTrailer(&root)) return std::nullopt;
         PlistValue out;
         if (!parse(root, 0, out)) return std::nullopt;
         return out;
@@ -523,21 +509,8 @@ class Reader {
     // the expansion budget are checked as for the whole tree.
     bool runRootEntries(PlistEntries* entries, std::string_view inlineKey,
                         PlistEntries* inlined) {
-        if (n_ < kHeaderBytes + kTrailerBytes || std::memcmp(p_, "bplist00", 8) != 0) return false;
-        const uint8_t* trailer = p_ + n_ - kTrailerBytes;
-        offsetSize_ = trailer[6];
-        refSize_ = trailer[7];
-        count_ = bigEndian(trailer + 8, 8);
-        const uint64_t root = bigEndian(trailer + 16, 8);
-        tableAt_ = bigEndian(trailer + 24, 8);
-        const uint64_t trailerAt = n_ - kTrailerBytes;
-        if (offsetSize_ == 0 || offsetSize_ > 8 || refSize_ == 0 || refSize_ > 8) return false;
-        if (count_ == 0 || root >= count_) return false;
-        if (tableAt_ < kHeaderBytes || tableAt_ >= trailerAt ||
-            count_ > (trailerAt - tableAt_) / offsetSize_)
-            return false;
-        budget_ = n_ + kExtraValueBudget;
-
+        uint64_t root;
+        if (!readTrailer(&root)) return false;
         --budget_;  // the root itself, as parse() counts it
         path_[0] = root;
         uint64_t at;
@@ -593,10 +566,28 @@ class Reader {
     }
 
   private:
-    std::nullopt_t refuse(const char* why) {
-        if (!why_) why_ = why;
-        return std::nullopt;
+    // The header and trailer: sizes, counts and the offset table's place,
+    // checked; the root object's index in `root`. Sets the value budget.
+    bool readTrailer(uint64_t* root) {
+        if (n_ < kHeaderBytes + kTrailerBytes || std::memcmp(p_, "bplist00", 8) != 0)
+            return fail("not a binary property list");
+        const uint8_t* trailer = p_ + n_ - kTrailerBytes;
+        offsetSize_ = trailer[6];
+        refSize_ = trailer[7];
+        count_ = bigEndian(trailer + 8, 8);
+        *root = bigEndian(trailer + 16, 8);
+        tableAt_ = bigEndian(trailer + 24, 8);
+        const uint64_t trailerAt = n_ - kTrailerBytes;
+        if (offsetSize_ == 0 || offsetSize_ > 8 || refSize_ == 0 || refSize_ > 8)
+            return fail("bad offset or reference size");
+        if (count_ == 0 || *root >= count_) return fail("bad object count or root");
+        if (tableAt_ < kHeaderBytes || tableAt_ >= trailerAt ||
+            count_ > (trailerAt - tableAt_) / offsetSize_)
+            return fail("offset table out of bounds");
+        budget_ = n_ + kExtraValueBudget;
+        return true;
     }
+
     bool fail(const char* why) {
         if (!why_) why_ = why;
         return false;
