@@ -1,5 +1,6 @@
 #include "support/ScratchRoot.h"
 
+#include <gtest/gtest.h>
 #include <unistd.h>
 
 #include <cstdlib>
@@ -12,9 +13,41 @@ namespace fs = std::filesystem;
 
 namespace tarn::test {
 
-ScratchRoot::ScratchRoot(bool activate) : activated_(activate) {
+namespace {
+
+std::string tempBase() {
     const char* tmp = std::getenv("TMPDIR");
-    std::string tmpl = std::string(tmp && *tmp ? tmp : "/tmp") + "/tarn-root-XXXXXX";
+    return tmp && *tmp ? tmp : "/tmp";
+}
+
+// Where the death-test children of test process `pid` make their roots.
+// A "threadsafe" death test runs the test again in a new process, which makes
+// its own root and then dies without running a destructor; the test process
+// removes all of them when it exits.
+std::string deathTestRoots(pid_t pid) {
+    return tempBase() + "/tarn-death-roots-" + std::to_string(pid);
+}
+
+struct DeathTestRootsSweeper {
+    ~DeathTestRootsSweeper() {
+        if (std::getenv("TARN_KEEP_SCRATCH")) return;
+        std::error_code ec;
+        fs::remove_all(deathTestRoots(::getpid()), ec);
+    }
+} gDeathTestRootsSweeper;
+
+}  // namespace
+
+ScratchRoot::ScratchRoot(bool activate) : activated_(activate) {
+    std::string base = tempBase();
+    // Not InDeathTestChild(): that answers by the death-test style, which a
+    // test sets in its body, after its fixture made this root.
+    if (!GTEST_FLAG_GET(internal_run_death_test).empty()) {
+        base = deathTestRoots(::getppid());
+        std::error_code ec;
+        fs::create_directories(base, ec);
+    }
+    std::string tmpl = base + "/tarn-root-XXXXXX";
     char* made = ::mkdtemp(tmpl.data());
     if (!made) std::abort();
     // Resolve symlinks in TMPDIR so that real-path checks compare like with like.
