@@ -116,6 +116,15 @@ private:
 bool validUtf8(const uint8_t* s, size_t n) {
     size_t i = 0;
     while (i < n) {
+        // Keys, identifiers and paths are nearly always ASCII: eight bytes at a time.
+        if (n - i >= 8) {
+            uint64_t word;
+            std::memcpy(&word, s + i, 8);
+            if ((word & 0x8080808080808080ull) == 0) {
+                i += 8;
+                continue;
+            }
+        }
         const uint8_t c = s[i];
         if (c < 0x80) {
             ++i;
@@ -152,80 +161,88 @@ class Decoder {
 public:
     Decoder(const uint8_t* p, size_t n) : p_(p), end_(p + n) {}
 
-    std::optional<PlistValue> value(size_t depth) {
+    // Decodes one value into *out, which is built in place (a dictionary
+    // entry decodes straight into its node): no temporary value to move.
+    bool value(PlistValue* out, size_t depth) {
         if (depth > kMaxNestingDepth) return fail("nesting deeper than the limit");
         if (++values_ > kMaxValueCount) return fail("too many values");
         if (p_ == end_) return fail("truncated value");
         const uint8_t tag = *p_++;
         switch (tag) {
             case kTagString: {
-                std::string s;
-                if (!text(&s, "string")) return std::nullopt;
-                return PlistValue(std::move(s));
+                std::string_view s;
+                if (!text(&s, "string")) return false;
+                *out = PlistValue(s);
+                return true;
             }
             case kTagUInt: {
                 uint64_t u;
-                if (!varint(&u)) return std::nullopt;
-                return PlistValue(u);
+                if (!varint(&u)) return false;
+                *out = PlistValue(u);
+                return true;
             }
             case kTagInt: {
                 uint64_t z;
-                if (!varint(&z)) return std::nullopt;
-                const int64_t i = static_cast<int64_t>(z >> 1) ^ -static_cast<int64_t>(z & 1);
-                return PlistValue(i);
+                if (!varint(&z)) return false;
+                *out = PlistValue(static_cast<int64_t>(z >> 1) ^ -static_cast<int64_t>(z & 1));
+                return true;
             }
             case kTagFalse:
-                return PlistValue(false);
+                *out = PlistValue(false);
+                return true;
             case kTagTrue:
-                return PlistValue(true);
+                *out = PlistValue(true);
+                return true;
             case kTagUuid: {
                 if (remaining() < 16) return fail("truncated uuid");
                 Uuid u;
                 std::memcpy(u.bytes.data(), p_, 16);
                 p_ += 16;
-                return PlistValue(u);
+                *out = PlistValue(u);
+                return true;
             }
             case kTagData: {
                 uint64_t n;
-                if (!varint(&n)) return std::nullopt;
+                if (!varint(&n)) return false;
                 if (n > remaining()) return fail("data longer than the message");
-                PlistData d(p_, p_ + n);
+                *out = PlistValue(PlistData(p_, p_ + n));
                 p_ += n;
-                return PlistValue(std::move(d));
+                return true;
             }
             case kTagArray: {
                 uint64_t count;
-                if (!varint(&count)) return std::nullopt;
+                if (!varint(&count)) return false;
                 // Every element takes at least one byte.
                 if (count > remaining()) return fail("array count larger than the message");
-                PlistArray a;
+                *out = PlistValue(PlistArray());
+                PlistArray& a = *out->asArray();
                 a.reserve(count);
-                for (uint64_t k = 0; k < count; ++k) {
-                    auto e = value(depth + 1);
-                    if (!e) return std::nullopt;
-                    a.push_back(std::move(*e));
-                }
-                return PlistValue(std::move(a));
+                for (uint64_t k = 0; k < count; ++k)
+                    if (!value(&a.emplace_back(), depth + 1)) return false;
+                return true;
             }
             case kTagDict: {
                 uint64_t count;
-                if (!varint(&count)) return std::nullopt;
+                if (!varint(&count)) return false;
                 // Every entry takes at least two bytes (key length, tag).
                 if (count > remaining() / 2) return fail("dictionary count larger than the message");
-                PlistDict d;
+                *out = PlistValue(PlistDict());
+                PlistDict& d = *out->asDict();
                 for (uint64_t k = 0; k < count; ++k) {
-                    std::string key;
-                    if (!text(&key, "key")) return std::nullopt;
-                    auto e = value(depth + 1);
-                    if (!e) return std::nullopt;
-                    if (!d.emplace(std::move(key), std::move(*e)).second)
-                        return fail("duplicate dictionary key");
+                    std::string_view key;
+                    if (!text(&key, "key")) return false;
+                    // Encoders write keys in order, so the end is nearly always
+                    // the right place: one comparison instead of a descent.
+                    const size_t before = d.size();
+                    auto at = d.emplace_hint(d.end(), key, PlistValue());
+                    if (d.size() == before) return fail("duplicate dictionary key");
+                    if (!value(&at->second, depth + 1)) return false;
                 }
-                return PlistValue(std::move(d));
+                return true;
             }
             default:
                 reason_ = Format("unknown value tag 0x%02x", static_cast<unsigned>(tag));
-                return std::nullopt;
+                return false;
         }
     }
 
@@ -233,9 +250,9 @@ public:
     const std::string& reason() const { return reason_; }
 
 private:
-    std::nullopt_t fail(const char* r) {
+    bool fail(const char* r) {
         reason_ = r;
-        return std::nullopt;
+        return false;
     }
 
     bool varint(uint64_t* out) {
@@ -261,7 +278,8 @@ private:
         return false;
     }
 
-    bool text(std::string* out, const char* what) {
+    // A view into the message: the caller copies it where it belongs.
+    bool text(std::string_view* out, const char* what) {
         uint64_t n;
         if (!varint(&n)) return false;
         if (n > remaining()) {
@@ -272,7 +290,7 @@ private:
             reason_ = Format("%s is not UTF-8", what);
             return false;
         }
-        out->assign(reinterpret_cast<const char*>(p_), n);
+        *out = std::string_view(reinterpret_cast<const char*>(p_), n);
         p_ += n;
         return true;
     }
@@ -351,8 +369,8 @@ std::optional<PlistValue> DecodeValue(const uint8_t* bytes, size_t length, std::
         return std::nullopt;
     }
     Decoder d(bytes, length);
-    auto v = d.value(1);
-    if (!v) {
+    std::optional<PlistValue> v(std::in_place);
+    if (!d.value(&*v, 1)) {
         if (why) *why = d.reason();
         return std::nullopt;
     }

@@ -114,6 +114,10 @@ TEST(ConduitWire, MalformedBodiesAreRejectedWithAReason) {
         {"overlong UTF-8", {0x09, 0x01, 0x01, 'k', 0x01, 0x02, 0xC0, 0xAF}},
         {"surrogate in UTF-8", {0x09, 0x01, 0x01, 'k', 0x01, 0x03, 0xED, 0xA0, 0x80}},
         {"duplicate key", {0x09, 0x02, 0x01, 'k', 0x04, 0x01, 'k', 0x05}},
+        {"duplicate key out of order",
+         {0x09, 0x03, 0x01, 'b', 0x04, 0x01, 'a', 0x04, 0x01, 'b', 0x05}},
+        {"UTF-8 cut after eight ASCII bytes",
+         {0x09, 0x01, 0x01, 'k', 0x01, 0x09, 'a', 'b', 'c', 'd', 'e', 'f', 'g', 'h', 0xC3}},
         {"array count past the end", {0x09, 0x01, 0x01, 'k', 0x08, 0xFF, 0xFF, 0xFF, 0xFF, 0x0F}},
         {"dict count past the end", {0x09, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0x7F}},
         {"data length past the end", {0x09, 0x01, 0x01, 'k', 0x07, 0x10, 0x00}},
@@ -128,6 +132,18 @@ TEST(ConduitWire, MalformedBodiesAreRejectedWithAReason) {
         EXPECT_FALSE(DecodeBody(c.bytes.data(), c.bytes.size(), &why)) << c.name;
         EXPECT_FALSE(why.empty()) << c.name;
     }
+}
+
+// Keys a foreign encoder sends out of order, and non-ASCII text around runs
+// of ASCII, decode to the same values.
+TEST(ConduitWire, UnorderedKeysAndMixedTextDecode) {
+    const std::vector<uint8_t> bytes = {0x09, 0x02, 0x01, 'b', 0x02, 0x02, 0x01, 'a', 0x01, 0x0C,
+                                        'a', 'b', 'c', 'd', 'e', 'f', 'g', 'h', 0xC3, 0xA9, 'i', 'j'};
+    std::string why;
+    auto v = DecodeBody(bytes.data(), bytes.size(), &why);
+    ASSERT_TRUE(v) << why;
+    EXPECT_EQ(v->find("b")->asUInt64(), 2u);
+    EXPECT_EQ(*v->find("a")->asString(), "abcdefgh\xC3\xA9ij");
 }
 
 TEST(ConduitWire, NestingAndValueCountAreCapped) {
