@@ -10,7 +10,7 @@ namespace {
 
 enum class Length { Int, Long, Short, Char };
 
-std::string formatInteger(const std::string& directive, char conv, const FormatArg& a, Length len) {
+void appendInteger(std::string* out, std::string_view directive, char conv, const FormatArg& a, Length len) {
     // Reproduce C's truncation for the length modifier, then print at 64 bits.
     bool isSigned = conv == 'd' || conv == 'i';
     uint64_t raw = a.kind == FormatArg::Kind::Signed     ? static_cast<uint64_t>(a.i)
@@ -20,10 +20,11 @@ std::string formatInteger(const std::string& directive, char conv, const FormatA
                                                          : 0;
     if (a.kind == FormatArg::Kind::String) {
         // A string where a number was asked for: print the text rather than guess.
-        return std::string(a.s);
+        out->append(a.s);
+        return;
     }
     char buf[80];
-    if (directive == "%" && conv != 'o') {
+    if (directive.size() == 1 && conv != 'o') {
         // The common case, without building a printf format.
         uint64_t v = raw;
         bool negative = false;
@@ -45,9 +46,10 @@ std::string formatInteger(const std::string& directive, char conv, const FormatA
         char* end = std::to_chars(p, buf + sizeof buf, v, base).ptr;
         if (conv == 'X')
             for (char* q = p; q < end; ++q) *q = static_cast<char>(std::toupper(static_cast<unsigned char>(*q)));
-        return std::string(buf, end);
+        out->append(buf, end);
+        return;
     }
-    std::string f = directive + "ll" + conv;
+    const std::string f = std::string(directive) + "ll" + conv;
     if (isSigned) {
         int64_t v = static_cast<int64_t>(raw);
         if (len == Length::Int) v = static_cast<int32_t>(raw);
@@ -61,7 +63,7 @@ std::string formatInteger(const std::string& directive, char conv, const FormatA
         if (len == Length::Char) v = static_cast<uint8_t>(raw);
         std::snprintf(buf, sizeof buf, f.c_str(), static_cast<unsigned long long>(v));
     }
-    return buf;
+    out->append(buf);
 }
 
 // What %@ and %s print for an argument.
@@ -90,27 +92,30 @@ std::string formatArgs(std::string_view fmt, const FormatArg* args, size_t count
     out.reserve(fmt.size() + 32);
     size_t next = 0;
     for (size_t i = 0; i < fmt.size(); ++i) {
-        char c = fmt[i];
-        if (c != '%') {
-            out += c;
-            continue;
+        // Literal text up to the next directive in one piece: most of a log
+        // line is its format's own words.
+        const size_t percent = fmt.find('%', i);
+        if (percent != i) {
+            out.append(fmt.substr(i, percent - i));
+            if (percent == std::string_view::npos) break;
+            i = percent;
         }
         if (i + 1 < fmt.size() && fmt[i + 1] == '%') {
             out += '%';
             ++i;
             continue;
         }
-        // %[flags][width][.precision][length]conversion
+        // %[flags][width][.precision][length]conversion; `directive` is the
+        // part printf needs besides the length ("%" alone when plain).
         size_t j = i + 1;
-        std::string directive = "%";
-        while (j < fmt.size() && std::string_view("-+ #0'").find(fmt[j]) != std::string_view::npos)
-            directive += fmt[j++];
-        while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) directive += fmt[j++];
+        while (j < fmt.size() && std::string_view("-+ #0'").find(fmt[j]) != std::string_view::npos) ++j;
+        while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) ++j;
         if (j < fmt.size() && fmt[j] == '.') {
-            directive += fmt[j++];
-            while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j])))
-                directive += fmt[j++];
+            ++j;
+            while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) ++j;
         }
+        const std::string_view directive = fmt.substr(i, j - i);
+        const bool plain = directive.size() == 1;
         Length len = Length::Int;
         while (j < fmt.size() && std::string_view("hlqjztL").find(fmt[j]) != std::string_view::npos) {
             char m = fmt[j++];
@@ -136,10 +141,10 @@ std::string formatArgs(std::string_view fmt, const FormatArg* args, size_t count
                 break;
             case 's': {
                 // Width and precision apply as printf would apply them.
-                if (directive == "%" && a.kind == FormatArg::Kind::String) {
+                if (plain && a.kind == FormatArg::Kind::String) {
                     out += a.s;
                 } else {
-                    std::snprintf(buf, sizeof buf, (directive + "s").c_str(), argumentText(a).c_str());  // NUL-ended copy
+                    std::snprintf(buf, sizeof buf, (std::string(directive) + "s").c_str(), argumentText(a).c_str());  // NUL-ended copy
                     out += buf;
                 }
                 break;
@@ -148,7 +153,7 @@ std::string formatArgs(std::string_view fmt, const FormatArg* args, size_t count
                 if (conv == 'c') {
                     out += static_cast<char>(a.kind == FormatArg::Kind::Signed ? a.i : a.u);
                 } else {
-                    out += formatInteger(directive, conv, a, len);
+                    appendInteger(&out, directive, conv, a, len);
                 }
                 break;
             case 'f': case 'F': case 'g': case 'G': case 'e': case 'E': {
@@ -156,7 +161,7 @@ std::string formatArgs(std::string_view fmt, const FormatArg* args, size_t count
                            : a.kind == FormatArg::Kind::Signed   ? static_cast<double>(a.i)
                            : a.kind == FormatArg::Kind::Unsigned ? static_cast<double>(a.u)
                                                                  : 0.0;
-                std::snprintf(buf, sizeof buf, (directive + conv).c_str(), v);
+                std::snprintf(buf, sizeof buf, (std::string(directive) + conv).c_str(), v);
                 out += buf;
                 break;
             }
@@ -167,7 +172,7 @@ std::string formatArgs(std::string_view fmt, const FormatArg* args, size_t count
             }
             default:
                 // Unknown conversion: keep the text so the line still says something.
-                out.append(fmt.substr(i - (directive.size() - 1) - 1, directive.size() + 1));
+                out.append(fmt.substr(i - directive.size(), directive.size() + 1));
                 --next;
                 break;
         }

@@ -95,6 +95,11 @@ TEST(Format, PrintfConversionsAndDescriptions) {
     std::shared_ptr<const TarnError> none;
     EXPECT_EQ(Format("%@", none), "(null)");
     EXPECT_EQ(Format("%@ and %@", "one"), "one and (missing)");
+    // Literal runs around directives, a cut-off directive, an unknown one.
+    EXPECT_EQ(Format("no directives at all"), "no directives at all");
+    EXPECT_EQ(Format("100%"), "100%");
+    EXPECT_EQ(Format("a %y b %d", 4), "a %y b 4");
+    EXPECT_EQ(Format("[%08.3f][%-4s][%lX]", 3.14159, "ab", uint64_t{0xbeef}), "[0003.142][ab  ][BEEF]");
     PlistValue d{PlistDict{}};
     d.set("k", "v");
     EXPECT_NE(Format("%@", d).find("k = v;"), std::string::npos);
