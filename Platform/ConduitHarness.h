@@ -64,6 +64,8 @@ public:
     static std::unique_ptr<SeqpacketEcho> start(std::string* why, bool otherProcess = false);
     // Sends `bytes` and waits for the echo into `reply`.
     bool roundTrip(const std::vector<uint8_t>& bytes, std::vector<uint8_t>* reply);
+    // The echoing process, or -1 when the echo is a thread of this one.
+    pid_t pid() const { return child_; }
 
     SeqpacketEcho(int near, int far, bool otherProcess);
     ~SeqpacketEcho();

@@ -16,7 +16,9 @@
 //      total times and ratio;
 //   3. look-ups per second with 1, 2 and 4 concurrent clients.
 //
-//   container_requests_bench [CONTAINERS] [LOOKUP_ROUNDS]
+//   container_requests_bench [CONTAINERS] [LOOKUP_ROUNDS] [lookup]
+//
+// With "lookup" only the pinned look-up latency runs (for profiling).
 #include <algorithm>
 #include <atomic>
 #include <chrono>
@@ -84,29 +86,66 @@ double since(Clock::time_point t0) {
 
 // ---- 1. look-up latency ----
 
-void lookupLatency(const char* config, Client& daemon, const std::vector<uint8_t>& record,
-                   int rounds, int ops) {
+// CPU time of every thread of process `pid` so far, from the scheduler's
+// own accounting (nanoseconds, unlike the tick counts of /proc/PID/stat).
+double processCpuUs(pid_t pid) {
+    double ns = 0;
+    std::error_code ec;
+    for (const auto& task :
+         std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/task", ec)) {
+        std::ifstream in(task.path() / "schedstat");
+        double runNs = 0;
+        if (in >> runNs) ns += runNs;
+    }
+    return ns / 1000;
+}
+
+double threadCpuUs() {
+    timespec ts{};
+    ::clock_gettime(CLOCK_THREAD_CPUTIME_ID, &ts);
+    return ts.tv_sec * 1e6 + ts.tv_nsec / 1e3;
+}
+
+
+void lookupLatency(const char* config, Client& daemon, pid_t daemonPid,
+                   const std::vector<uint8_t>& record, int rounds, int ops) {
     std::string why;
     auto echo = harness::SeqpacketEcho::start(&why, /*otherProcess=*/true);
     if (!echo) die("echo: " + why);
     const PlistValue lookup = request0("bench.lookup", false);
     std::vector<double> echoLat, daemonLat;
     std::vector<uint8_t> back;
+    // CPU per round trip on each side, to tell where a difference comes from.
+    double echoServerCpu = 0, echoClientCpu = 0, daemonCpu = 0, daemonClientCpu = 0;
     for (int r = 0; r <= rounds; ++r) {  // round 0 warms up
+        double server0 = processCpuUs(echo->pid()), client0 = threadCpuUs();
         for (int i = 0; i < ops; ++i) {
             const auto t0 = Clock::now();
             if (!echo->roundTrip(record, &back)) die("echo failed");
             if (r) echoLat.push_back(since(t0));
         }
+        if (r) {
+            echoServerCpu += processCpuUs(echo->pid()) - server0;
+            echoClientCpu += threadCpuUs() - client0;
+        }
+        server0 = processCpuUs(daemonPid);
+        client0 = threadCpuUs();
         for (int i = 0; i < ops; ++i) {
             const auto t0 = Clock::now();
             send(daemon, lookup);
             if (r) daemonLat.push_back(since(t0));
         }
+        if (r) {
+            daemonCpu += processCpuUs(daemonPid) - server0;
+            daemonClientCpu += threadCpuUs() - client0;
+        }
     }
     const double a = medianUs(echoLat), b = medianUs(daemonLat);
+    const double n = static_cast<double>(rounds) * ops;
     std::printf("look-up   %-9s echo %7.2f us | daemon %7.2f us | ratio %.2f (target <= 2)\n",
                 config, a, b, a > 0 ? b / a : 0.0);
+    std::printf("          %-9s CPU: echo %.2f + client %.2f us | daemon %.2f + client %.2f us\n",
+                config, echoServerCpu / n, echoClientCpu / n, daemonCpu / n, daemonClientCpu / n);
 }
 
 // ---- 2. creation ----
@@ -155,26 +194,6 @@ void createDirectly(const std::string& staging, const std::string& live,
         check(::chown(sub.c_str(), kOwner, kOwner) == 0, "chown sub");
     }
     check(::rename(dir.c_str(), (live + "/" + uuid).c_str()) == 0, "rename live");
-}
-
-// CPU time of every thread of process `pid` so far, from the scheduler's
-// own accounting (nanoseconds, unlike the tick counts of /proc/PID/stat).
-double processCpuUs(pid_t pid) {
-    double ns = 0;
-    std::error_code ec;
-    for (const auto& task :
-         std::filesystem::directory_iterator("/proc/" + std::to_string(pid) + "/task", ec)) {
-        std::ifstream in(task.path() / "schedstat");
-        double runNs = 0;
-        if (in >> runNs) ns += runNs;
-    }
-    return ns / 1000;
-}
-
-double threadCpuUs() {
-    timespec ts{};
-    ::clock_gettime(CLOCK_THREAD_CPUTIME_ID, &ts);
-    return ts.tv_sec * 1e6 + ts.tv_nsec / 1e3;
 }
 
 void creation(const char* config, const std::string& staging, const std::string& live,
@@ -245,6 +264,7 @@ void throughput(const std::string& socket, int clients) {
 int main(int argc, char** argv) {
     const int containers = argc > 1 ? std::max(1, std::atoi(argv[1])) : 2000;
     const int rounds = argc > 2 ? std::max(1, std::atoi(argv[2])) : 20;
+    const bool lookupOnly = argc > 3 && std::string(argv[3]) == "lookup";
     PlatformLogSetQuiet(true);
     std::string why;
 
@@ -294,17 +314,20 @@ int main(int argc, char** argv) {
     const std::string live = root + "/direct-live";
     if (!std::filesystem::is_directory(staging)) die("no daemon staging directory at " + staging);
     std::filesystem::create_directories(live);
-    lookupLatency("pinned", *client, record, rounds, 200);
+    const auto finish = [&] {
+        client.reset();
+        daemon->terminate();
+        std::error_code ec;
+        std::filesystem::remove_all(root, ec);
+        return 0;
+    };
+    lookupLatency("pinned", *client, daemon->pid(), record, rounds, 200);
+    if (lookupOnly) return finish();
     creation("pinned", staging, live, *client, daemon->pid(), containers, metadata);
     (void)harness::SetProcessCpus(::getpid(), all, &why);
     (void)harness::SetProcessCpus(daemon->pid(), all, &why);
-    lookupLatency("unpinned", *client, record, rounds, 200);
+    lookupLatency("unpinned", *client, daemon->pid(), record, rounds, 200);
     creation("unpinned", staging, live, *client, daemon->pid(), containers, metadata);
     for (int clients : {1, 2, 4}) throughput(socket, clients);
-
-    client.reset();
-    daemon->terminate();
-    std::error_code ec;
-    std::filesystem::remove_all(root, ec);
-    return 0;
+    return finish();
 }
