@@ -76,11 +76,13 @@ bool containsMetadataName(const std::string& path) {
 
 // Setting a class while locked fails where the platform's does: when the
 // item is or becomes class 1 (complete protection), whose keys are gone.
-int setProtectionClassChecked(int fd, int32_t newClass) {
+// `fresh`: the caller has just made the directory, which therefore has no
+// class yet; its current class need not be read.
+int setProtectionClassChecked(int fd, int32_t newClass, bool fresh = false) {
     // The lock state is asked only when class 1 may be involved: reading it
     // opens a file, and new directories (most calls) have no class yet.
     int32_t current = 0;
-    const int getErr = FsGetProtectionClass(fd, &current);
+    const int getErr = fresh ? 0 : FsGetProtectionClass(fd, &current);
     const bool mayBeRefused =
         getErr != 0 || current == kCompleteProtectionClass || newClass == kCompleteProtectionClass;
     if (mayBeRefused && LockStateDeviceIsLocked()) return getErr ? getErr : EPERM;
@@ -347,8 +349,9 @@ bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermed
             (owner == 0 || (st.st_uid == owner && st.st_gid == owner)))
             return true;
     }
+    bool created = false;
     if (withIntermediateDirectories) {
-        int err = FsMakePath(url, mode);
+        int err = FsMakePath(url, mode, &created);
         if (err != 0 && err != EEXIST) {
             setError(error, TARN_POSIX_ERROR(err, "mkpath of %s failed: %s", url, errText(err)));
             return false;
@@ -359,6 +362,7 @@ bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermed
             setError(error, TARN_POSIX_ERROR(err, "mkdir of %s failed: %s", url, errText(err)));
             return false;
         }
+        created = err == 0;
     }
     if (dataProtectionClass == kTarnDataProtectionClassUnchanged && owner == 0) return true;
 
@@ -370,7 +374,7 @@ bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermed
         return false;
     }
     if (dataProtectionClass != kTarnDataProtectionClassUnchanged) {
-        if (int err = setProtectionClassChecked(dir.get(), dataProtectionClass)) {
+        if (int err = setProtectionClassChecked(dir.get(), dataProtectionClass, created)) {
             setError(error, TARN_POSIX_ERROR(err, "Failed to setclass(%d) on directory %s: %s",
                                              static_cast<int32_t>(dataProtectionClass), url, errText(err)));
             return false;

@@ -211,12 +211,16 @@ int FsMkdir(const std::string& path, mode_t mode) {
     return ::mkdir(path.c_str(), mode) == 0 ? 0 : errnoOr(EIO);
 }
 
-int FsMakePath(const std::string& path, mode_t mode) {
+int FsMakePath(const std::string& path, mode_t mode, bool* created) {
+    if (created) *created = false;
     if (path.empty()) return ENOENT;
     // Leaf first: the parents nearly always exist, so one mkdir usually
     // settles it; only a missing parent sends us up the path (like mkdir -p,
     // each missing component is made with `mode`).
-    if (::mkdir(path.c_str(), mode) == 0) return 0;
+    if (::mkdir(path.c_str(), mode) == 0) {
+        if (created) *created = true;
+        return 0;
+    }
     int err = errno;
     if (err == ENOENT) {
         size_t end = path.find_last_not_of('/');
@@ -226,7 +230,10 @@ int FsMakePath(const std::string& path, mode_t mode) {
         if (parent != path) {
             if (int perr = FsMakePath(parent, mode); perr != 0) return perr;
         }
-        if (::mkdir(path.c_str(), mode) == 0) return 0;
+        if (::mkdir(path.c_str(), mode) == 0) {
+            if (created) *created = true;
+            return 0;
+        }
         err = errno;
     }
     if (err != EEXIST) return err;
@@ -383,9 +390,11 @@ int FsSetImmutableAt(int dirFd, const std::string& name, bool immutable) {
 
 const char* FsProtectionClassAttributeName() {
     // The trusted namespace needs CAP_SYS_ADMIN; an unprivileged development
-    // daemon keeps the class where it may write.
-    return ::geteuid() == 0 ? "trusted.tarnkeeper.protection-class"
-                            : "user.tarnkeeper.protection-class";
+    // daemon keeps the class where it may write. Asked for every directory
+    // the daemon makes; its user does not change while it runs.
+    static const char* const name = ::geteuid() == 0 ? "trusted.tarnkeeper.protection-class"
+                                                     : "user.tarnkeeper.protection-class";
+    return name;
 }
 
 int FsGetProtectionClass(int fd, int32_t* cls) {

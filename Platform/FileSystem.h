@@ -78,7 +78,8 @@ int FsStatAt(int dirFd, const std::string& name, FsStat* st);  // never follows
 
 int FsMkdir(const std::string& path, mode_t mode);
 // Creates every missing component with `mode`; an existing directory is 0.
-int FsMakePath(const std::string& path, mode_t mode);
+// `created`, when given, tells whether this call made the last component.
+int FsMakePath(const std::string& path, mode_t mode, bool* created = nullptr);
 // `pathTemplate` ends in XXXXXX, replaced in place.
 int FsMkdtemp(std::string* pathTemplate);
 int FsRename(const std::string& from, const std::string& to);
@@ -121,8 +122,9 @@ int FsSetImmutableAt(int dirFd, const std::string& name, bool immutable);
 
 // ---- Data-protection class (an extended attribute) ----
 
-// "trusted.tarnkeeper.protection-class" when running as root, the "user."
-// namespace otherwise. No attribute reads as class 0.
+// "trusted.tarnkeeper.protection-class" when the process starts as root, the
+// "user." namespace otherwise (decided once). No attribute reads as class 0,
+// and a new directory has none.
 const char* FsProtectionClassAttributeName();
 int FsGetProtectionClass(int fd, int32_t* cls);
 int FsSetProtectionClass(int fd, int32_t cls);

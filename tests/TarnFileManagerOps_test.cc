@@ -311,6 +311,22 @@ TEST_F(TarnFileManagerOpsTest, ClassOneIsUntouchableWhileLocked) {
     EXPECT_FALSE(fm_.setDataProtectionClassOfItemAtURL(p("/g"), 1, nullptr, &error_));
     EXPECT_EQ(EPERM, error_->posixCode());
     EXPECT_TRUE(fm_.setDataProtectionClassOfItemAtURL(p("/g"), 3, nullptr, &error_));
+    // Creating a directory follows the same rules, whether it makes the
+    // directory (no class yet) or finds it (its class is read).
+    const auto cls = static_cast<TarnDataProtectionClass>(1);
+    EXPECT_FALSE(fm_.createDirectoryAtURL(p("/new1"), true, 0755, cls, &error_));
+    EXPECT_EQ(EPERM, error_->posixCode());
+    ASSERT_TRUE(fm_.createDirectoryAtURL(p("/new3"), true, 0755, static_cast<TarnDataProtectionClass>(3),
+                                         &error_));
+    int32_t got = 0;
+    ASSERT_TRUE(fm_.dataProtectionClassOfItemAtURL(p("/new3"), &got, &error_));
+    EXPECT_EQ(3, got);
+    LockStateTEST_override(0);
+    ASSERT_TRUE(fm_.createDirectoryAtURL(p("/old1"), false, 0755, cls, &error_));
+    LockStateTEST_override(1);
+    EXPECT_FALSE(fm_.createDirectoryAtURL(p("/old1"), false, 0755, static_cast<TarnDataProtectionClass>(3),
+                                          &error_));
+    EXPECT_EQ(EPERM, error_->posixCode());
     LockStateTEST_override(0);
     EXPECT_TRUE(fm_.setDataProtectionClassOfItemAtURL(p("/f"), 3, nullptr, &error_));
 }
