@@ -16,9 +16,9 @@
 //      total times and ratio;
 //   3. look-ups per second with 1, 2 and 4 concurrent clients.
 //
-//   container_requests_bench [CONTAINERS] [LOOKUP_ROUNDS] [lookup]
+//   container_requests_bench [CONTAINERS] [LOOKUP_ROUNDS] [lookup|create]
 //
-// With "lookup" only the pinned look-up latency runs (for profiling).
+// With "lookup" or "create" only that part runs, pinned (for profiling).
 #include <algorithm>
 #include <atomic>
 #include <chrono>
@@ -264,7 +264,7 @@ void throughput(const std::string& socket, int clients) {
 int main(int argc, char** argv) {
     const int containers = argc > 1 ? std::max(1, std::atoi(argv[1])) : 2000;
     const int rounds = argc > 2 ? std::max(1, std::atoi(argv[2])) : 20;
-    const bool lookupOnly = argc > 3 && std::string(argv[3]) == "lookup";
+    const std::string only = argc > 3 ? argv[3] : "";
     PlatformLogSetQuiet(true);
     std::string why;
 
@@ -321,9 +321,10 @@ int main(int argc, char** argv) {
         std::filesystem::remove_all(root, ec);
         return 0;
     };
-    lookupLatency("pinned", *client, daemon->pid(), record, rounds, 200);
-    if (lookupOnly) return finish();
-    creation("pinned", staging, live, *client, daemon->pid(), containers, metadata);
+    if (only != "create") lookupLatency("pinned", *client, daemon->pid(), record, rounds, 200);
+    if (only != "lookup")
+        creation("pinned", staging, live, *client, daemon->pid(), containers, metadata);
+    if (!only.empty()) return finish();
     (void)harness::SetProcessCpus(::getpid(), all, &why);
     (void)harness::SetProcessCpus(daemon->pid(), all, &why);
     lookupLatency("unpinned", *client, daemon->pid(), record, rounds, 200);
