@@ -115,7 +115,9 @@ bool TarnClientConnection::isEntitledForLookupWithClass(TarnContainerClass conta
 bool TarnClientConnection::_lookupRuleCommon(TarnContainerClass containerClass,
                                              const std::string& identifier, bool withGroupRule) {
     const std::string bundleIdentifier = clientBundleIdentifier();
-    if (identifier == bundleIdentifier) return true;
+    // A caller without a bundle identifier has no container of its own, not
+    // one named "".
+    if (!bundleIdentifier.empty() && identifier == bundleIdentifier) return true;
     if (allowOtherIdLookup_) return true;
     if (withGroupRule && TarnContainerClassIsGroup(containerClass) && allowGroupIdLookup_)
         return true;

@@ -699,12 +699,7 @@ bool TarnContainerCache::addContainerMetadata(const TarnMetadataRef& metadata, c
                 metadata ? static_cast<int64_t>(metadata->containerClass()) : int64_t{0});
         return false;
     }
-    if (metadata->identifier().empty()) {
-        if (error)
-            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr,
-                                "Invalid metadata Identifier: %@", metadata->identifier());
-        return false;
-    }
+    // The identifier is always a string here, and an empty one is valid.
     if (url.empty() || url[0] != '/') {
         if (error)
             *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid input: URL: %@", url);
@@ -759,12 +754,7 @@ bool TarnContainerCache::removeContainerForUserIdentity(const TarnUserIdentityRe
                                 static_cast<int64_t>(contentClass));
         return false;
     }
-    if (identifier.empty()) {
-        if (error)
-            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Identifier: %@",
-                                identifier);
-        return false;
-    }
+    // The identifier is always a string here, and an empty one is valid.
     bool shouldRegister = false;
     {
         MutexLock lock(cacheLock_);

@@ -69,6 +69,8 @@ TEST_F(TarnClientConnectionTest, LookupRuleGrantsInOrderAndRefusesWith55) {
                PlistValue(PlistDict{{"appGroup", PlistValue(PlistArray{PlistValue("group.a")})}}));
     TarnErrorRef error;
     EXPECT_TRUE(c->_passesLookupRuleForContainerClass(2, "com.client", &error)) << "own identifier";
+    // A caller without a bundle identifier does not own the container named "".
+    EXPECT_FALSE(caller("")->_passesLookupRuleForContainerClass(2, "", &error));
     EXPECT_TRUE(c->_passesLookupRuleForContainerClass(7, "group.a", &error))
         << "lookup entitlement";
     EXPECT_FALSE(c->_passesLookupRuleForContainerClass(2, "com.other", &error));

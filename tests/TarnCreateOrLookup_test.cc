@@ -192,6 +192,23 @@ TEST_F(TarnCreateOrLookupTest, WellKnownSystemContainersGetTheirFixedNames) {
     EXPECT_TRUE(Uuid::parse(PathLastComponent(unlisted->url())));
 }
 
+// An empty identifier is a valid one: created once, then found, never a
+// live directory the cache refuses to hold.
+TEST_F(TarnCreateOrLookupTest, AnEmptyIdentifierMakesOneContainer) {
+    uint64_t code = TarnSuccess;
+    auto made = create(identity("", 2), false, &code);
+    ASSERT_TRUE(made) << code;
+    EXPECT_FALSE(made->existed());
+    auto again = create(identity("", 2), false, &code);
+    ASSERT_TRUE(again) << code;
+    EXPECT_TRUE(again->existed());
+    EXPECT_EQ(again->url(), made->url());
+    EXPECT_EQ(directoriesIn(liveFor(2)), 1u);
+    TarnErrorRef error;
+    EXPECT_TRUE(TarnContainerCache::sharedInstance().removeContainerForUserIdentity(
+        TarnUserIdentityCache::defaultUserIdentity(), 2, "", false, &error));
+}
+
 TEST_F(TarnCreateOrLookupTest, ConcurrentCreationsOfOneIdentityMakeOneContainer) {
     for (int round = 0; round < 5; ++round) {
         auto id = identity("com.example.race" + std::to_string(round), 2);
