@@ -427,13 +427,11 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
     auto& fm = TarnFileManager::defaultManager();
 
     const std::string directoryName = Uuid::generate().string();
-    {
-        SignpostInterval event("unspecified", "CreatingContainer",
-                               {{"uuid", directoryName},
-                                {"identifier", identifier},
-                                {"class", std::to_string(containerClass)}});
-        event.end();
-    }
+    if (PlatformLogVerbose())
+        SignpostEvent("unspecified", "CreatingContainer",
+                      {{"uuid", "<private>"},
+                       {"identifier", "<private>"},
+                       {"class", std::to_string(containerClass)}});
 
     const FileURL stagingURL =
         PathJoin(configuration.stagingDirectoryURLForUserIdentity(userIdentity, containerClass),

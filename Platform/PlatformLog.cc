@@ -234,6 +234,14 @@ SignpostInterval::SignpostInterval(const char* category, std::string_view name,
     PlatformLogWrite(category_, PlatformLogType::Debug, text);
 }
 
+void SignpostEvent(const char* category, std::string_view name,
+                   const std::vector<std::pair<std::string, std::string>>& attributes) {
+    if (!PlatformLogVerbose()) return;
+    std::string text = "signpost event " + std::string(name);
+    for (const auto& [k, v] : attributes) text += " " + k + "=" + v;
+    PlatformLogWrite(category, PlatformLogType::Debug, text);
+}
+
 SignpostInterval::~SignpostInterval() {
     if (!ended_) end();
 }

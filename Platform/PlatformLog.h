@@ -43,6 +43,11 @@ void PlatformLog(const char* category, PlatformLogType type, std::string_view fm
     PlatformLogWrite(category, type, Format(fmt, args...));
 }
 
+// A single point in time: logs "signpost event NAME" with its attributes
+// when signposts are recorded. Private values are passed as "<private>".
+void SignpostEvent(const char* category, std::string_view name,
+                   const std::vector<std::pair<std::string, std::string>>& attributes);
+
 // A named interval. Logs "begin NAME" when made and "end NAME (duration_us=N)"
 // with its attributes when ended (or destroyed without being ended).
 class SignpostInterval {

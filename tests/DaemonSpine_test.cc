@@ -51,6 +51,12 @@ TEST_F(DaemonSpineTest, CommandTableAndGateOverIpc) {
     EXPECT_GE(count("command=0, client="), 1u);
     EXPECT_GE(count("command=27, client=<unknown>, error=55"), 1u);
     EXPECT_GE(count("command=27, client=com.ostrea.test.admin, error=49"), 1u);
+    // A creation is marked in the log without its private attributes.
+    EXPECT_EQ(daemon_->sendError(
+                  admin_, R"({"Identifier": "com.x", "ContainerClass": 2, "CreateIfNecessary": true})"),
+              1u);
+    EXPECT_EQ(count("signpost event CreatingContainer uuid=<private> identifier=<private> class=2"), 1u);
+    EXPECT_EQ(count("identifier=com.x"), 0u);
 }
 
 // One connection sends many requests; its identity is reused between them,
