@@ -84,6 +84,22 @@ std::shared_ptr<TarnDeferredReply> TarnTakeDeferredReply() {
     return std::make_shared<ConduitDeferredReply>(*tCurrentReply);
 }
 
+namespace {
+
+// Runs one step of a request; an exception becomes error 40 in *error.
+template <class Step>
+void guardOperation(uint64_t* error, Step&& step) {
+    try {
+        step();
+    } catch (const std::exception& e) {
+        *error = TarnHandleCaughtException(kTag, &e);
+    } catch (...) {
+        *error = TarnHandleCaughtException(kTag, nullptr);
+    }
+}
+
+}  // namespace
+
 void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
                              const conduit::Event& event, TarnClientIdentity::Reuse* reuse) {
     if (event.kind != conduit::Event::Kind::Message || !event.message) return;
@@ -126,8 +142,11 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
         TarnClientIdentityRef identity =
             TarnClientIdentity::clientIdentityWithConduitConnection(peer, codeSignInfo, reuse);
         TarnEntitlementGate gate = TarnCheckEntitlements(identity, *row);
-        if (identity && gate.admitted) {
-            uint64_t result = TarnCodeSigningMapping::sharedInstance()->processCallerRegisteredEntitlements(
+        // Without a code-signing store (it could not be opened) there is
+        // nothing to register; the request itself still goes ahead.
+        TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance();
+        if (identity && gate.admitted && mapping) {
+            uint64_t result = mapping->processCallerRegisteredEntitlements(
                 *identity->entitlements().asDict(), identity->bundleIdentifier(), commandQueue.get());
             if (result != TarnSuccess)
                 TarnLog(kLogError, "checkEntitlementsAndInitClientObject",
@@ -147,14 +166,10 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
         }
         if (connection) {
             tCurrentReply = &reply;
-            try {
-                row->handler(request, reply->body(), connection.get(), &error);
-                connection->completeWithError(&error);
-            } catch (const std::exception& e) {
-                error = TarnHandleCaughtException(kTag, &e);
-            } catch (...) {
-                error = TarnHandleCaughtException(kTag, nullptr);
-            }
+            // The queue runs even after a handler that threw: what was queued
+            // before (staged deletions, say) was asked for by this request.
+            guardOperation(&error, [&] { row->handler(request, reply->body(), connection.get(), &error); });
+            guardOperation(&error, [&] { connection->completeWithError(&error); });
             tCurrentReply = nullptr;
         }
         PersonaRoster::setCurrentPersonaUniqueString(std::nullopt);
