@@ -51,6 +51,20 @@ bool TarnCommandQueue::executeAllUntilExhaustedOrError(uint64_t* error) {
     return false;
 }
 
+std::vector<std::shared_ptr<TarnCommand>> TarnCommandQueue::commands() {
+    MutexLock lock(mu_);
+    return {commands_.begin(), commands_.end()};
+}
+
+void TarnCommandQueue::removeAllCommands() {
+    std::list<std::shared_ptr<TarnCommand>> dropped;
+    {
+        MutexLock lock(mu_);
+        dropped.swap(commands_);
+    }
+    // Released outside the lock: a command's destructor may queue or log.
+}
+
 size_t TarnCommandQueue::TEST_count() {
     MutexLock lock(mu_);
     return commands_.size();

@@ -9,6 +9,7 @@
 #include <cstdint>
 #include <list>
 #include <memory>
+#include <vector>
 
 #include "Platform/Dispatch.h"
 #include "Platform/ThreadAnnotations.h"
@@ -38,6 +39,10 @@ public:
     // Runs commands until the queue is empty (true, *error untouched) or one
     // fails (false, its code in *error; later commands stay queued).
     bool executeAllUntilExhaustedOrError(uint64_t* error);
+    // The commands still queued, first to run first.
+    std::vector<std::shared_ptr<TarnCommand>> commands();
+    // Drops what is still queued: a request whose queue failed ends there.
+    void removeAllCommands();
     size_t TEST_count();
 
 private:

@@ -349,8 +349,12 @@ void TarnHandleDeleteDeathRowCommand(const PlistValue& request, PlistValue& repl
                                      TarnClientConnection* connection, uint64_t* error) {
     // Run what the request queued (entitlement registration) before the pass
     // starts: a failure there must be the one reply, not a second one after
-    // the completion's. The processor's own run then finds the queue empty.
-    if (!connection->completeWithError(error)) return;
+    // the completion's. The processor's own run then finds the queue empty;
+    // after a failure the rest is dropped, as the request ends at its first.
+    if (!connection->completeWithError(error)) {
+        connection->commandQueue()->removeAllCommands();
+        return;
+    }
     std::shared_ptr<TarnDeferredReply> deferred = TarnTakeDeferredReply();
     if (!deferred) {
         // Called outside a request (no reply to keep): just start the pass.

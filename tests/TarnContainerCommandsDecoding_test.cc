@@ -265,15 +265,27 @@ TEST_F(ContainerCommandsDecodingTest, DeathRowCommandRunsQueuedWorkFirst) {
             return false;
         }
     };
+    struct Counting : TarnCommand {
+        explicit Counting(int* n) : n(n) {}
+        uint64_t command() const override { return 98; }
+        bool fromQueue(TarnCommandQueue*, uint64_t*) override { return ++*n, true; }
+        int* n;
+    };
+    int laterRan = 0;
     auto queue = std::make_shared<TarnCommandQueue>();
     queue->insertCommand(std::make_shared<Failing>());
+    queue->insertCommand(std::make_shared<Counting>(&laterRan));
     auto connection = TarnClientConnection::initWithClientIdentity(
         nullptr, true, true, true, std::nullopt, std::nullopt, queue);
     PlistValue reply{PlistDict{}};
     uint64_t error = TarnSuccess;
     TarnHandleDeleteDeathRowCommand(PlistValue(PlistDict{}), reply, connection.get(), &error);
     EXPECT_EQ(error, TarnErrorCacheRemoveFailed);
-    EXPECT_EQ(queue->TEST_count(), 0u);
+    // What followed the failure never runs, not even in the processor's own
+    // run after the handler.
+    EXPECT_TRUE(queue->commands().empty());
+    EXPECT_TRUE(connection->completeWithError(&error));
+    EXPECT_EQ(laterRan, 0);
 }
 
 }  // namespace
