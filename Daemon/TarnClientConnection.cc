@@ -212,27 +212,34 @@ void TarnClientConnection::deleteContainersOnDeathRowWithCompletion(
     std::function<void(uint64_t)> completion) {
     // The pass owns nothing of the connection, which may be gone when it runs.
     transactionAsync(TarnDeathRowQueue(), [completion = std::move(completion)] {
-        const FileURL deathRow = TarnGlobalConfiguration::sharedInstance().deathrowDirectory();
-        TarnErrorRef listError;
-        auto items =
-            TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow, &listError);
+        static constexpr const char* kOperation = "deleteContainersOnDeathRowWithCompletion";
         uint64_t result = TarnSuccess;
-        if (!items) {
-            if (!(listError && listError->posixCode() == ENOENT)) {
-                TarnErrorRef e =
-                    TARN_ERROR(TarnErrorDeleteFailed, listError,
-                               "Failed to get items for deletion: %@ : %@", deathRow, listError);
-                result = e->code();
-            }
-        } else {
-            for (const FileURL& item : *items) {
-                TarnErrorRef removeError;
-                if (!_removeItemOrMoveToTempAtURL(item, &removeError)) {
-                    TarnErrorRef e = TARN_ERROR(TarnErrorDestroyFailed, removeError,
-                                                "Failed to destroy item at: %@", item);
+        try {
+            const FileURL deathRow = TarnGlobalConfiguration::sharedInstance().deathrowDirectory();
+            TarnErrorRef listError;
+            auto items =
+                TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow, &listError);
+            if (!items) {
+                if (!(listError && listError->posixCode() == ENOENT)) {
+                    TarnErrorRef e = TARN_ERROR_IN(kOperation, TarnErrorDeleteFailed, listError,
+                                                   "Failed to get items for deletion: %@ : %@",
+                                                   deathRow, listError);
                     result = e->code();
                 }
+            } else {
+                for (const FileURL& item : *items) {
+                    TarnErrorRef removeError;
+                    if (!_removeItemOrMoveToTempAtURL(item, &removeError)) {
+                        TarnErrorRef e = TARN_ERROR_IN(kOperation, TarnErrorDestroyFailed, removeError,
+                                                       "Failed to destroy item at: %@", item);
+                        result = e->code();
+                    }
+                }
             }
+        } catch (const std::exception& e) {
+            result = TarnHandleCaughtException(kOperation, &e);
+        } catch (...) {
+            result = TarnHandleCaughtException(kOperation, nullptr);
         }
         if (completion) completion(result);
     });
@@ -635,12 +642,24 @@ std::optional<std::vector<TarnMetadataRef>> TarnClientConnection::containersWith
 
 void TarnClientConnection::deleteContainerWithContainerIdentity(
     const TarnContainerIdentityRef& identity, bool transient, uint64_t* error) {
+    try {
+        _deleteContainerWithContainerIdentity(identity, transient, error);
+    } catch (const std::exception& e) {
+        TarnSetError(error, TarnHandleCaughtException(__func__, &e));
+    } catch (...) {
+        TarnSetError(error, TarnHandleCaughtException(__func__, nullptr));
+    }
+}
+
+void TarnClientConnection::_deleteContainerWithContainerIdentity(
+    const TarnContainerIdentityRef& identity, bool transient, uint64_t* error) {
+    static constexpr const char* kOperation = "deleteContainerWithContainerIdentity";
     uint64_t code = TarnSuccess;
     TarnMetadataRef metadata =
         createOrLookupContainerWithContainerIdentity(identity, false, transient, true, &code);
     TarnConcreteContainerIdentityRef concrete = metadata ? metadata->containerIdentity() : nullptr;
     if (!concrete) {
-        TarnLog(kLogError, __func__,
+        TarnLog(kLogError, kOperation,
                 "Failed to lookup existing container to delete-identity: %@, transient: %d",
                 identity, transient);
         TarnSetError(error, code == TarnSuccess ? TarnErrorInvalidArgument : code);
@@ -653,7 +672,16 @@ void TarnClientConnection::deleteContainerWithContainerIdentity(
 }
 
 bool TarnClientConnection::completeWithError(uint64_t* error) {
-    return commandQueue_->executeAllUntilExhaustedOrError(error);
+    // A command that throws fails on its own (the queue catches it); this
+    // catches what the queue itself may throw, out of memory for one.
+    try {
+        return commandQueue_->executeAllUntilExhaustedOrError(error);
+    } catch (const std::exception& e) {
+        TarnSetError(error, TarnHandleCaughtException(__func__, &e));
+    } catch (...) {
+        TarnSetError(error, TarnHandleCaughtException(__func__, nullptr));
+    }
+    return false;
 }
 
 // Boot set-up and clean-up steps arrive with the boot maintenance work; start-up

@@ -187,6 +187,9 @@ class TarnClientConnection {
     const PlistValue* lookupValueForKey(const std::string& key) const;
     bool _lookupRuleCommon(TarnContainerClass containerClass, const std::string& identifier,
                            bool withGroupRule);
+    // deleteContainerWithContainerIdentity without its exception guard.
+    void _deleteContainerWithContainerIdentity(const TarnContainerIdentityRef& identity,
+                                               bool transient, uint64_t* error);
 
     // Read-only after construction, except the rights a handler adjusts
     // (booleans, client bundle identifier) on the request's own thread.

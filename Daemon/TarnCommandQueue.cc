@@ -1,6 +1,7 @@
 #include "Daemon/TarnCommandQueue.h"
 
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnRequestProcessor.h"
 #include "Platform/PlatformLog.h"
 
 namespace tarn {
@@ -34,7 +35,16 @@ bool TarnCommandQueue::executeNextCommandWithError(uint64_t* error) {
         const void* p = next.get();
         PlatformLog("unspecified", PlatformLogType::Info, "Executing command <%p; %llu>...", p,
                     next->command());
-        ok = next->fromQueue(this, &code);
+        // A command that throws fails with 40; nothing escapes the work item.
+        try {
+            ok = next->fromQueue(this, &code);
+        } catch (const std::exception& e) {
+            ok = false;
+            code = TarnHandleCaughtException("fromQueue", &e);
+        } catch (...) {
+            ok = false;
+            code = TarnHandleCaughtException("fromQueue", nullptr);
+        }
         PlatformLog("unspecified", PlatformLogType::Info,
                     "Completed command <%p; %llu>: success = %d, error = %llu", p, next->command(),
                     ok, code);

@@ -77,7 +77,13 @@ bool TarnCommandStageForDelete::fromQueue(TarnCommandQueue* queue, uint64_t* err
     }
     if (useLocking_) gTarnLocks.unlock_all_identifiers();
     if (ok) return true;
-    if (onError_) onError_(code);
+    try {
+        if (onError_) onError_(code);
+    } catch (const std::exception& e) {
+        (void)TarnHandleCaughtException(__func__, &e);  // the staging's own code is the answer
+    } catch (...) {
+        (void)TarnHandleCaughtException(__func__, nullptr);
+    }
     TarnSetError(error, code);
     return false;
 }
@@ -109,8 +115,8 @@ bool TarnCommandStageForDelete::stageAll(TarnCommandQueue* queue, uint64_t* erro
             TarnErrorRef removeError;
             if (!fm.removeItemAtURL(url, &removeError)) {
                 // Logged only: the container stays live and cached, the others go on.
-                (void)TARN_ERROR(TarnErrorDeleteFailed, removeError,
-                                 "Failed to delete container at %@: %@", url, removeError);
+                (void)TARN_ERROR_IN("fromQueue", TarnErrorDeleteFailed, removeError,
+                                    "Failed to delete container at %@: %@", url, removeError);
                 continue;
             }
         }
@@ -119,8 +125,8 @@ bool TarnCommandStageForDelete::stageAll(TarnCommandQueue* queue, uint64_t* erro
         if (!cache.removeContainerForUserIdentity(
                 container->userIdentity(), container->containerClass(), container->identifier(),
                 container->transient(), &cacheError)) {
-            TarnErrorRef e = TARN_ERROR(
-                TarnErrorCacheRemoveFailed, cacheError,
+            TarnErrorRef e = TARN_ERROR_IN(
+                "fromQueue", TarnErrorCacheRemoveFailed, cacheError,
                 "Failed to remove from cache id: %@, class: %ld, transient: %d",
                 container->identifier(), static_cast<int64_t>(container->containerClass()),
                 container->transient());

@@ -2,10 +2,13 @@
 
 #include <gtest/gtest.h>
 
+#include <stdexcept>
 #include <thread>
 
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Daemon/TarnWhitelist.h"
+#include "Platform/HostConfiguration.h"
+#include "Platform/PlatformLog.h"
 #include "support/ScratchRoot.h"
 
 namespace tarn {
@@ -144,6 +147,25 @@ TEST_F(TarnClientConnectionTest, CompleteRunsTheCommandQueue) {
     EXPECT_FALSE(c->completeWithError(&error));
     EXPECT_EQ(error, TarnErrorDestroyFailed);
     EXPECT_EQ(ran, 2);
+
+    // A command that throws fails with 40 and stops the run like any failure.
+    struct Throwing : TarnCommand {
+        uint64_t command() const override { return 97; }
+        bool fromQueue(TarnCommandQueue*, uint64_t*) override { throw std::runtime_error("boom"); }
+    };
+    PlatformLogSetQuiet(true);
+    const HostConfiguration saved = HostConfiguration::shared();
+    HostConfiguration customer = saved;
+    customer.internalBuild = false;  // an internal build stops at an exception, by design
+    HostConfiguration::TEST_setShared(customer);
+    auto d = caller("com.client");
+    d->commandQueue()->insertCommand(std::make_shared<Throwing>());
+    d->commandQueue()->insertCommand(std::make_shared<Counting>(&ran, true));
+    error = TarnSuccess;
+    EXPECT_FALSE(d->completeWithError(&error));
+    EXPECT_EQ(error, TarnErrorException);
+    EXPECT_EQ(d->commandQueue()->commands().size(), 1u);
+    HostConfiguration::TEST_setShared(saved);
 }
 
 }  // namespace
