@@ -265,8 +265,12 @@ bool TarnClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& url, Tarn
         auto unique = fm.createTemporaryDirectoryInDirectoryURL(tmp, "tarnkeeperd.", &moveError);
         if (unique) destination = PathJoin(*unique, PathLastComponent(url));
     }
-    if (!fm.moveItemAtURL(url, destination, &moveError)) {
-        if (moveError && moveError->posixCode() == ENOENT) return true;
+    // A rename only: where /tmp is another volume a copy would fail to remove
+    // its source for the same reason, and every pass would leave one more copy.
+    if (!fm.renameItemAtURL(url, destination, &moveError)) {
+        // Gone meanwhile is done; a missing /tmp is not.
+        if (moveError && moveError->posixCode() == ENOENT && fm.itemDoesNotExistAtURL(url))
+            return true;
         if (error)
             *error = TARN_ERROR(TarnErrorMoveFailed, moveError, "Failed to move dir: %@ to: %@",
                                 url, "/tmp");

@@ -430,6 +430,17 @@ bool TarnFileManager::copyItemIfExistsAtURL(const FileURL& url, const FileURL& t
     return _copyItemAtURL(url, toURL, false, error);
 }
 
+bool TarnFileManager::renameItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error) {
+    int err = 0;
+    if (auto fp = TARN_FAILPOINT("fm.move"))
+        err = *fp;
+    else
+        err = FsRename(url, toURL);
+    if (err == 0) return true;
+    setError(error, TARN_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", url, toURL, errText(err)));
+    return false;
+}
+
 bool TarnFileManager::_moveItemAtURL(const FileURL& url, const FileURL& toURL, bool failIfSrcMissing,
                                      TarnErrorRef* error) {
     if (!failIfSrcMissing) {

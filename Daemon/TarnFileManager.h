@@ -153,6 +153,10 @@ public:
     bool moveItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
     // A missing source succeeds and moves nothing.
     bool moveItemIfExistsAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
+    // One rename and nothing else: across volumes it fails (EXDEV) rather
+    // than copy. For an item whose removal failed, a copy would only leave a
+    // second one behind.
+    bool renameItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
     // Recursive copy: data, mode, owner, times, xattrs, ACLs; links as links.
     bool copyItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
     bool copyItemIfExistsAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);

@@ -107,6 +107,35 @@ TEST_F(TarnDeathRowTest, AnUndeletableItemNeverReplacesWhatTmpHolds) {
     EXPECT_EQ(moved, 1u) << "it sits in a directory of its own";
 }
 
+// Where /tmp is another volume the item stays on death row: a copy there
+// would be made again by every pass, as its source cannot be removed either.
+TEST_F(TarnDeathRowTest, AnUndeletableItemIsNeverCopiedToTmp) {
+    TarnErrorRef error;
+    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(makeItem("stuck"), true, false, &error));
+    ASSERT_TRUE(FailpointSet("fm.remove", "errno:1"));
+    ASSERT_TRUE(FailpointSet("fm.move", "errno:18"));  // EXDEV
+    EXPECT_EQ(pass(), TarnErrorDestroyFailed);
+    EXPECT_EQ(pass(), TarnErrorDestroyFailed);
+    EXPECT_EQ(deathRowCount(), 1u);
+    EXPECT_TRUE(fs::is_empty(root_.at("/tmp")));
+    FailpointClearAll();
+    EXPECT_EQ(pass(), TarnSuccess);
+    EXPECT_EQ(deathRowCount(), 0u);
+}
+
+// A /tmp that is missing and cannot be made is a failure, not "already gone".
+TEST_F(TarnDeathRowTest, AMissingTmpIsNotTakenForAGoneItem) {
+    TarnErrorRef error;
+    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(makeItem("stuck"), true, false, &error));
+    fs::remove_all(root_.at("/tmp"));
+    ASSERT_TRUE(FailpointSet("fm.remove", "errno:1"));
+    ASSERT_TRUE(FailpointSet("fm.createDirectory", "errno:13"));
+    EXPECT_EQ(pass(), TarnErrorDestroyFailed);
+    EXPECT_EQ(deathRowCount(), 1u);
+    FailpointClearAll();
+    EXPECT_EQ(pass(), TarnSuccess);
+}
+
 TEST_F(TarnDeathRowTest, ItemThatCanBeNeitherRemovedNorMovedStaysAndThePassGoesOn) {
     TarnErrorRef error;
     for (const char* name : {"a", "b", "c"})
