@@ -68,7 +68,9 @@ class ScopedGlobalWriteLock {
 };
 
 // Runs an operation's body so that no exception leaves the operation: a
-// caught one becomes code 40 (or ends the process on internal builds).
+// caught one becomes code 40 (or ends the process on internal builds). Each
+// operation keeps its name in `operation` for the body's errors and lines:
+// inside the lambda __func__ would read "operator()".
 template <class Body>
 auto catchingExceptions(const char* function, uint64_t* error, Body&& body) -> decltype(body()) {
     try {
@@ -101,9 +103,10 @@ TarnMetadataRef lookUp(const TarnConcreteContainerIdentityRef& identity) {
 
 TarnMetadataRef TarnClientConnection::metadataWithContainerIdentity(
     const TarnConcreteContainerIdentityRef& identity, uint64_t* error) {
-    return catchingExceptions(__func__, error, [&]() -> TarnMetadataRef {
+    const char* const operation = __func__;
+    return catchingExceptions(operation, error, [&]() -> TarnMetadataRef {
         if (!identity) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorNotFound, nullptr,
                                            "No Container with user identity: %@", identity));
             return nullptr;
         }
@@ -113,7 +116,7 @@ TarnMetadataRef TarnClientConnection::metadataWithContainerIdentity(
             metadata = lookUp(identity);
         }
         if (!metadata)
-            setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorNotFound, nullptr,
                                            "No Container with user identity: %@", identity));
         return metadata;
     });
@@ -122,21 +125,22 @@ TarnMetadataRef TarnClientConnection::metadataWithContainerIdentity(
 std::optional<PlistValue> TarnClientConnection::infoValueForKey(
     const std::optional<std::string>& key,
     const TarnConcreteContainerIdentityRef& containerIdentity, bool useLocking, uint64_t* error) {
-    return catchingExceptions(__func__, error, [&]() -> std::optional<PlistValue> {
+    const char* const operation = __func__;
+    return catchingExceptions(operation, error, [&]() -> std::optional<PlistValue> {
         if (!key) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorBadInput, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorBadInput, nullptr,
                                            "Can't get nil or non-string key: %@", key));
             return std::nullopt;
         }
         if (!containerIdentity) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorNotFound, nullptr,
                                            "No Container with identity: %@", containerIdentity));
             return std::nullopt;
         }
         ScopedIdentifierLock lock(lockNameFor(containerIdentity), false, useLocking);
         TarnMetadataRef metadata = lookUp(containerIdentity);
         if (!metadata) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorNotFound, nullptr,
                                            "No Container with identity: %@", containerIdentity));
             return std::nullopt;
         }
@@ -144,7 +148,7 @@ std::optional<PlistValue> TarnClientConnection::infoValueForKey(
         if (!value) {
             // An absent key is an ordinary answer (every first disk-usage
             // request of a bundle asks), so it stays out of the log.
-            setErrorFrom(error, TARN_ERROR_SILENT(TarnErrorInfoValueNotFound, nullptr,
+            setErrorFrom(error, TARN_ERROR_SILENT_IN(operation, TarnErrorInfoValueNotFound, nullptr,
                                                   "Didn't find info value for key: %@", key));
             return std::nullopt;
         }
@@ -156,21 +160,22 @@ void TarnClientConnection::setInfoValue(const std::optional<PlistValue>& value,
                                         const std::optional<std::string>& forKey,
                                         const TarnConcreteContainerIdentityRef& containerIdentity,
                                         bool useLocking, uint64_t* error) {
-    catchingExceptions(__func__, error, [&] {
+    const char* const operation = __func__;
+    catchingExceptions(operation, error, [&] {
         if (!forKey) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorBadInput, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorBadInput, nullptr,
                                            "Can't set nil or non-string key: %@", forKey));
             return;
         }
         if (!containerIdentity) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorNotFound, nullptr,
                                            "No Container with identity: %@", containerIdentity));
             return;
         }
         ScopedIdentifierLock lock(lockNameFor(containerIdentity), true, useLocking);
         TarnMetadataRef metadata = lookUp(containerIdentity);
         if (!metadata) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorNotFound, nullptr,
                                            "No Container with identity: %@", containerIdentity));
             return;
         }
@@ -194,7 +199,7 @@ void TarnClientConnection::setInfoValue(const std::optional<PlistValue>& value,
         TarnErrorRef cacheError;
         if (!TarnContainerCache::sharedInstance().addContainerMetadata(
                 changed, changed->url(), changed->transient(), false, &cacheError)) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorCacheAddFailed, cacheError,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorCacheAddFailed, cacheError,
                                            "Failed to add to cache: %@, url: %@, transient: %d",
                                            changed, changed->url(), changed->transient()));
         }
@@ -203,10 +208,11 @@ void TarnClientConnection::setInfoValue(const std::optional<PlistValue>& value,
 
 uint64_t TarnClientConnection::diskUsageWithContainerIdentity(
     const TarnConcreteContainerIdentityRef& identity, uint64_t* error) {
-    return catchingExceptions(__func__, error, [&]() -> uint64_t {
+    const char* const operation = __func__;
+    return catchingExceptions(operation, error, [&]() -> uint64_t {
         const bool fastSizing = HostConfiguration::shared().featureEnabled("fast_container_sizing");
         if (!identity) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorNotFound, nullptr,
                                            "No Container with identity: %@", identity));
             return 0;
         }
@@ -217,8 +223,9 @@ uint64_t TarnClientConnection::diskUsageWithContainerIdentity(
             ScopedIdentifierLock lock(lockNameFor(identity), false);
             metadata = lookUp(identity);
             if (!metadata) {
-                setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
-                                               "No Container with identity: %@", identity));
+                // A plain line and a code here, not an error value.
+                TarnLog(kLogError, operation, "No Container with identity: %@", identity);
+                TarnSetError(error, TarnErrorNotFound);
                 return 0;
             }
             if (isBundle) {
@@ -228,7 +235,7 @@ uint64_t TarnClientConnection::diskUsageWithContainerIdentity(
                 if (value)
                     remembered = value->asUInt64();
                 else if (infoError != TarnErrorInfoValueNotFound)
-                    TarnLog(kLogError, __func__,
+                    TarnLog(kLogError, operation,
                             "Error looking up info value for identity: %@: %llu", identity,
                             infoError);
             }
@@ -248,7 +255,7 @@ uint64_t TarnClientConnection::diskUsageWithContainerIdentity(
             setInfoValue(PlistValue(bytes), std::string(kStaticDiskUsageKey), identity, true,
                          &setError);
             if (setError != TarnSuccess)
-                TarnLog(kLogError, __func__, "Error setting info value for identity: %@: %llu",
+                TarnLog(kLogError, operation, "Error setting info value for identity: %@: %llu",
                         identity, setError);
         }
         return bytes;
@@ -257,16 +264,17 @@ uint64_t TarnClientConnection::diskUsageWithContainerIdentity(
 
 void TarnClientConnection::recreateDefaultStructureWithContainerIdentity(
     const TarnConcreteContainerIdentityRef& identity, uint64_t* error) {
-    catchingExceptions(__func__, error, [&] {
+    const char* const operation = __func__;
+    catchingExceptions(operation, error, [&] {
         if (!identity) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorNotFound, nullptr,
                                            "No Container with identity: %@", identity));
             return;
         }
         ScopedIdentifierLock lock(lockNameFor(identity), true);
         TarnMetadataRef metadata = lookUp(identity);
         if (!metadata) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorNotFound, nullptr,
                                            "No Container with identity: %@", identity));
             return;
         }
@@ -287,10 +295,11 @@ void TarnClientConnection::recreateDefaultStructureWithContainerIdentity(
 
 void TarnClientConnection::regenerateDirectoryUUIDWithContainerIdentity(
     const TarnConcreteContainerIdentityRef& identity, uint64_t* error) {
-    catchingExceptions(__func__, error, [&] {
+    const char* const operation = __func__;
+    catchingExceptions(operation, error, [&] {
         TarnMetadataRef metadata = identity ? lookUp(identity) : nullptr;
         if (!metadata) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorNotFound, nullptr,
                                            "No Container with identity: %@", identity));
             return;
         }
@@ -299,7 +308,7 @@ void TarnClientConnection::regenerateDirectoryUUIDWithContainerIdentity(
         // must not be undone by putting the earlier record back.
         metadata = lookUp(identity);
         if (!metadata) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorNotFound, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorNotFound, nullptr,
                                            "No Container with identity: %@", identity));
             return;
         }
@@ -307,7 +316,7 @@ void TarnClientConnection::regenerateDirectoryUUIDWithContainerIdentity(
         const std::string lastComponent = PathLastComponent(oldURL);
         // Well-known system containers keep their fixed name.
         if (!Uuid::parse(lastComponent)) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorInvalidArgument, nullptr,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorInvalidArgument, nullptr,
                                            "Non-UUID last path component: %@ for %@", lastComponent,
                                            identity));
             return;
@@ -316,14 +325,14 @@ void TarnClientConnection::regenerateDirectoryUUIDWithContainerIdentity(
         TarnErrorRef moveError;
         if (!TarnFileManager::defaultManager().moveItemAtURL(oldURL, newURL, &moveError)) {
             setErrorFrom(error,
-                         TARN_ERROR(TarnErrorUUIDMoveFailed, moveError,
+                         TARN_ERROR_IN(operation, TarnErrorUUIDMoveFailed, moveError,
                                     "Failed to move dir: %@ to new UUID dir: %@", oldURL, newURL));
             return;
         }
         TarnErrorRef cacheError;
         if (!TarnContainerCache::sharedInstance().addContainerMetadata(
                 metadata, newURL, metadata->transient(), true, &cacheError)) {
-            setErrorFrom(error, TARN_ERROR(TarnErrorCacheAddFailed, cacheError,
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorCacheAddFailed, cacheError,
                                            "Failed to add to cache: %@, url: %@, transient: %d",
                                            metadata, newURL, metadata->transient()));
         }

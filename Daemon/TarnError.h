@@ -142,6 +142,9 @@ inline void TarnSetError(uint64_t* slot, uint64_t code) {
 #define TARN_ERROR_IN(function, code, underlying, fmt, ...)                                  \
     ::tarn::TarnErrorMake((function), __LINE__, (code), (underlying), true,                   \
                           ::tarn::Format((fmt)__VA_OPT__(, ) __VA_ARGS__))
+#define TARN_ERROR_SILENT_IN(function, code, underlying, fmt, ...)                           \
+    ::tarn::TarnErrorMake((function), __LINE__, (code), (underlying), false,                  \
+                          ::tarn::Format((fmt)__VA_OPT__(, ) __VA_ARGS__))
 // Same, not logged.
 #define TARN_ERROR_SILENT(code, underlying, fmt, ...)                                        \
     ::tarn::TarnErrorMake(__func__, __LINE__, (code), (underlying), false,                    \

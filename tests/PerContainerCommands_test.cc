@@ -107,6 +107,10 @@ TEST_F(PerContainerCommandsTest, InfoValuesRoundTripAndAbsentValueRemovesTheKey)
     EXPECT_EQ(daemon_->sendError(admin_, request(6, id, 1, app.uuid, R"(, "Key": 7)")), 38u);
     EXPECT_EQ(daemon_->sendError(admin_, request(6, id, 1, Uuid::generate(), R"(, "Key": "k")")),
               21u);
+    // The line is tagged with the operation that failed.
+    const std::string log = daemon_->platformLog();
+    EXPECT_NE(log.find("[infoValueForKey] "), std::string::npos);
+    EXPECT_EQ(log.find("[operator()]"), std::string::npos);
 }
 
 TEST_F(PerContainerCommandsTest, DiskUsageIsHeldAtGateTwoAndRememberedForBundles) {
