@@ -10,6 +10,7 @@
 #include "Daemon/TarnFileManager.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnLog.h"
+#include "Daemon/TarnRequestProcessor.h"
 #include "Daemon/TarnTestLocks.h"
 #include "Daemon/TarnWhitelist.h"
 #include "Platform/ContainerLibrary.h"
@@ -46,11 +47,9 @@ const FileURL& metadataFileURL(std::string_view container) {
     return buffer;
 }
 
-TarnErrorRef exceptionError(const char* function, int line, const std::exception* e) {
-    return TarnErrorMake(
-        function, line, TarnErrorException, nullptr, true,
-        Format("Got exception: %@ : %@", e ? e->what() : "unknown exception", "(no call stack)"));
-}
+// The name the look-up's errors and lines carry: the work is done in a
+// private helper, but the operation is the public one.
+constexpr const char* kLookupOperation = "containerForContainerIdentity";
 
 }  // namespace
 
@@ -226,7 +225,7 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
                                                                contentClass) &&
             !_setSandboxContainerMapping(userIdentity, identifier, contentClass,
                                          metadata->url().c_str())) {
-            TarnLog(kLogError, __func__,
+            TarnLog(kLogError, "_lock_getCacheForUserIdentity",
                     "Failed to set container mapping during create/lookup operation of %@, %llu",
                     identifier, contentClass);
         }
@@ -497,9 +496,9 @@ TarnMetadataRef TarnContainerCache::containerForContainerIdentity(
         return _containerForContainerIdentity(identity, transient, updateSandbox, allowKernelLookup,
                                               error);
     } catch (const std::exception& e) {
-        if (error) *error = exceptionError(__func__, __LINE__, &e);
+        if (error) *error = TarnCaughtExceptionError(__func__, &e);
     } catch (...) {
-        if (error) *error = exceptionError(__func__, __LINE__, nullptr);
+        if (error) *error = TarnCaughtExceptionError(__func__, nullptr);
     }
     return nullptr;
 }
@@ -508,7 +507,7 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
     const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox,
     bool allowKernelLookup, TarnErrorRef* error) {
     if (!identity) {
-        if (error) *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Cache: nil identity");
+        if (error) *error = TARN_ERROR_IN(kLookupOperation, TarnErrorCacheInvalidInput, nullptr, "Cache: nil identity");
         return nullptr;
     }
     const TarnUserIdentityRef& userIdentity = identity->userIdentity();
@@ -539,7 +538,7 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
                 if (!dictionary) {
                     const char* relative = TarnContainerClassRelativeDirectory(containerClass);
                     if (error)
-                        *error = TARN_ERROR(TarnErrorCacheRebuildFailed, buildError,
+                        *error = TARN_ERROR_IN(kLookupOperation, TarnErrorCacheRebuildFailed, buildError,
                                             "Cache: [%@]-%@%@: Failed to rebuild",
                                             userIdentity ? userIdentity->identifier() : "(null)",
                                             relative ? relative : "(null)", marker);
@@ -549,7 +548,7 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
             auto it = dictionary->find(identifier);
             if (it == dictionary->end()) {
                 if (error)
-                    *error = TARN_ERROR(TarnErrorNotFound, nullptr,
+                    *error = TARN_ERROR_IN(kLookupOperation, TarnErrorNotFound, nullptr,
                                         "Cache: %@%@: Container Not Found with ID: %@", key(), marker,
                                         identifier);
                 return nullptr;
@@ -560,7 +559,7 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
 
     if (metadata->url().empty() || metadata->url()[0] != '/') {
         if (error)
-            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr,
+            *error = TARN_ERROR_IN(kLookupOperation, TarnErrorCacheInvalidInput, nullptr,
                                 "Cache: %@%@: Invalid URL path string: %@", key(), marker,
                                 metadata->url());
         return nullptr;
@@ -569,20 +568,20 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
         const FileURL metadataFile = PathJoin(metadata->url(), kTarnMetadataFileName);
         if (error)
             *error =
-                TARN_ERROR(TarnErrorCacheInconsistent, nullptr,
+                TARN_ERROR_IN(kLookupOperation, TarnErrorCacheInconsistent, nullptr,
                            "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu",
                            key(), marker, metadataFile, identifier, containerClass);
         TarnErrorRef removeError;
         if (!removeContainerForUserIdentity(userIdentity, containerClass, identifier, transient,
                                             &removeError)) {
-            TarnLog(kLogError, __func__,
+            TarnLog(kLogError, kLookupOperation,
                     "Failed to remove from cache user: %@, id: %@, class: %llu, transient: %d : %@",
                     userIdentity, identifier, containerClass, transient, removeError);
         }
         return nullptr;
     }
     if (TarnLogShouldWrite(kLogDebug))
-        TarnLog(kLogDebug, __func__, "Cache: %@%@: Found Identifier: %@", key(), marker,
+        TarnLog(kLogDebug, kLookupOperation, "Cache: %@%@: Found Identifier: %@", key(), marker,
                 identifier);
     return metadata;
 }
@@ -651,7 +650,10 @@ std::optional<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersFor
                 *dictionary, [&](const TarnMetadataRef& m) { all.push_back(m); });
         }
     } catch (const std::exception& e) {
-        if (error) *error = exceptionError(__func__, __LINE__, &e);
+        if (error) *error = TarnCaughtExceptionError(__func__, &e);
+        return std::nullopt;
+    } catch (...) {
+        if (error) *error = TarnCaughtExceptionError(__func__, nullptr);
         return std::nullopt;
     }
 

@@ -194,13 +194,16 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
     }
 }
 
-uint64_t TarnHandleCaughtException(const char* function, const std::exception* exception) {
+TarnErrorRef TarnCaughtExceptionError(const char* function, const std::exception* exception) {
     if (HostConfiguration::shared().internalBuild) TarnFatalExceptionReport(exception);
     std::string name = exception ? typeid(*exception).name() : "unknown exception";
     std::string reason = exception ? exception->what() : "";
-    auto err = TarnErrorMake(function, __LINE__, TarnErrorException, nullptr, true,
-                             Format("Got exception: %@ : %@", name, reason));
-    return err->code();
+    return TarnErrorMake(function, __LINE__, TarnErrorException, nullptr, true,
+                         Format("Got exception: %@ : %@", name, reason));
+}
+
+uint64_t TarnHandleCaughtException(const char* function, const std::exception* exception) {
+    return TarnCaughtExceptionError(function, exception)->code();
 }
 
 namespace {

@@ -8,6 +8,7 @@
 #include <optional>
 
 #include "Daemon/TarnClientIdentity.h"
+#include "Daemon/TarnError.h"
 #include "Platform/PropertyList.h"
 
 namespace tarn {
@@ -42,6 +43,8 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
 // builds it ends the process with the fatal report; otherwise it logs
 // "Got exception: %@ : %@" and answers 40.
 uint64_t TarnHandleCaughtException(const char* function, const std::exception* exception);
+// The same, answering the error value for operations that hand one back.
+TarnErrorRef TarnCaughtExceptionError(const char* function, const std::exception* exception);
 
 // Builds the report text, stores it in the crash message slot and aborts.
 [[noreturn]] void TarnFatalExceptionReport(const std::exception* exception);
