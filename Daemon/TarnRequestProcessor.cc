@@ -175,11 +175,13 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
         PersonaRoster::setCurrentPersonaUniqueString(std::nullopt);
     }
 
-    static const std::string kUnknownClient = "<unknown>";
-    const TarnClientIdentityRef* clientIdentity = connection ? &connection->clientIdentity() : nullptr;
-    const std::string& client = clientIdentity && *clientIdentity && !(*clientIdentity)->bundleIdentifier().empty()
-                                    ? (*clientIdentity)->bundleIdentifier()
-                                    : kUnknownClient;
+    // "<unknown>" means no connection was made; a connection without a bundle
+    // identifier (a caller admitted without an identity) prints as nil does.
+    std::string client = "<unknown>";
+    if (connection) {
+        client = connection->clientBundleIdentifier();
+        if (client.empty()) client = "(null)";
+    }
     if (recording)
         signpost.end({{"command", std::to_string(command)}, {"clientIdentifier", client}});
     else

@@ -59,6 +59,21 @@ TEST_F(DaemonSpineTest, CommandTableAndGateOverIpc) {
     EXPECT_EQ(count("identifier=com.x"), 0u);
 }
 
+// A caller without a registration is still served a command any client may
+// send; its line names no client, unlike a request refused outright.
+TEST_F(DaemonSpineTest, AnUnregisteredCallerIsLoggedAsNil) {
+    daemon_->start();
+    std::string why;
+    auto client = conduit::Client::connect(daemon_->socketPath(), &why);
+    ASSERT_TRUE(client) << why;
+    PlistValue request{PlistDict{}};
+    request.set("Command", uint64_t{0});
+    request.set("Identifier", "com.ostrea.test.nobody");
+    request.set("ContainerClass", uint64_t{2});
+    ASSERT_TRUE(client->sendSync(request, std::chrono::seconds(10), &why)) << why;
+    EXPECT_EQ(count("command=0, client=(null), error="), 1u);
+}
+
 // One connection sends many requests; its identity is reused between them,
 // but a change to the peer's registration shows on the very same connection.
 TEST_F(DaemonSpineTest, ARegistrationChangeShowsOnAnOpenConnection) {
