@@ -390,6 +390,8 @@ bool TarnContainerCache::_setSandboxContainerMapping(const TarnUserIdentityRef& 
         if (url) {
             result = sandboxUserState_.setUserStateItemWithPersona(
                 user, persona, itemType, identifier.c_str(), url);
+            // The pair is durable only once written: a failed write is a failed set.
+            if (result == 0) result = batch.end();
             if (result != 0) {
                 PlatformLog("sandbox", PlatformLogType::Error,
                             "Failed to set mapping for user: %u, itemType: %llu, identifier %s, "
@@ -397,6 +399,12 @@ bool TarnContainerCache::_setSandboxContainerMapping(const TarnUserIdentityRef& 
                             user, itemType, identifier, containerClass, path, result);
                 return false;
             }
+        } else if ((result = batch.end()) != 0) {
+            PlatformLog("sandbox", PlatformLogType::Error,
+                        "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, "
+                        "class: %llu, path: %s : %d",
+                        user, itemType, identifier, containerClass, path, result);
+            return false;
         }
     }
     PlatformLog(

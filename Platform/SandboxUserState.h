@@ -103,12 +103,20 @@ class SandboxUserState {
     class Batch {
       public:
         explicit Batch(SandboxUserState& state) : state_(state) { state_.beginBatch(); }
-        ~Batch() { (void)state_.endBatch(); }  // failures are logged by the state itself
+        ~Batch() { (void)end(); }  // failures are logged by the state itself
         Batch(const Batch&) = delete;
         Batch& operator=(const Batch&) = delete;
+        // Ends the batch now: 0, or the errno of the write it made. Inside
+        // an enclosing batch nothing is written yet, and the answer is 0.
+        int end() {
+            if (ended_) return 0;
+            ended_ = true;
+            return state_.endBatch();
+        }
 
       private:
         SandboxUserState& state_;
+        bool ended_ = false;
     };
 };
 

@@ -33,7 +33,12 @@ class FaultySandboxUserState : public FileSandboxUserState {
         return FileSandboxUserState::setUserStateItemWithPersona(uid, personaID, itemType,
                                                                  identifier, path);
     }
+    int endBatch() override {
+        const int written = FileSandboxUserState::endBatch();
+        return failWrites ? ENOSPC : written;
+    }
     bool failSets = false;
+    bool failWrites = false;
     int sets = 0;
 };
 
@@ -268,6 +273,11 @@ TEST_F(TarnContainerCacheTest, PushFailuresKeepTheContainer) {
     EXPECT_TRUE(cache_->setSandboxContainerMappingForUserIdentity(mobile(), "x", 1, "/p"))
         << "bundle classes are never pushed";
     EXPECT_FALSE(cache_->setSandboxContainerMappingForUserIdentity(mobile(), "x", 14, "/p"));
+    // A pair set in memory but not written out is a failed push too.
+    state_->failSets = false;
+    state_->failWrites = true;
+    EXPECT_FALSE(cache_->setSandboxContainerMappingForUserIdentity(mobile(), "y", 2, "/q"));
+    state_->failWrites = false;
 }
 
 TEST_F(TarnContainerCacheTest, ARebuildOfRecordedMappingsWritesNothingButLogsEveryPush) {
