@@ -8,7 +8,7 @@ std::string TarnError::description() const {
     std::string out = Format("Error Domain=%@ Code=%llu", domain_, code_);
     if (description_) out += " \"" + *description_ + "\"";
     out += Format(" UserInfo={FunctionName=%@, SourceFileLine=%d", functionName_, sourceLine_);
-    if (underlying_) out += ", NSUnderlyingError=" + underlying_->description();
+    if (underlying_) out += ", UnderlyingError=" + underlying_->description();
     out += "}";
     return out;
 }

@@ -71,7 +71,7 @@ enum TarnErrorCode : uint64_t {
 };
 
 inline constexpr const char* kTarnErrorDomain = "TarnErrorDomain";
-inline constexpr const char* kPosixErrorDomain = "NSPOSIXErrorDomain";
+inline constexpr const char* kPosixErrorDomain = "PosixErrorDomain";
 
 class TarnError;
 using TarnErrorRef = std::shared_ptr<const TarnError>;

@@ -9,7 +9,7 @@ namespace tarn {
 namespace {
 
 TarnErrorRef formatError(const char* function, int line, std::string description) {
-    return std::make_shared<const TarnError>(kCocoaErrorDomain, kCocoaErrorPropertyListReadCorrupt,
+    return std::make_shared<const TarnError>(kPlatformErrorDomain, kPlatformErrorPropertyListReadCorrupt,
                                              std::move(description), nullptr, function, line);
 }
 

@@ -21,8 +21,8 @@ namespace tarn {
 
 // The platform's general error domain and its "property list has the wrong
 // format" code, given when a file's top level is not a dictionary.
-inline constexpr const char* kCocoaErrorDomain = "NSCocoaErrorDomain";
-inline constexpr uint64_t kCocoaErrorPropertyListReadCorrupt = 2048;
+inline constexpr const char* kPlatformErrorDomain = "PlatformErrorDomain";
+inline constexpr uint64_t kPlatformErrorPropertyListReadCorrupt = 2048;
 
 // Serialises `dictionary` (binary) and writes it to `url`. `withOptions` are
 // TarnFileManager write options (kTarnWriteAtomic, kTarnWriteNoFileProtection).
@@ -30,8 +30,8 @@ bool Tarn_writeToURL(const PlistValue& dictionary, const FileURL& url, uint64_t 
                      TarnErrorRef* error);
 
 // Reads `url` (uncached) and parses it. A top level that is not a dictionary
-// fails with kCocoaErrorPropertyListReadCorrupt; a missing or unreadable file
-// with the POSIX error; a malformed one with kCocoaErrorPropertyListReadCorrupt.
+// fails with kPlatformErrorPropertyListReadCorrupt; a missing or unreadable file
+// with the POSIX error; a malformed one with kPlatformErrorPropertyListReadCorrupt.
 // `options` is reserved for the platform's read options (mutability); 0.
 std::optional<PlistValue> Tarn_dictionaryWithContentsOfURL(const FileURL& url, uint64_t options,
                                                            TarnErrorRef* error);

@@ -119,6 +119,9 @@ TEST(TarnErrorValues, CarryCodePlaceAndOptionalDescription) {
     EXPECT_EQ(*wrapped->localizedDescription(), "Failed to read /x");
     EXPECT_EQ(TarnErrorCodeOf(wrapped, 99), 12u);
     EXPECT_EQ(TarnErrorCodeOf(posix, 99), 99u);
+    EXPECT_NE(wrapped->description().find("UnderlyingError=Error Domain=PosixErrorDomain Code=2"),
+              std::string::npos)
+        << wrapped->description();
     EXPECT_EQ(posix->posixCode(), ENOENT);
     PlatformLogSetQuiet(false);
 }
