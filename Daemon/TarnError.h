@@ -119,11 +119,11 @@ TarnErrorRef TarnErrorMake(const char* functionName, int line, uint64_t code,
 TarnErrorRef TarnPosixErrorMake(const char* functionName, int line, int err,
                                 std::string description);
 
-// The code a handler copies into its error slot: the domain code, or for a
-// foreign error the fallback given.
+// The code a handler copies into its error slot after a failure: the domain
+// code, or the fallback given for a foreign error or none at all (a failure
+// must never read as success).
 inline uint64_t TarnErrorCodeOf(const TarnErrorRef& e, uint64_t fallback) {
-    if (!e) return TarnSuccess;
-    return e->isTarn() ? e->code() : fallback;
+    return e && e->isTarn() ? e->code() : fallback;
 }
 
 // Writes `code` into an optional error slot (no-op for a null slot).

@@ -119,6 +119,7 @@ TEST(TarnErrorValues, CarryCodePlaceAndOptionalDescription) {
     EXPECT_EQ(*wrapped->localizedDescription(), "Failed to read /x");
     EXPECT_EQ(TarnErrorCodeOf(wrapped, 99), 12u);
     EXPECT_EQ(TarnErrorCodeOf(posix, 99), 99u);
+    EXPECT_EQ(TarnErrorCodeOf(nullptr, 99), 99u) << "a failure without a value is no success";
     EXPECT_NE(wrapped->description().find("UnderlyingError=Error Domain=PosixErrorDomain Code=2"),
               std::string::npos)
         << wrapped->description();
