@@ -428,6 +428,9 @@ std::string liveDirectoryName(const std::string& identifier, TarnContainerClass 
 
 // Builds a new container in the staging directory and renames it into place.
 // The caller holds the global write lock (or has taken it over).
+// The operation these helpers do the work of: their errors and lines carry its name.
+constexpr const char* kCreateOrLookup = "createOrLookupContainerWithContainerIdentity";
+
 TarnMetadataRef createContainer(TarnClientConnection& connection,
                                 const TarnContainerIdentityRef& identity, bool transient,
                                 TarnErrorRef* error) {
@@ -451,7 +454,7 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
     if (!connection._createTopLevelContainerDirectory(
             stagingURL, containerClass, userIdentity->posixUIDForContainerClass(containerClass),
             &underlying)) {
-        *error = TARN_ERROR(TarnErrorCreateStagingFailed, underlying,
+        *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorCreateStagingFailed, underlying,
                             "Failed to create staging dir at %@ : %@", stagingURL, underlying);
         return nullptr;
     }
@@ -468,7 +471,7 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
             TarnConcreteContainerIdentity::containerIdentityWithUUID(
                 Uuid::generate(), userIdentity, identifier, containerClass, &identityCode);
         if (!concrete) {
-            failure = TARN_ERROR_CODE(identityCode, nullptr);
+            failure = TARN_ERROR_CODE_IN(kCreateOrLookup, identityCode, nullptr);
             return;
         }
         metadata = TarnMetadata::initWithContainerIdentity(concrete, std::nullopt, stagingURL,
@@ -487,14 +490,14 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
         TarnErrorRef moveError;
         if (!liveParent || !fm.moveItemAtURL(stagingURL, liveURL, &moveError))
             failure =
-                TARN_ERROR(TarnErrorMoveStagingFailed, moveError,
+                TARN_ERROR_IN(kCreateOrLookup, TarnErrorMoveStagingFailed, moveError,
                            "Failed to move staging dir: %@ to live dir: %@", stagingURL, liveURL);
     }();
 
     if (failure) {
         TarnErrorRef cleanupError;
         if (!connection._moveItemAtURLToDeathRow(stagingURL, true, true, &cleanupError))
-            failure = TARN_ERROR(TarnErrorRemoveStagingFailed, cleanupError,
+            failure = TARN_ERROR_IN(kCreateOrLookup, TarnErrorRemoveStagingFailed, cleanupError,
                                  "Failed to remove staging dir: %@", stagingURL);
         *error = failure;
         return nullptr;
@@ -508,7 +511,7 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
     TarnErrorRef cacheError;
     if (!TarnContainerCache::sharedInstance().addContainerMetadata(metadata, liveURL, transient,
                                                                    true, &cacheError)) {
-        *error = TARN_ERROR(TarnErrorCacheAddFailed, cacheError,
+        *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorCacheAddFailed, cacheError,
                             "Failed to add to cache : %@, url: %@, transient: %d",
                             metadata->description(), liveURL, transient);
         return nullptr;
@@ -533,7 +536,8 @@ TarnMetadataRef createOrLookup(TarnClientConnection& connection,
                 identity, createIfNecessary, transient, connection.allowOtherIdLookup(),
                 connection.unrestricted(), connection.clientBundleIdentifier());
     if (!identity) {
-        *error = TARN_ERROR(TarnErrorBadInput, nullptr, "Cannot lookup a nil container identity.");
+        *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorBadInput, nullptr,
+                               "Cannot lookup a nil container identity.");
         return nullptr;
     }
     const std::string& identifier = identity->identifier();
@@ -559,7 +563,7 @@ TarnMetadataRef createOrLookup(TarnClientConnection& connection,
     }
 
     if (!createIfNecessary) {
-        *error = TARN_ERROR_SILENT(TarnErrorNotFound, nullptr,
+        *error = TARN_ERROR_SILENT_IN(kCreateOrLookup, TarnErrorNotFound, nullptr,
                                    "Container with identifier: \"%@\" Not Found", identifier);
         return nullptr;
     }
@@ -575,7 +579,7 @@ TarnMetadataRef createOrLookup(TarnClientConnection& connection,
         // A transient container is made anew on every request.
         TarnErrorRef moveError;
         if (!connection._moveItemAtURLToDeathRow(cached->url(), true, true, &moveError)) {
-            *error = TARN_ERROR(TarnErrorRemoveTransientFailed, moveError,
+            *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorRemoveTransientFailed, moveError,
                                 "Failed to remove transient container at %@", cached->url());
             return nullptr;
         }

@@ -152,6 +152,10 @@ inline void TarnSetError(uint64_t* slot, uint64_t code) {
 // Domain error without description (never logged).
 #define TARN_ERROR_CODE(code, underlying) \
     ::tarn::TarnErrorMake(__func__, __LINE__, (code), (underlying), false, std::nullopt)
+#define TARN_ERROR_CODE_IN(function, code, underlying) \
+    ::tarn::TarnErrorMake((function), __LINE__, (code), (underlying), false, std::nullopt)
 // POSIX error value for `err` (an errno value).
 #define TARN_POSIX_ERROR(err, fmt, ...) \
     ::tarn::TarnPosixErrorMake(__func__, __LINE__, (err), ::tarn::Format((fmt)__VA_OPT__(, ) __VA_ARGS__))
+#define TARN_POSIX_ERROR_IN(function, err, fmt, ...) \
+    ::tarn::TarnPosixErrorMake((function), __LINE__, (err), ::tarn::Format((fmt)__VA_OPT__(, ) __VA_ARGS__))

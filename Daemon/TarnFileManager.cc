@@ -625,16 +625,19 @@ bool TarnFileManager::_traverseDirectory(const FileURL& url, TarnErrorRef* error
     SignpostInterval interval(kLogCategory, "TraversingDirectory");
     uint64_t handed = 0;
     TarnErrorRef walkError;
+    const char* const operation = __func__;  // inside the walk's lambda __func__ is the lambda's
     int err = FsWalk(url, [&](const FsWalkEntry& entry) {
         if (entry.type == FsWalkType::Error) {
-            walkError = TARN_POSIX_ERROR(entry.error, "Error for path %s: %s", url, errText(entry.error));
+            walkError = TARN_POSIX_ERROR_IN(operation, entry.error, "Error for path %s: %s", url,
+                                            errText(entry.error));
             return false;
         }
         ++handed;
         TarnErrorRef blockError;
         if (!withBlock(entry, &blockError)) {
             walkError = blockError;
-            if (!walkError) walkError = TARN_POSIX_ERROR(ECANCELED, "traversal of %s stopped", url);
+            if (!walkError)
+                walkError = TARN_POSIX_ERROR_IN(operation, ECANCELED, "traversal of %s stopped", url);
             return false;
         }
         return true;
