@@ -447,11 +447,12 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
                        {"identifier", "<private>"},
                        {"class", std::to_string(containerClass)}});
 
-    const FileURL stagingURL =
-        PathJoin(configuration.stagingDirectoryURLForUserIdentity(userIdentity, containerClass),
-                 directoryName);
+    const FileURL stagingParent =
+        configuration.stagingDirectoryURLForUserIdentity(userIdentity, containerClass);
+    // An identity without a home has no staging directory: nothing is built.
+    const FileURL stagingURL = stagingParent.empty() ? FileURL() : PathJoin(stagingParent, directoryName);
     TarnErrorRef underlying;
-    if (!connection._createTopLevelContainerDirectory(
+    if (stagingURL.empty() || !connection._createTopLevelContainerDirectory(
             stagingURL, containerClass, userIdentity->posixUIDForContainerClass(containerClass),
             &underlying)) {
         *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorCreateStagingFailed, underlying,

@@ -26,6 +26,9 @@ std::shared_ptr<TarnPerUserConfiguration> TarnPerUserConfiguration::initWithUser
 
 FileURL TarnPerUserConfiguration::directoryGetter(std::optional<FileURL>* slot, const FileURL& url,
                                                   const char* failureFormat) {
+    // Without a home every per-user directory is nil: paths built on an empty
+    // home would name directories at the file system's root.
+    if (userHomeDirectory_.empty()) return FileURL();
     std::lock_guard<std::recursive_mutex> guard(lock_);
     if (!*slot) *slot = url;
     TarnErrorRef error;
@@ -60,18 +63,22 @@ FileURL TarnPerUserConfiguration::libraryDirectory() {
 }
 
 FileURL TarnPerUserConfiguration::systemContainerBackupBaseDirectory() const {
+    if (userHomeDirectory_.empty()) return FileURL();
     return PathJoin(userHomeDirectory_, "Library/Backup/SystemContainers");
 }
 
 FileURL TarnPerUserConfiguration::systemContainerBackupDirectory() const {
-    return PathJoin(systemContainerBackupBaseDirectory(), "Data");
+    const FileURL base = systemContainerBackupBaseDirectory();
+    return base.empty() ? FileURL() : PathJoin(base, "Data");
 }
 
 FileURL TarnPerUserConfiguration::systemGroupContainerBackupDirectory() const {
-    return PathJoin(systemContainerBackupBaseDirectory(), "Shared");
+    const FileURL base = systemContainerBackupBaseDirectory();
+    return base.empty() ? FileURL() : PathJoin(base, "Shared");
 }
 
 FileURL TarnPerUserConfiguration::oldLoggingPath() const {
+    if (userHomeDirectory_.empty()) return FileURL();
     return PathJoin(userHomeDirectory_, "Library/Logs/TarnKeeper");
 }
 
@@ -83,6 +90,7 @@ std::optional<FileURL> TarnPerUserConfiguration::containerDirectoryURLForContent
                 contentClass);
         return std::nullopt;
     }
+    if (!userIdentity_ || userHomeDirectory_.empty()) return std::nullopt;
     std::lock_guard<std::recursive_mutex> guard(lock_);
     FileURL parent = transient ? transientDirectory() : userBaseDirectory();
     FileURL url = PathJoin(parent, TarnContainerClassRelativeDirectory(contentClass));

@@ -71,6 +71,25 @@ TEST_F(TarnGlobalConfigurationTest, EnterpriseLayoutAndStaging) {
               config.getPerUserConfigurationForUserIdentity(enterprise).get());
 }
 
+// An identity without a home directory has no per-user directories, and
+// nothing is made for it, least of all at the file system's root.
+TEST_F(TarnGlobalConfigurationTest, AnIdentityWithoutAHomeGetsNoDirectories) {
+    TarnGlobalConfiguration config;
+    auto homeless = TarnUserIdentity::initWithUID(502, 502, FileURL(), std::string("E-2"),
+                                                  TarnPersonaTypeEnterprise, 502);
+    ASSERT_TRUE(homeless);
+    EXPECT_FALSE(config.containerDirectoryURLForUserIdentity(homeless, 2, false));
+    EXPECT_EQ(config.stagingDirectoryURLForUserIdentity(homeless, 2), FileURL());
+    auto perUser = config.getPerUserConfigurationForUserIdentity(homeless);
+    EXPECT_EQ(perUser->libraryDirectory(), FileURL());
+    EXPECT_EQ(perUser->systemGroupContainerBackupDirectory(), FileURL());
+    EXPECT_FALSE(fs::exists("/Containers/Staging"));
+    EXPECT_FALSE(fs::exists("/Library/TarnKeeper"));
+    // No identity at all: no directory either, and no crash.
+    EXPECT_FALSE(config.getPerUserConfigurationForUserIdentity(nullptr)
+                     ->containerDirectoryURLForContentClass(2, false));
+}
+
 TEST_F(TarnGlobalConfigurationTest, GettersAnswerEvenWhenCreationFails) {
     // A file where the directory belongs.
     root_.writeFile("/private/var/root/Library/TarnKeeper", "in the way");
