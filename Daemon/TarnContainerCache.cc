@@ -164,12 +164,8 @@ bool TarnContainerCache::containerURL(const FileURL& url,
 bool TarnContainerCache::containerName(std::string_view name,
                                        TarnContainerClass isValidForContainerClass) {
     if (Uuid::parse(name)) return true;
-    if (isValidForContainerClass == TarnContainerClassSystemData)
-        return TarnWhitelist::sharedWhitelist().systemContainerIdIsWellknown(std::string(name));
-    if (isValidForContainerClass == TarnContainerClassSystemGroup)
-        return TarnWhitelist::sharedWhitelist().systemGroupContainerIdIsWellknown(
-            std::string(name));
-    return false;
+    // Well-known containers live under their table's directory name.
+    return TarnWhitelist::sharedWhitelist().isWellknownDirectoryName(name, isValidForContainerClass);
 }
 
 // ---- Building ----

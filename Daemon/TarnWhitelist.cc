@@ -323,6 +323,18 @@ std::optional<std::string> TarnWhitelist::wellknownContainerForId(
     return std::nullopt;
 }
 
+bool TarnWhitelist::isWellknownDirectoryName(std::string_view name,
+                                             TarnContainerClass containerClass) const {
+    const std::map<std::string, std::string>* table =
+        containerClass == TarnContainerClassSystemData    ? &systemWhitelist_
+        : containerClass == TarnContainerClassSystemGroup ? &systemGroupWhitelist_
+                                                          : nullptr;
+    if (!table) return false;
+    for (const auto& [identifier, directory] : *table)
+        if (directory == name) return true;
+    return false;
+}
+
 bool TarnWhitelist::isLookupWhitelistedFromCodeSignIdentifier(
     const std::string& codeSignIdentifier, TarnContainerClass forContainerClass,
     const std::string& containerIdentifier) const {

@@ -21,6 +21,7 @@
 #include <optional>
 #include <set>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "Daemon/TarnContainerClass.h"
@@ -67,6 +68,9 @@ public:
     bool containerIdIsWellknown(const std::string& identifier, TarnContainerClass containerClass) const;
     std::optional<std::string> wellknownContainerForId(const std::string& identifier,
                                                        TarnContainerClass containerClass) const;
+    // Whether `name` is the directory name of a well-known container of the
+    // class (12 or 13): the table's values, which need not equal identifiers.
+    bool isWellknownDirectoryName(std::string_view name, TarnContainerClass containerClass) const;
 
     bool isLookupWhitelistedFromCodeSignIdentifier(const std::string& codeSignIdentifier,
                                                    TarnContainerClass forContainerClass,

@@ -5,6 +5,7 @@
 #include <fstream>
 #include <sstream>
 
+#include "Daemon/TarnContainerCache.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "support/ScratchRoot.h"
 
@@ -77,6 +78,11 @@ TEST_F(TarnWhitelistTest, ConfigurationFileOverridesAndBadFilesFallBack) {
     root_.writeFile("/etc/tarnkeeper/wellknown.plist", std::string(bytes.begin(), bytes.end()));
     auto& fromFile = TarnWhitelist::sharedWhitelist();
     EXPECT_EQ(fromFile.wellknownSystemContainers(), std::vector<std::string>{"com.ostrea.only"});
+    // The container lives under the table's directory name, which the cache
+    // must take for a container directory; the identifier is not a name.
+    EXPECT_TRUE(TarnContainerCache::containerName("only", TarnContainerClassSystemData));
+    EXPECT_FALSE(TarnContainerCache::containerName("com.ostrea.only", TarnContainerClassSystemData));
+    EXPECT_FALSE(TarnContainerCache::containerName("only", TarnContainerClassSystemGroup));
 
     // A directory name that would leave the class directory is refused.
     table.set("SystemContainers", PlistValue(PlistDict{{"x", PlistValue("../../etc")}}));
