@@ -9,8 +9,11 @@ namespace tarn {
 
 namespace {
 
-constexpr const char* kInitTag = "initWithUserIdentity";
-constexpr const char* kConcreteInitTag = "initWithUUID";
+// The construction's log lines carry the constructors' full names.
+constexpr const char* kInitTag =
+    "-[TarnContainerIdentity initWithUserIdentity:identifier:containerClass:error:]";
+constexpr const char* kConcreteInitTag =
+    "-[TarnConcreteContainerIdentity initWithUUID:userIdentity:identifier:containerClass:error:]";
 
 }  // namespace
 

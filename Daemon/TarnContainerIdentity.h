@@ -35,7 +35,10 @@ using TarnConcreteContainerIdentityRef = std::shared_ptr<const TarnConcreteConta
 
 class TarnContainerIdentity {
 protected:
-    struct PrivateTag {};
+    // Explicit: outside code cannot make one with {} and skip the checks.
+    struct PrivateTag {
+        explicit PrivateTag() = default;
+    };
 
 public:
     static TarnContainerIdentityRef containerIdentityWithUserIdentity(
