@@ -64,6 +64,9 @@ std::optional<TarnContainerClass> classKey(const std::string& key) {
     }
     TarnContainerClass c = std::stoull(key);
     if (!TarnContainerClassIsValid(c)) return std::nullopt;
+    // Look-ups use the plain decimal form: a key such as "07" would load and
+    // never match.
+    if (key != std::to_string(c)) return std::nullopt;
     return c;
 }
 

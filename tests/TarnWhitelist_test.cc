@@ -91,6 +91,11 @@ TEST_F(TarnWhitelistTest, ConfigurationFileOverridesAndBadFilesFallBack) {
     EXPECT_FALSE(why.empty());
     table.set("LookupByClass", PlistValue(PlistDict{{"99", PlistValue(PlistArray{})}}));
     EXPECT_FALSE(TarnWhitelist::whitelistWithTable(table, false, &why));
+    table.set("SystemContainers", PlistValue(PlistDict{{"com.ostrea.only", PlistValue("only")}}));
+    table.set("LookupByClass", PlistValue(PlistDict{{"7", PlistValue(PlistArray{})}}));
+    EXPECT_TRUE(TarnWhitelist::whitelistWithTable(table, false, &why)) << why;
+    table.set("LookupByClass", PlistValue(PlistDict{{"07", PlistValue(PlistArray{})}}));
+    EXPECT_FALSE(TarnWhitelist::whitelistWithTable(table, false, &why)) << "only the plain form matches";
 
     test::ScratchRoot other;
     other.writeFile("/etc/tarnkeeper/wellknown.plist", "<plist>broken");
