@@ -85,6 +85,10 @@ private:
     TarnUserIdentityCache* cache_;
 };
 
+std::string TarnUserIdentityCache::description() const {
+    return Format("<%@: %p>", "TarnUserIdentityCache", static_cast<const void*>(this));
+}
+
 TarnUserIdentityCache::TarnUserIdentityCache(PersonaRoster& roster) : roster_(roster) {
     {
         MutexLock guard(lock_);
@@ -505,8 +509,8 @@ void TarnUserIdentityCache::forEachAccessibleUserIdentitySynchronouslyExecuteBlo
     if (identities.empty()) {
         TarnLog(kLogError,
                 "forEachAccessibleUserIdentitySynchronouslyExecuteBlock",
-                "Expected to find at least one persona; self = %p, personaAttributeList = %@",
-                static_cast<const void*>(this), listText);
+                "Expected to find at least one persona; self = %@, personaAttributeList = %@",
+                *this, listText);
         block(defaultUserIdentity());
         return;
     }

@@ -52,6 +52,9 @@ public:
     TarnUserIdentityCache(const TarnUserIdentityCache&) = delete;
     TarnUserIdentityCache& operator=(const TarnUserIdentityCache&) = delete;
 
+    // "<TarnUserIdentityCache: 0x...>", for log lines that name the cache.
+    std::string description() const;
+
     // Mobile ids of the global configuration, the mobile user's home, personal,
     // kernel persona id = the mobile uid. Made once per root prefix.
     static TarnUserIdentityRef defaultUserIdentity();
