@@ -1,6 +1,7 @@
 #include "Daemon/TarnMetadata.h"
 
 #include <cerrno>
+#include <cmath>
 
 #include "Daemon/TarnFileManager.h"
 #include "Daemon/TarnGlobalConfiguration.h"
@@ -12,6 +13,17 @@
 namespace tarn {
 
 namespace {
+
+// A number's whole value: an integer, or a real without a fraction (a file
+// written by another tool may store 2 as 2.0).
+std::optional<int64_t> integralValue(const PlistValue& v) {
+    if (v.isInteger()) return v.asInt64();
+    if (auto real = v.asReal()) {
+        if (std::isfinite(*real) && std::trunc(*real) == *real && std::fabs(*real) < 9.0e15)
+            return static_cast<int64_t>(*real);
+    }
+    return std::nullopt;
+}
 
 std::string describe(const PlistValue* v) { return v ? v->description() : "(null)"; }
 
@@ -283,8 +295,8 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
                                "Invalid metadata Class: %@ at %@", describe(classValue),
                                fileURL()));
     }
-    auto classNumber = classValue->asInt64();
-    if (!classValue->isInteger() || !classNumber || !TarnContainerClassIsValid(*classNumber)) {
+    auto classNumber = integralValue(*classValue);
+    if (!classNumber || !TarnContainerClassIsValid(*classNumber)) {
         return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                "Invalid metadata Content Class: %ld at %@",
                                static_cast<long>(classNumber.value_or(-1)), fileURL()));
@@ -310,8 +322,7 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
                 // Absent means the expected user (see below); only the debug
                 // line needs to show it filled in.
                 if (showDictionary) fields.dict->set(kTarnMetadataPersonaKey, PlistValue(expectedUID));
-            } else if (persona->asUInt64() != std::optional<uint64_t>(expectedUID) ||
-                       !persona->isInteger()) {
+            } else if (integralValue(*persona) != std::optional<int64_t>(expectedUID)) {
                 return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                        "Incorrect UserId: %@, expecting: %u for %@ at %@",
                                        persona->description(), expectedUID, identifier, fileURL()));
@@ -320,14 +331,11 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
         const PlistValue* stored = fields.find(kTarnMetadataUserIdentityKey);
         if (!stored) {
             // Written before identities were stored: the owner's uid is all we have.
-            const uint32_t uid = persona ? static_cast<uint32_t>(persona->asUInt64().value_or(0))
-                                         : expectedUID;
+            // No such identity leaves the owner missing: the identity made
+            // below then reports it, with its own code.
+            const uint32_t uid =
+                persona ? static_cast<uint32_t>(integralValue(*persona).value_or(0)) : expectedUID;
             owner = cache.userIdentityForPersonalPersonaWithUID(uid, uid);
-            if (!owner) {
-                return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                       "Invalid metadata User Identity: %@ for %@ at %@: %llu",
-                                       "(null)", identifier, fileURL(), uint64_t{TarnSuccess}));
-            }
         } else {
             uint64_t code = TarnSuccess;
             PlistValue scratch;

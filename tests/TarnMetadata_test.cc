@@ -152,6 +152,7 @@ TEST_F(TarnMetadataTest, EveryMalformedFieldRejectsTheContainer) {
         {kTarnMetadataContentClassKey, PlistValue("2"), "Invalid metadata Class"},
         {kTarnMetadataContentClassKey, PlistValue(uint64_t{14}), "Invalid metadata Content Class: 14"},
         {kTarnMetadataContentClassKey, PlistValue(uint64_t{0}), "Invalid metadata Content Class: 0"},
+        {kTarnMetadataContentClassKey, PlistValue(2.5), "Invalid metadata Content Class"},
         {kTarnMetadataPersonaKey, PlistValue(uint64_t{502}), "Incorrect UserId"},
         {kTarnMetadataUserIdentityKey, PlistValue(PlistDict{{"version", PlistValue("3")}}),
          "Invalid metadata User Identity"},
@@ -224,6 +225,13 @@ TEST_F(TarnMetadataTest, OldFormatWithoutUserIdentity) {
                                                0, 502);
     std::string message = expectRejected(m->url(), TarnErrorInvalidMetadata, other);
     EXPECT_NE(message.find("Incorrect UserId: 501, expecting: 502"), std::string::npos) << message;
+
+    // Whole numbers written as reals (by another tool) read as the numbers.
+    dict.set(kTarnMetadataPersonaKey, PlistValue(501.0));
+    dict.set(kTarnMetadataContentClassKey, PlistValue(2.0));
+    writeDict(m->url(), dict);
+    EXPECT_TRUE(TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true, nullptr));
+    dict.set(kTarnMetadataContentClassKey, PlistValue(uint64_t{2}));
 
     // Without either key the expected user is assumed.
     dict.erase(kTarnMetadataPersonaKey);
