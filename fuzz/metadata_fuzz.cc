@@ -1,0 +1,81 @@
+// Arbitrary bytes as a container's metadata file, read the way a cache
+// rebuild reads it. The reader either answers metadata or an error value
+// with a code, never crashes; and what it accepts, written back in our own
+// form, reads back the same.
+#include <cstddef>
+#include <cstdint>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <string>
+
+#include "Daemon/TarnFileManager.h"
+#include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnMetadata.h"
+#include "Daemon/TarnUserIdentityCache.h"
+#include "Platform/PlatformLog.h"
+#include "Platform/RootPrefix.h"
+
+using namespace tarn;
+
+namespace {
+
+FileURL gContainer;  // a data container directory of the mobile user
+FileURL gFile;       // its metadata file
+
+void writeBytes(const std::string& path, const void* data, size_t size) {
+    std::ofstream out(path, std::ios::binary | std::ios::trunc);
+    out.write(static_cast<const char*>(data), static_cast<std::streamsize>(size));
+    if (!out) std::abort();
+}
+
+// A scratch root with a mobile account, as the daemon would find it.
+void makeRoot() {
+    const char* tmp = std::getenv("TMPDIR");
+    std::string dir = std::string(tmp && *tmp ? tmp : "/tmp") + "/metadata_fuzz.XXXXXX";
+    if (!mkdtemp(dir.data())) std::abort();
+    SetRootPrefix(dir);
+    std::filesystem::create_directories(dir + "/etc");
+    std::filesystem::create_directories(dir + "/private/var/mobile");
+    std::ofstream(dir + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/false\n";
+    std::ofstream(dir + "/etc/group") << "mobile:x:501:\n";
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerInitialize(int*, char***) {
+    PlatformLogSetQuiet(true);
+    makeRoot();
+    TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
+    auto classDirectory = TarnGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
+        TarnUserIdentityCache::defaultUserIdentity(), 2, false);
+    if (!classDirectory) std::abort();
+    gContainer = PathJoin(*classDirectory, "0A1B2C3D-0000-4000-8000-000000000001");
+    std::filesystem::create_directories(gContainer);
+    gFile = PathJoin(gContainer, kTarnMetadataFileName);
+    return 0;
+}
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
+    writeBytes(gFile, data, size);
+    const TarnUserIdentityRef owner = TarnUserIdentityCache::defaultUserIdentity();
+    TarnErrorRef error;
+    auto read = TarnMetadata::readAndValidateMetadataAtUrl(gContainer, owner, true, &error);
+    if (!read) {
+        if (!error || error->code() == TarnSuccess) std::abort();  // a refusal names its reason
+        return 0;
+    }
+    if (!TarnContainerClassIsValid(read->containerClass()) || read->url() != gContainer)
+        std::abort();
+    // Written back as the daemon writes it, the same container reads back.
+    const auto bytes = read->dictionaryRepresentation().toBinary();
+    if (bytes.empty()) std::abort();
+    writeBytes(gFile, bytes.data(), bytes.size());
+    auto again = TarnMetadata::readAndValidateMetadataAtUrl(gContainer, owner, true, &error);
+    if (!again || again->identifier() != read->identifier() || again->uuid() != read->uuid() ||
+        again->containerClass() != read->containerClass() || again->info() != read->info() ||
+        again->userManagedAssetsDirName() != read->userManagedAssetsDirName() ||
+        !again->userIdentity()->isEqualToUserIdentity(*read->userIdentity()))
+        std::abort();
+    return 0;
+}
