@@ -451,14 +451,10 @@ bool TarnFileManager::_moveItemAtURL(const FileURL& url, const FileURL& toURL, b
             return false;
         }
     }
-    int err = 0;
-    if (auto fp = TARN_FAILPOINT("fm.move"))
-        err = *fp;
-    else
-        err = FsRename(url, toURL);
-    if (err == 0) return true;
-    if (err != EXDEV) {
-        setError(error, TARN_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", url, toURL, errText(err)));
+    TarnErrorRef renameError;
+    if (renameItemAtURL(url, toURL, &renameError)) return true;
+    if (renameError->posixCode() != EXDEV) {
+        setError(error, renameError);
         return false;
     }
     if (!_copyItemAtURL(url, toURL, true, error)) return false;

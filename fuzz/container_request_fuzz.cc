@@ -16,7 +16,7 @@
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/ConduitWire.h"
 #include "Platform/PlatformLog.h"
-#include "Platform/RootPrefix.h"
+#include "fuzz/FuzzRoot.h"
 
 using namespace tarn;
 
@@ -31,16 +31,7 @@ void writeFile(const std::string& path, const std::string& contents) {
 
 // A scratch root with a mobile account and a personal and an enterprise persona.
 void makeRoot() {
-    const char* tmp = std::getenv("TMPDIR");
-    std::string dir = std::string(tmp && *tmp ? tmp : "/tmp") + "/container_request_fuzz.XXXXXX";
-    if (!mkdtemp(dir.data())) std::abort();
-    // Left behind on exit: the persona roster's watcher still runs then, and
-    // removing its directory under it would race the process's teardown.
-    SetRootPrefix(dir);
-    std::filesystem::create_directories(dir + "/etc/tarnkeeper");
-    std::filesystem::create_directories(dir + "/private/var/mobile");
-    writeFile(dir + "/etc/passwd", "mobile:x:501:501::/private/var/mobile:/bin/false\n");
-    writeFile(dir + "/etc/group", "mobile:x:501:\n");
+    const std::string dir = fuzz::MakeFuzzRoot("container_request_fuzz");
     PlistValue personal{PlistDict{}}, enterprise{PlistDict{}};
     personal.set("Type", "personal");
     personal.set("UniqueString", "P");

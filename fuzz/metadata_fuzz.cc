@@ -14,7 +14,7 @@
 #include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/PlatformLog.h"
-#include "Platform/RootPrefix.h"
+#include "fuzz/FuzzRoot.h"
 
 using namespace tarn;
 
@@ -29,23 +29,11 @@ void writeBytes(const std::string& path, const void* data, size_t size) {
     if (!out) std::abort();
 }
 
-// A scratch root with a mobile account, as the daemon would find it.
-void makeRoot() {
-    const char* tmp = std::getenv("TMPDIR");
-    std::string dir = std::string(tmp && *tmp ? tmp : "/tmp") + "/metadata_fuzz.XXXXXX";
-    if (!mkdtemp(dir.data())) std::abort();
-    SetRootPrefix(dir);
-    std::filesystem::create_directories(dir + "/etc");
-    std::filesystem::create_directories(dir + "/private/var/mobile");
-    std::ofstream(dir + "/etc/passwd") << "mobile:x:501:501::/private/var/mobile:/bin/false\n";
-    std::ofstream(dir + "/etc/group") << "mobile:x:501:\n";
-}
-
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
     PlatformLogSetQuiet(true);
-    makeRoot();
+    fuzz::MakeFuzzRoot("metadata_fuzz");
     TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
     auto classDirectory = TarnGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
         TarnUserIdentityCache::defaultUserIdentity(), 2, false);
