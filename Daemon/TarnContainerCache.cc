@@ -14,6 +14,7 @@
 #include "Daemon/TarnTestLocks.h"
 #include "Daemon/TarnWhitelist.h"
 #include "Platform/ContainerLibrary.h"
+#include "Platform/FileSystem.h"
 #include "Platform/Notifications.h"
 #include "Platform/PlatformLog.h"
 #include "Platform/RootPrefix.h"
@@ -45,6 +46,19 @@ const FileURL& metadataFileURL(std::string_view container) {
     if (buffer.empty() || buffer.back() != '/') buffer.push_back('/');
     buffer.append(kTarnMetadataFileName);
     return buffer;
+}
+
+// Whether a cached container's metadata file is gone, so that the entry is
+// stale. Only a missing file (or a missing directory on its path) says so: a
+// failure to look (EIO, say) keeps the entry, since dropping it would let
+// the next creation build a second container for the identifier.
+bool metadataFileIsGone(const FileURL& file) {
+    const int err = FsLstat(file, nullptr);
+    if (err == 0) return false;
+    if (err == ENOENT || err == ENOTDIR) return true;
+    TarnLog(kLogError, "itemExistsAtURL", "Failed to determine if %@ exists: %s", file,
+            std::strerror(err));
+    return false;
 }
 
 // The name the look-up's errors and lines carry: the work is done in a
@@ -568,7 +582,7 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
                                 metadata->url());
         return nullptr;
     }
-    if (!TarnFileManager::defaultManager().itemExistsAtURL(metadataFileURL(metadata->url()))) {
+    if (metadataFileIsGone(metadataFileURL(metadata->url()))) {
         const FileURL metadataFile = PathJoin(metadata->url(), kTarnMetadataFileName);
         if (error)
             *error =
@@ -670,7 +684,7 @@ std::optional<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersFor
             continue;
         }
         const FileURL metadataFile = PathJoin(metadata->url(), kTarnMetadataFileName);
-        if (!TarnFileManager::defaultManager().itemExistsAtURL(metadataFile)) {
+        if (metadataFileIsGone(metadataFile)) {
             TarnLog(kLogError, __func__,
                     "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", key,
                     marker, metadataFile, metadata->identifier(), contentClass);

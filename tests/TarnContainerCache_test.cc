@@ -345,6 +345,22 @@ TEST_F(TarnContainerCacheTest, AllContainersDropsEntriesWhoseMetadataIsGone) {
     EXPECT_EQ(code, TarnErrorNotFound);
 }
 
+// Only a file that is gone makes an entry stale. When the file cannot be
+// looked at (here a loop of links where its directory was), the entry stays:
+// dropping it would let the next creation build a second container.
+TEST_F(TarnContainerCacheTest, AMetadataFileThatCannotBeCheckedKeepsItsEntry) {
+    auto a = makeContainer(2, "com.ostrea.looped");
+    uint64_t code = 0;
+    ASSERT_TRUE(lookup(2, "com.ostrea.looped", &code)) << code;
+    const std::string moved = a->url() + ".away";
+    std::filesystem::rename(a->url(), moved);
+    std::filesystem::create_symlink(a->url(), a->url());  // ELOOP on the way to the file
+    EXPECT_TRUE(lookup(2, "com.ostrea.looped", &code)) << code;
+    std::filesystem::remove(a->url());
+    std::filesystem::rename(moved, a->url());
+    EXPECT_TRUE(lookup(2, "com.ostrea.looped", &code)) << code;
+}
+
 TEST_F(TarnContainerCacheTest, ConcreteLookupMatchesTheUUIDAndMarksTransience) {
     auto live = makeContainer(2, "com.ostrea.c");
     auto transient = makeContainer(2, "com.ostrea.c", true);
