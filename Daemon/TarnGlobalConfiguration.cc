@@ -51,7 +51,7 @@ TarnGlobalConfiguration::TarnGlobalConfiguration()
 
 TarnGlobalConfiguration::~TarnGlobalConfiguration() = default;
 
-FileURL TarnGlobalConfiguration::directoryGetter(std::optional<FileURL>* slot,
+FileURL TarnGlobalConfiguration::directoryGetter(const char* tag, std::optional<FileURL>* slot,
                                                  const char* absolutePath,
                                                  const char* failureFormat, uid_t owner,
                                                  int32_t protectionClass) {
@@ -61,25 +61,25 @@ FileURL TarnGlobalConfiguration::directoryGetter(std::optional<FileURL>* slot,
     if (!TarnFileManager::defaultManager().createDirectoryAtURL(
             **slot, true, kDirectoryMode, owner,
             static_cast<TarnDataProtectionClass>(protectionClass), &error)) {
-        TarnLog(kLogError, "directory", failureFormat, **slot, error);
+        TarnLog(kLogError, tag, failureFormat, **slot, error);
     }
     return **slot;
 }
 
 FileURL TarnGlobalConfiguration::sharedContainersDirectory() {
-    return directoryGetter(&sharedContainersDirectory_, kSharedContainers,
+    return directoryGetter(__func__, &sharedContainersDirectory_, kSharedContainers,
                            "Failed to create shared container dir at \"%@\": %@", kNoOwnerChange,
                            kNoClassChange);
 }
 
 FileURL TarnGlobalConfiguration::bundleDirectory() {
-    return directoryGetter(&bundleDirectory_, "/private/var/containers/Bundle",
+    return directoryGetter(__func__, &bundleDirectory_, "/private/var/containers/Bundle",
                            "Failed to create bundle dir at \"%@\": %@", kNoOwnerChange,
                            kNoClassChange);
 }
 
 FileURL TarnGlobalConfiguration::transientBundleDirectory() {
-    return directoryGetter(&transientBundleDirectory_, "/private/var/containers/Temp",
+    return directoryGetter(__func__, &transientBundleDirectory_, "/private/var/containers/Temp",
                            "Failed to create transient bundle dir at \"%@\": %@",
                            CONTAINER_INSTALLATION_UID, kNoClassChange);
 }
@@ -91,13 +91,13 @@ std::optional<FileURL> TarnGlobalConfiguration::legacyTransientBundleDirectory()
 }
 
 FileURL TarnGlobalConfiguration::libraryDirectory() {
-    return directoryGetter(&libraryDirectory_, "/private/var/root/Library/TarnKeeper",
+    return directoryGetter(__func__, &libraryDirectory_, "/private/var/root/Library/TarnKeeper",
                            "Failed to create library dir at \"%@\": %@", kNoOwnerChange,
                            kTarnDataProtectionClassD);
 }
 
 FileURL TarnGlobalConfiguration::cachesDirectory() {
-    return directoryGetter(&cachesDirectory_,
+    return directoryGetter(__func__, &cachesDirectory_,
                            "/private/var/root/Library/Caches/com.ostrea.tarnkeeperd",
                            "Failed to create cache dir at \"%@\": %@", kNoOwnerChange,
                            kTarnDataProtectionClassD);
@@ -117,34 +117,34 @@ FileURL TarnGlobalConfiguration::logDirectory() {
 }
 
 FileURL TarnGlobalConfiguration::stagingDirectory() {
-    return directoryGetter(&stagingDirectory_,
+    return directoryGetter(__func__, &stagingDirectory_,
                            "/private/var/root/Library/Caches/com.ostrea.tarnkeeperd/Staging",
                            "Failed to create staging dir at \"%@\": %@", kNoOwnerChange,
                            kNoClassChange);
 }
 
 FileURL TarnGlobalConfiguration::deathrowDirectory() {
-    return directoryGetter(&deathrowDirectory_,
+    return directoryGetter(__func__, &deathrowDirectory_,
                            "/private/var/root/Library/Caches/com.ostrea.tarnkeeperd/Dead",
                            "Failed to create deathrow dir at \"%@\": %@", kNoOwnerChange,
                            kNoClassChange);
 }
 
 FileURL TarnGlobalConfiguration::replaceDirectory() {
-    return directoryGetter(&replaceDirectory_, "/private/var/root/Library/TarnKeeper/Replace",
+    return directoryGetter(__func__, &replaceDirectory_, "/private/var/root/Library/TarnKeeper/Replace",
                            "Failed to create replace dir at \"%@\": %@", kNoOwnerChange,
                            kNoClassChange);
 }
 
 FileURL TarnGlobalConfiguration::pendingUpdatesDirectory() {
-    return directoryGetter(&pendingUpdatesDirectory_,
+    return directoryGetter(__func__, &pendingUpdatesDirectory_,
                            "/private/var/root/Library/TarnKeeper/PendingUpdates",
                            "Failed to create updates dir at \"%@\": %@", kNoOwnerChange,
                            kNoClassChange);
 }
 
 FileURL TarnGlobalConfiguration::transientDirectory() {
-    return directoryGetter(&transientDirectory_,
+    return directoryGetter(__func__, &transientDirectory_,
                            "/private/var/root/Library/Caches/com.ostrea.tarnkeeperd/Temp",
                            "Failed to create transient dir at \"%@\": %@", kNoOwnerChange,
                            kNoClassChange);

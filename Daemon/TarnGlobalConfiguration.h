@@ -91,7 +91,8 @@ public:
 
 private:
     // Computes `*slot` once with `path` and creates it on every call.
-    FileURL directoryGetter(std::optional<FileURL>* slot, const char* absolutePath,
+    // `tag`: the getter's name, for its failure line.
+    FileURL directoryGetter(const char* tag, std::optional<FileURL>* slot, const char* absolutePath,
                             const char* failureFormat, uid_t owner, int32_t protectionClass);
 
     // Constant after construction.

@@ -24,7 +24,7 @@ std::shared_ptr<TarnPerUserConfiguration> TarnPerUserConfiguration::initWithUser
     return std::make_shared<TarnPerUserConfiguration>(std::move(userIdentity));
 }
 
-FileURL TarnPerUserConfiguration::directoryGetter(std::optional<FileURL>* slot, const FileURL& url,
+FileURL TarnPerUserConfiguration::directoryGetter(const char* tag, std::optional<FileURL>* slot, const FileURL& url,
                                                   const char* failureFormat) {
     // Without a home every per-user directory is nil: paths built on an empty
     // home would name directories at the file system's root.
@@ -35,30 +35,30 @@ FileURL TarnPerUserConfiguration::directoryGetter(std::optional<FileURL>* slot, 
     const uid_t owner = userIdentity_ ? userIdentity_->posixUID() : 0;
     if (!TarnFileManager::defaultManager().createDirectoryAtURL(**slot, true, kDirectoryMode, owner,
                                                                 &error)) {
-        TarnLog(kLogError, "directory", failureFormat, **slot, error);
+        TarnLog(kLogError, tag, failureFormat, **slot, error);
     }
     return **slot;
 }
 
 FileURL TarnPerUserConfiguration::userBaseDirectory() {
-    return directoryGetter(&userBaseDirectory_, PathJoin(userHomeDirectory_, "Containers"),
+    return directoryGetter(__func__, &userBaseDirectory_, PathJoin(userHomeDirectory_, "Containers"),
                            "Failed to create user base dir at \"%@\": %@");
 }
 
 FileURL TarnPerUserConfiguration::transientDirectory() {
     std::lock_guard<std::recursive_mutex> guard(lock_);
-    return directoryGetter(&transientDirectory_, PathJoin(userBaseDirectory(), "Temp"),
+    return directoryGetter(__func__, &transientDirectory_, PathJoin(userBaseDirectory(), "Temp"),
                            "Failed to create transient dir at \"%@\": %@");
 }
 
 FileURL TarnPerUserConfiguration::stagingDirectory() {
     std::lock_guard<std::recursive_mutex> guard(lock_);
-    return directoryGetter(&stagingDirectory_, PathJoin(userBaseDirectory(), "Staging"),
+    return directoryGetter(__func__, &stagingDirectory_, PathJoin(userBaseDirectory(), "Staging"),
                            "Failed to create staging dir at \"%@\": %@");
 }
 
 FileURL TarnPerUserConfiguration::libraryDirectory() {
-    return directoryGetter(&libraryDirectory_, PathJoin(userHomeDirectory_, "Library/TarnKeeper"),
+    return directoryGetter(__func__, &libraryDirectory_, PathJoin(userHomeDirectory_, "Library/TarnKeeper"),
                            "Failed to create user library dir at \"%@\": %@");
 }
 

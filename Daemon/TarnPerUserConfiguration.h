@@ -44,7 +44,8 @@ public:
     bool existsUserBaseDirectory() const;
 
 private:
-    FileURL directoryGetter(std::optional<FileURL>* slot, const FileURL& url,
+    // `tag`: the getter's name, for its failure line.
+    FileURL directoryGetter(const char* tag, std::optional<FileURL>* slot, const FileURL& url,
                             const char* failureFormat);
 
     // Constant after construction.
