@@ -122,6 +122,11 @@ TarnClientIdentityRef TarnClientIdentity::clientIdentityWithConduitConnection(
         TarnUserIdentitySharedCache::sharedInstance().userIdentityForCurrentContextWithUID(uid, gid);
     if (reuse && reuse->identity && info && reuse->codeSignInfo == info &&
         reuse->userIdentity == userIdentity) {
+        // Every build reports a registration without usable entitlements,
+        // a reused one too.
+        if (!info->entitlements.isDict())
+            TarnLog(kLogError, "clientIdentityWithConduitConnection",
+                    "Missing or malformed entitlements for pid %d", pid);
         PlatformLog("conduit", PlatformLogType::Info, "[%s] Conduit client identity: %@",
                     "clientIdentityWithConduitConnection", reuse->identity);
         return reuse->identity;

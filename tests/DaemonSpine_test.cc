@@ -74,6 +74,25 @@ TEST_F(DaemonSpineTest, AnUnregisteredCallerIsLoggedAsNil) {
     EXPECT_EQ(count("command=0, client=(null), error="), 1u);
 }
 
+// A registration without usable entitlements is reported by every request,
+// also when the connection's identity is reused.
+TEST_F(DaemonSpineTest, MalformedEntitlementsAreReportedOnEveryRequest) {
+    PlistValue reg{PlistDict{}};
+    reg.set("Executable", conduit::harness::SelfExecutablePath());
+    reg.set("SigningIdentifier", "com.ostrea.test.self");
+    reg.set("Entitlements", PlistValue(PlistArray{PlistValue("not a dictionary")}));
+    const auto bytes = reg.toBinary();
+    root_.writeFile("/etc/tarnkeeper/codesign/self.plist", std::string(bytes.begin(), bytes.end()));
+    daemon_->start();
+    std::string why;
+    auto client = conduit::Client::connect(daemon_->socketPath(), &why);
+    ASSERT_TRUE(client) << why;
+    PlistValue request{PlistDict{}};
+    request.set("Command", uint64_t{27});
+    for (int i = 0; i < 3; ++i) ASSERT_TRUE(client->sendSync(request, std::chrono::seconds(10), &why)) << why;
+    EXPECT_EQ(count("Missing or malformed entitlements for pid"), 3u);
+}
+
 // One connection sends many requests; its identity is reused between them,
 // but a change to the peer's registration shows on the very same connection.
 TEST_F(DaemonSpineTest, ARegistrationChangeShowsOnAnOpenConnection) {
