@@ -27,6 +27,22 @@ protected:
         admin_ = daemon_->addPrivilegedClient();
         guest_ = daemon_->addClient("guest", "com.ostrea.test.guest", PlistValue(PlistDict{}));
     }
+    // Registers this test process as "com.ostrea.test.self" with `entitlements`.
+    void registerSelf(const PlistValue& entitlements) {
+        PlistValue reg{PlistDict{}};
+        reg.set("Executable", conduit::harness::SelfExecutablePath());
+        reg.set("SigningIdentifier", "com.ostrea.test.self");
+        reg.set("Entitlements", entitlements);
+        const auto bytes = reg.toBinary();
+        root_.writeFile("/etc/tarnkeeper/codesign/self.plist", std::string(bytes.begin(), bytes.end()));
+    }
+    // A connection of this process to the started daemon.
+    std::unique_ptr<conduit::Client> connectSelf() {
+        std::string why;
+        auto client = conduit::Client::connect(daemon_->socketPath(), &why);
+        EXPECT_TRUE(client) << why;
+        return client;
+    }
     size_t count(const std::string& needle) {
         std::string log = daemon_->platformLog();
         size_t n = 0;
@@ -63,9 +79,9 @@ TEST_F(DaemonSpineTest, CommandTableAndGateOverIpc) {
 // send; its line names no client, unlike a request refused outright.
 TEST_F(DaemonSpineTest, AnUnregisteredCallerIsLoggedAsNil) {
     daemon_->start();
+    auto client = connectSelf();
+    ASSERT_TRUE(client);
     std::string why;
-    auto client = conduit::Client::connect(daemon_->socketPath(), &why);
-    ASSERT_TRUE(client) << why;
     PlistValue request{PlistDict{}};
     request.set("Command", uint64_t{0});
     request.set("Identifier", "com.ostrea.test.nobody");
@@ -77,16 +93,11 @@ TEST_F(DaemonSpineTest, AnUnregisteredCallerIsLoggedAsNil) {
 // A registration without usable entitlements is reported by every request,
 // also when the connection's identity is reused.
 TEST_F(DaemonSpineTest, MalformedEntitlementsAreReportedOnEveryRequest) {
-    PlistValue reg{PlistDict{}};
-    reg.set("Executable", conduit::harness::SelfExecutablePath());
-    reg.set("SigningIdentifier", "com.ostrea.test.self");
-    reg.set("Entitlements", PlistValue(PlistArray{PlistValue("not a dictionary")}));
-    const auto bytes = reg.toBinary();
-    root_.writeFile("/etc/tarnkeeper/codesign/self.plist", std::string(bytes.begin(), bytes.end()));
+    registerSelf(PlistValue(PlistArray{PlistValue("not a dictionary")}));
     daemon_->start();
+    auto client = connectSelf();
+    ASSERT_TRUE(client);
     std::string why;
-    auto client = conduit::Client::connect(daemon_->socketPath(), &why);
-    ASSERT_TRUE(client) << why;
     PlistValue request{PlistDict{}};
     request.set("Command", uint64_t{27});
     for (int i = 0; i < 3; ++i) ASSERT_TRUE(client->sendSync(request, std::chrono::seconds(10), &why)) << why;
@@ -96,21 +107,16 @@ TEST_F(DaemonSpineTest, MalformedEntitlementsAreReportedOnEveryRequest) {
 // One connection sends many requests; its identity is reused between them,
 // but a change to the peer's registration shows on the very same connection.
 TEST_F(DaemonSpineTest, ARegistrationChangeShowsOnAnOpenConnection) {
-    auto registerSelf = [&](bool allowed) {
+    auto registerAllowed = [&](bool allowed) {
         PlistValue entitlements{PlistDict{}};
         if (allowed) entitlements.set("com.ostrea.private.TarnKeeper.allowed", true);
-        PlistValue reg{PlistDict{}};
-        reg.set("Executable", conduit::harness::SelfExecutablePath());
-        reg.set("SigningIdentifier", "com.ostrea.test.self");
-        reg.set("Entitlements", entitlements);
-        const auto bytes = reg.toBinary();
-        root_.writeFile("/etc/tarnkeeper/codesign/self.plist", std::string(bytes.begin(), bytes.end()));
+        registerSelf(entitlements);
     };
-    registerSelf(false);
+    registerAllowed(false);
     daemon_->start();
+    auto client = connectSelf();
+    ASSERT_TRUE(client);
     std::string why;
-    auto client = conduit::Client::connect(daemon_->socketPath(), &why);
-    ASSERT_TRUE(client) << why;
     PlistValue request{PlistDict{}};
     request.set("Command", uint64_t{27});
     auto answer = [&] {
@@ -121,7 +127,7 @@ TEST_F(DaemonSpineTest, ARegistrationChangeShowsOnAnOpenConnection) {
     ASSERT_EQ(answer(), 55u);
     ASSERT_EQ(answer(), 55u);
     for (bool allowed : {true, false}) {
-        registerSelf(allowed);
+        registerAllowed(allowed);
         const uint64_t want = allowed ? 49 : 55;
         const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
         uint64_t got = 0;
