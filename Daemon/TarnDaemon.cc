@@ -111,11 +111,13 @@ void TarnDaemonStartupWork(const std::function<void()>& onFinished) {
     auto& config = TarnGlobalConfiguration::sharedInstance();
     std::string logPath = PathJoin(config.logDirectory(), "tarnkeeperd.log");
     LogHandle* handle = LogOpen("com.ostrea.tarnkeeperd", kLogNotice);
+    // The count is the build's, with or without a log: migrations keep that
+    // many old files.
+    gRotationCount = config.isInternalImage() ? 4 : 1;
     if (!handle) {
         ::syslog(LOG_ERR, "Failed to set up rotating logs at path %s", logPath.c_str());
     } else {
         TarnSetLogHandle(handle);
-        gRotationCount = config.isInternalImage() ? 4 : 1;
         uint64_t sizeLimit = config.isInternalImage() ? 262144 : 102400;
         if (LogEnableDiskLogging(handle, logPath, gRotationCount, sizeLimit) != 0)
             ::syslog(LOG_ERR, "Failed to set up rotating logs at path %s", logPath.c_str());

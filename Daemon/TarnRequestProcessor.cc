@@ -2,6 +2,7 @@
 
 #include <pthread.h>
 
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <mutex>
@@ -12,6 +13,7 @@
 #include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnCommandTable.h"
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnLog.h"
 #include "Platform/CodeSignRegistry.h"
 #include "Platform/Conduit.h"
@@ -197,7 +199,7 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
 }
 
 TarnErrorRef TarnCaughtExceptionError(const char* function, const std::exception* exception) {
-    if (HostConfiguration::shared().internalBuild) TarnFatalExceptionReport(exception);
+    if (TarnGlobalConfiguration::sharedInstance().isInternalImage()) TarnFatalExceptionReport(exception);
     std::string name = exception ? typeid(*exception).name() : "unknown exception";
     std::string reason = exception ? exception->what() : "";
     return TarnErrorMake(function, __LINE__, TarnErrorException, nullptr, true,
@@ -226,6 +228,8 @@ void TarnFatalExceptionReport(const std::exception* exception) {
     gCrashMu.lock();  // never released: the process ends here
     std::strncpy(gCrashMessage, text.c_str(), sizeof gCrashMessage - 1);
     PlatformLogWrite("daemon", PlatformLogType::Fault, text);  // flushes batched lines first
+    // Also where a quiet platform log (tools, tests) would swallow it.
+    std::fprintf(stderr, "%s\n", text.c_str());
     std::abort();
 }
 

@@ -5,8 +5,10 @@
 #include <cstdio>
 #include <cstdlib>
 #include <exception>
+#include <typeinfo>
 
 #include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnRequestProcessor.h"
 #include "Platform/PlatformLog.h"
 
 namespace tarn {
@@ -83,16 +85,6 @@ bool isInternalBuild() { return TarnGlobalConfiguration::sharedInstance().isInte
     // Also straight to stderr: the process ends before any log could be flushed.
     std::fprintf(stderr, "%s\n", message);
     PlatformLog("database", PlatformLogType::Fault, "%s", message);
-    std::abort();
-}
-
-// The fatal report of an unexpected failure on an internal build.
-[[noreturn]] void fatalExceptionReport(const std::string& what) {
-    std::string report = "** INTERNAL ERROR: Uncaught Exception **\nException: ";
-    report += what;
-    report += "\nStack:\n";
-    PlatformLog("database", PlatformLogType::Fault, "%@", report);
-    std::fprintf(stderr, "%s\n", report.c_str());
     std::abort();
 }
 
@@ -349,9 +341,13 @@ TarnErrorRef TarnSQLiteDB::commitTransaction() {
     return e;
 }
 
-TarnErrorRef TarnSQLiteDB::handleTransactionException(const std::string& what) {
-    TarnErrorRef e = TARN_ERROR(TarnErrorException, nullptr, "Got exception: %@ : %@", what, "()");
-    if (isInternalBuild()) fatalExceptionReport(what);
+TarnErrorRef TarnSQLiteDB::handleTransactionException(const char* operation,
+                                                      const std::exception* exception) {
+    // The daemon's own report on internal builds, with its crash message slot.
+    if (isInternalBuild()) TarnFatalExceptionReport(exception);
+    TarnErrorRef e = TARN_ERROR_IN(operation, TarnErrorException, nullptr, "Got exception: %@ : %@",
+                                   exception ? typeid(*exception).name() : "unknown exception",
+                                   exception ? exception->what() : "");
     // Only an open transaction can be rolled back; the failure may have hit
     // before BEGIN took effect or after COMMIT.
     if (db_ && !sqlite3_get_autocommit(db_)) {
@@ -398,9 +394,9 @@ bool TarnSQLiteDB::addCodeSigningEntry(const TarnCodeSigningEntryRef& codeSignin
             }
         }
     } catch (const std::exception& ex) {
-        e = handleTransactionException(ex.what());
+        e = handleTransactionException("addCodeSigningEntry", &ex);
     } catch (...) {
-        e = handleTransactionException("unknown exception");
+        e = handleTransactionException("addCodeSigningEntry", nullptr);
     }
     if (e && error) *error = e;
     return !e;
@@ -679,9 +675,9 @@ bool TarnSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::s
         runStoreStepHook("commit");
         e = commitTransaction();
     } catch (const std::exception& ex) {
-        e = handleTransactionException(ex.what());
+        e = handleTransactionException("invalidateCodeSigningForIdentifierAndAllChildren", &ex);
     } catch (...) {
-        e = handleTransactionException("unknown exception");
+        e = handleTransactionException("invalidateCodeSigningForIdentifierAndAllChildren", nullptr);
     }
     if (e && error) *error = e;
     return !e;

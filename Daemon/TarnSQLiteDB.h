@@ -21,6 +21,7 @@
 
 #include <cstdint>
 #include <functional>
+#include <exception>
 #include <memory>
 #include <set>
 #include <string>
@@ -123,7 +124,8 @@ private:
     TarnErrorRef commitTransaction();
     // Turns an exception caught inside a transaction into error 40 (after a
     // rollback); on an internal build the process stops instead.
-    TarnErrorRef handleTransactionException(const std::string& what);
+    // A caught exception in `operation`: rolled back, 40 (the fatal report on internal builds).
+    TarnErrorRef handleTransactionException(const char* operation, const std::exception* exception);
     void finalize(sqlite3_stmt* statement);
     const char* errmsg() const;
     void runStoreStepHook(const char* step);

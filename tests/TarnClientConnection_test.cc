@@ -5,6 +5,7 @@
 #include <stdexcept>
 #include <thread>
 
+#include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Daemon/TarnWhitelist.h"
 #include "Platform/HostConfiguration.h"
@@ -158,6 +159,7 @@ TEST_F(TarnClientConnectionTest, CompleteRunsTheCommandQueue) {
     HostConfiguration customer = saved;
     customer.internalBuild = false;  // an internal build stops at an exception, by design
     HostConfiguration::TEST_setShared(customer);
+    TarnGlobalConfiguration::sharedInstance().setIsInternalImage(false);
     auto d = caller("com.client");
     d->commandQueue()->insertCommand(std::make_shared<Throwing>());
     d->commandQueue()->insertCommand(std::make_shared<Counting>(&ran, true));
