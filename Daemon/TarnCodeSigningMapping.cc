@@ -1,6 +1,7 @@
 #include "Daemon/TarnCodeSigningMapping.h"
 
-#include <cassert>
+#include <cstdio>
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
@@ -76,13 +77,23 @@ TarnCodeSigningMapping::TarnCodeSigningMapping(TarnUserIdentitySharedCache* user
 
 TarnCodeSigningMapping::~TarnCodeSigningMapping() = default;
 
+// A programming error, caught in every build: a call on the wrong side of the
+// queue either races on the store or never returns.
+[[noreturn]] static void queueMisuse(const char* what) {
+    PlatformLog("database", PlatformLogType::Fault, "TarnCodeSigningMapping: %s", what);
+    std::fprintf(stderr, "TarnCodeSigningMapping: %s\n", what);  // also past a quiet log
+    std::abort();
+}
+
 void TarnCodeSigningMapping::runOnQueue(const std::function<void()>& work) {
     // Entering our own serial queue from itself would never return.
-    assert(!queue_->isCurrent());
+    if (queue_->isCurrent()) queueMisuse("public operation called on the mapping's own queue");
     queue_->sync(work);
 }
 
-void TarnCodeSigningMapping::assertOnQueue() const { assert(queue_->isCurrent()); }
+void TarnCodeSigningMapping::assertOnQueue() const {
+    if (!queue_->isCurrent()) queueMisuse("_onQueue_ operation called off the mapping's queue");
+}
 
 // ---- entitlement helpers ----
 

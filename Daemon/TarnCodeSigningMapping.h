@@ -6,7 +6,7 @@
 // Concurrency: every store access runs on the mapping's one serial queue,
 // "com.ostrea.TarnKeeper.EntitlementQueue". Public operations enter it
 // synchronously, so they must not be called from it (that would deadlock;
-// it is asserted). `_onQueue_` operations must run on it. Work on the queue
+// it is checked in every build, and stops the process). `_onQueue_` operations must run on it. Work on the queue
 // runs strictly one item at a time in submission order, so a read never sees
 // half of a write.
 //

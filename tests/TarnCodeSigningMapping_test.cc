@@ -272,5 +272,12 @@ TEST_F(TarnCodeSigningMappingTest, BatchWriteDeletesStoresAndChecksCounts) {
     EXPECT_EQ(mapping().identifiersWithError(&e), std::set<std::string>{"com.kept"});
 }
 
+// Misuse of the queue is a programming error, caught in every build.
+TEST_F(TarnCodeSigningMappingTest, OnQueueOperationsOffTheQueueStopTheProcess) {
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    EXPECT_DEATH(mapping()._onQueue_dataContainerTypeForIdentifier("com.a"),
+                 "off the mapping's queue");
+}
+
 }  // namespace
 }  // namespace tarn
