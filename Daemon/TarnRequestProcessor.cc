@@ -18,7 +18,6 @@
 #include "Platform/CodeSignRegistry.h"
 #include "Platform/Conduit.h"
 #include "Platform/PersonaRoster.h"
-#include "Platform/HostConfiguration.h"
 #include "Platform/PlatformLog.h"
 
 namespace tarn {
