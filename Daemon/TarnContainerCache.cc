@@ -449,7 +449,8 @@ TarnMetadataRef TarnContainerCache::_lock_metadataFromSandboxForContainerIdentit
                 return;
             }
             if (itemType != wantedType) return;
-            if (item->identifier.empty() || !item->path) {
+            // Every item the state keeps has an identifier ("" is one).
+            if (!item->path) {
                 PlatformLog(
                     "sandbox", PlatformLogType::Debug,
                     "Sandbox kernel: Got an item with no identifier or path; itemType = %llu",

@@ -159,7 +159,7 @@ FileSandboxUserState::Table& FileSandboxUserState::_lock_tableForUID(uint32_t ui
                 auto t = type ? type->asUInt64() : std::nullopt;
                 auto p = persona ? persona->asUInt64() : std::nullopt;
                 if (!t || !p || *p > UINT32_MAX || !identifier || !identifier->asString() ||
-                    !path || !path->asString() || identifier->asString()->empty()) {
+                    !path || !path->asString()) {
                     PlatformLog("sandbox", PlatformLogType::Error,
                                 "Skipping malformed sandbox item in %s", file);
                     continue;
@@ -198,7 +198,7 @@ void FileSandboxUserState::_lock_replayJournal(uint32_t uid, Table& table) {
         auto t = type ? type->asUInt64() : std::nullopt;
         auto p = persona ? persona->asUInt64() : std::nullopt;
         if (!t || !p || *p > UINT32_MAX || !identifier || !identifier->asString() ||
-            identifier->asString()->empty() || (path && !path->asString()))
+            (path && !path->asString()))
             break;
         Key key{*t, *identifier->asString(), static_cast<uint32_t>(*p)};
         if (path)
@@ -290,7 +290,8 @@ int FileSandboxUserState::_lock_recordChanges(uint32_t uid, const std::vector<Ch
 int FileSandboxUserState::setUserStateItemWithPersona(uint32_t uid, uint32_t personaID,
                                                       uint64_t itemType, const char* identifier,
                                                       const char* path) {
-    if (!identifier || !*identifier) return EINVAL;
+    // An empty identifier is a valid one (a container may be named "").
+    if (!identifier) return EINVAL;
     MutexLock lock(mu_);
     Table& table = _lock_tableForUID(uid);
     Key key{itemType, identifier, personaID};
@@ -318,7 +319,7 @@ bool FileSandboxUserState::userStateItemIsRecordedWithPersona(uint32_t uid, uint
                                                               uint64_t itemType,
                                                               const char* identifier,
                                                               const char* path) {
-    if (!identifier || !*identifier) return false;
+    if (!identifier) return false;
     MutexLock lock(mu_);
     const Table& table = _lock_tableForUID(uid);
     auto it = table.find(KeyView{itemType, identifier, personaID});

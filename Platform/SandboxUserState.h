@@ -81,7 +81,7 @@ class SandboxUserState {
     virtual ~SandboxUserState() = default;
 
     // Records (path given) or removes (path null) one item. 0 on success,
-    // otherwise an errno value; an empty identifier is EINVAL.
+    // otherwise an errno value; a null identifier is EINVAL (an empty one is valid).
     virtual int setUserStateItemWithPersona(uint32_t uid, uint32_t personaID, uint64_t itemType,
                                             const char* identifier, const char* path) = 0;
     // Whether the item is recorded with exactly `path`: a push that would

@@ -45,11 +45,14 @@ TEST_F(SandboxUserStateTest, ItemsSurviveANewInstanceAndClearsAreDurable) {
         EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 2, "group.g", "/c/G"), 0);
         EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.a", nullptr), 0);
         EXPECT_EQ(state.setUserStateItemWithPersona(0, 501, 4, "com.sys", "/s"), 0);
-        EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "", "/x"), EINVAL);
+        EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, nullptr, "/x"), EINVAL);
+        // A container may be named "": its item is kept like any other.
+        EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "", "/x"), 0);
+        EXPECT_TRUE(state.userStateItemIsRecordedWithPersona(501, 501, 1, "", "/x"));
     }
     FileSandboxUserState restarted(dir());
     EXPECT_EQ(items(restarted, 501),
-              (std::vector<std::string>{"1:com.a:900=/e/A", "2:group.g:501=/c/G"}));
+              (std::vector<std::string>{"1::501=/x", "1:com.a:900=/e/A", "2:group.g:501=/c/G"}));
     EXPECT_EQ(items(restarted, 0), (std::vector<std::string>{"4:com.sys:501=/s"}));
     EXPECT_TRUE(items(restarted, 777).empty());
     EXPECT_TRUE(fs::exists(dir())) << "state lives below the root's run directory";
@@ -78,7 +81,7 @@ TEST_F(SandboxUserStateTest, RecordedItemsAreRecognisedAndIterationStaysOrdered)
     EXPECT_TRUE(state.userStateItemIsRecordedWithPersona(501, 501, 1, "com.none", nullptr));
     EXPECT_FALSE(state.userStateItemIsRecordedWithPersona(502, 501, 1, "com.a", "/c/x"))
         << "another user";
-    EXPECT_FALSE(state.userStateItemIsRecordedWithPersona(501, 501, 1, "", nullptr));
+    EXPECT_FALSE(state.userStateItemIsRecordedWithPersona(501, 501, 1, nullptr, nullptr));
 
     // The snapshot a big batch writes comes back the same, in order.
     {

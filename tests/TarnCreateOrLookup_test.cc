@@ -21,6 +21,7 @@
 #include "Platform/ContainerLibrary.h"
 #include "Platform/Failpoints.h"
 #include "Platform/PlatformLog.h"
+#include "Platform/SandboxUserState.h"
 #include "support/ScratchRoot.h"
 
 namespace tarn {
@@ -204,6 +205,11 @@ TEST_F(TarnCreateOrLookupTest, AnEmptyIdentifierMakesOneContainer) {
     EXPECT_TRUE(again->existed());
     EXPECT_EQ(again->url(), made->url());
     EXPECT_EQ(directoriesIn(liveFor(2)), 1u);
+    // Its kernel mapping is kept like any other's.
+    auto mobile = TarnUserIdentityCache::defaultUserIdentity();
+    EXPECT_TRUE(SandboxUserState::sharedInstance().userStateItemIsRecordedWithPersona(
+        mobile->posixUID(), mobile->kernelPersonaID(), TarnContainerClassSandboxItemType(2), "",
+        made->url().c_str()));
     TarnErrorRef error;
     EXPECT_TRUE(TarnContainerCache::sharedInstance().removeContainerForUserIdentity(
         TarnUserIdentityCache::defaultUserIdentity(), 2, "", false, &error));
