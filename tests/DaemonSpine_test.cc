@@ -8,6 +8,7 @@
 
 #include <cstring>
 #include <filesystem>
+#include <optional>
 #include <thread>
 
 #include "Platform/Conduit.h"
@@ -42,6 +43,19 @@ protected:
         auto client = conduit::Client::connect(daemon_->socketPath(), &why);
         EXPECT_TRUE(client) << why;
         return client;
+    }
+    // {"Command": n}, for a test to add to.
+    static PlistValue command(uint64_t n) {
+        PlistValue request{PlistDict{}};
+        request.set("Command", n);
+        return request;
+    }
+    // One request on `client`; the reply, or none (with the reason added as a failure).
+    static std::optional<PlistValue> sendOn(conduit::Client& client, const PlistValue& request) {
+        std::string why;
+        auto reply = client.sendSync(request, std::chrono::seconds(10), &why);
+        EXPECT_TRUE(reply) << why;
+        return reply;
     }
     size_t count(const std::string& needle) {
         std::string log = daemon_->platformLog();
@@ -81,12 +95,10 @@ TEST_F(DaemonSpineTest, AnUnregisteredCallerIsLoggedAsNil) {
     daemon_->start();
     auto client = connectSelf();
     ASSERT_TRUE(client);
-    std::string why;
-    PlistValue request{PlistDict{}};
-    request.set("Command", uint64_t{0});
+    PlistValue request = command(0);
     request.set("Identifier", "com.ostrea.test.nobody");
     request.set("ContainerClass", uint64_t{2});
-    ASSERT_TRUE(client->sendSync(request, std::chrono::seconds(10), &why)) << why;
+    ASSERT_TRUE(sendOn(*client, request));
     EXPECT_EQ(count("command=0, client=(null), error="), 1u);
 }
 
@@ -97,10 +109,7 @@ TEST_F(DaemonSpineTest, MalformedEntitlementsAreReportedOnEveryRequest) {
     daemon_->start();
     auto client = connectSelf();
     ASSERT_TRUE(client);
-    std::string why;
-    PlistValue request{PlistDict{}};
-    request.set("Command", uint64_t{27});
-    for (int i = 0; i < 3; ++i) ASSERT_TRUE(client->sendSync(request, std::chrono::seconds(10), &why)) << why;
+    for (int i = 0; i < 3; ++i) ASSERT_TRUE(sendOn(*client, command(27)));
     EXPECT_EQ(count("Missing or malformed entitlements for pid"), 3u);
 }
 
@@ -116,11 +125,8 @@ TEST_F(DaemonSpineTest, ARegistrationChangeShowsOnAnOpenConnection) {
     daemon_->start();
     auto client = connectSelf();
     ASSERT_TRUE(client);
-    std::string why;
-    PlistValue request{PlistDict{}};
-    request.set("Command", uint64_t{27});
     auto answer = [&] {
-        auto reply = client->sendSync(request, std::chrono::seconds(10), &why);
+        auto reply = sendOn(*client, command(27));
         const PlistValue* e = reply ? reply->find("ReplyError") : nullptr;
         return e && e->asUInt64() ? *e->asUInt64() : uint64_t{0};
     };
