@@ -9,6 +9,7 @@
 
 #include "Daemon/TarnClientIdentity.h"
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnExceptionFence.h"
 #include "Platform/PropertyList.h"
 
 namespace tarn {
@@ -38,15 +39,5 @@ TarnEntitlementGate TarnCheckEntitlements(const std::shared_ptr<const TarnClient
 void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
                              const conduit::Event& event,
                              TarnClientIdentity::Reuse* reuse = nullptr);
-
-// Turns an exception caught at an operation boundary into a code: on internal
-// builds it ends the process with the fatal report; otherwise it logs
-// "Got exception: %@ : %@" and answers 40.
-uint64_t TarnHandleCaughtException(const char* function, const std::exception* exception);
-// The same, answering the error value for operations that hand one back.
-TarnErrorRef TarnCaughtExceptionError(const char* function, const std::exception* exception);
-
-// Builds the report text, stores it in the crash message slot and aborts.
-[[noreturn]] void TarnFatalExceptionReport(const std::exception* exception);
 
 }  // namespace tarn
