@@ -119,7 +119,8 @@ TarnClientIdentityRef TarnClientIdentity::clientIdentityWithConduitConnection(
     gid_t gid = connection->egid();
     pid_t pid = connection->pid();
     TarnUserIdentityRef userIdentity =
-        TarnUserIdentitySharedCache::sharedInstance().userIdentityForCurrentContextWithUID(uid, gid);
+        TarnUserIdentitySharedCache::sharedInstance().userIdentityForCurrentContextWithUID(
+            uid, gid, info ? info->personaUniqueString : std::nullopt);
     if (reuse && reuse->identity && info && reuse->codeSignInfo == info &&
         reuse->userIdentity == userIdentity) {
         // Every build reports a registration without usable entitlements,

@@ -550,7 +550,8 @@ uint64_t TarnCodeSigningMapping::processCallerRegisteredEntitlements(const Plist
 
 // ---- command 19 ----
 
-void TarnHandleGetCodeSigningInfoCommand(const PlistValue& request, PlistValue& reply,
+void TarnHandleGetCodeSigningInfoCommand(const TarnRequestContext& context,
+                                         const PlistValue& request, PlistValue& reply,
                                          TarnClientConnection* connection, uint64_t* error) {
     try {
         std::string identifier;

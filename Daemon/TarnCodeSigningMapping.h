@@ -30,6 +30,7 @@
 
 #include "Daemon/TarnCodeSigningEntry.h"
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnRequestContext.h"
 #include "Platform/Dispatch.h"
 #include "Platform/Path.h"
 #include "Platform/PropertyList.h"
@@ -197,7 +198,8 @@ private:
 
 // Command 19: answers "ReplyInfoDictionary" with the external view of the
 // identifier's code-signing info, or fails with 21 when there is none.
-void TarnHandleGetCodeSigningInfoCommand(const PlistValue& request, PlistValue& reply,
+void TarnHandleGetCodeSigningInfoCommand(const TarnRequestContext& context,
+                                         const PlistValue& request, PlistValue& reply,
                                          TarnClientConnection* connection, uint64_t* error);
 
 }  // namespace tarn

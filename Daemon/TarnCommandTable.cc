@@ -7,49 +7,50 @@
 
 namespace tarn {
 
-void TarnHandleUnsupportedCommand(const PlistValue&, PlistValue&, TarnClientConnection*,
-                                  uint64_t* error) {
+void TarnHandleUnsupportedCommand(const TarnRequestContext&, const PlistValue&, PlistValue&,
+                                  TarnClientConnection*, uint64_t* error) {
     TarnSetError(error, TarnErrorInvalidCommand);
 }
 
-#define ALLOWED kTarnEntitlementAllowed
+// Rows name only what differs from the defaults (replyOnReturn 1, anyClient 0,
+// lookupAllowed 0).
+constexpr const char* kAllowed = kTarnEntitlementAllowed;
 
 // clang-format off
 const TarnCommandTableRow gTarnCommandTable[kTarnCommandCount] = {
-    // command, handler, entitlement, replyOnReturn, anyClient, lookupAllowed
-    { 0, TarnHandleCreateOrLookupCommand, ALLOWED, 1, 1, 1},  // create or look up a container
-    { 1, TarnHandleContainersWithClassCommand, ALLOWED, 1, 0, 1},  // list the containers of a class
-    { 2, nullptr, ALLOWED, 1, 0, 0},  // replace one container by another
-    { 3, TarnHandleStageForDeleteCommand, ALLOWED, 1, 0, 0},  // stage containers for deletion
-    { 4, TarnHandleDeleteDeathRowCommand, kTarnEntitlementUserManagedAssets, 0, 0, 0},  // delete death row
-    { 5, TarnHandleSetInfoValueCommand, ALLOWED, 1, 0, 0},  // set a metadata info value
-    { 6, TarnHandleInfoValueCommand, ALLOWED, 1, 0, 0},  // read a metadata info value
-    { 7, TarnHandleMetadataCommand, ALLOWED, 1, 0, 0},  // read a container's metadata
-    { 8, TarnHandleRecreateStructureCommand, ALLOWED, 1, 0, 0},  // recreate the default structure
-    { 9, TarnHandleRegenerateUUIDCommand, ALLOWED, 1, 0, 0},  // new directory UUID
-    {10, TarnHandleDeleteContainerCommand, ALLOWED, 1, 0, 0},  // delete a container
-    {11, nullptr, kTarnEntitlementWipeContainer, 1, 0, 0},  // wipe an entitled data container
-    {12, nullptr, kTarnEntitlementDeleteContainerContent, 1, 0, 0},  // wipe any container
-    {13, nullptr, ALLOWED, 1, 1, 1},  // the client's group containers
-    {14, nullptr, ALLOWED, 1, 0, 1},  // group identifiers of an owner
-    {15, nullptr, ALLOWED, 1, 1, 1},  // path of a system container
-    {16, nullptr, ALLOWED, 1, 1, 1},  // system group containers of an owner
-    {17, nullptr, ALLOWED, 1, 1, 1},  // path of one system group container
-    {18, nullptr, ALLOWED, 1, 0, 0},  // record code-signing information
-    {19, TarnHandleGetCodeSigningInfoCommand, ALLOWED, 1, 0, 0},  // read code-signing information
-    {20, nullptr, ALLOWED, 1, 0, 0},  // invalidate code-signing info without bundle
-    {21, nullptr, ALLOWED, 0, 0, 0},  // set data protection
-    {22, TarnHandleRecreateStructureCommand, ALLOWED, 1, 0, 0},  // same as 8
-    {23, TarnHandleDiskUsageCommand, ALLOWED, 1, 0, 1},  // disk usage
-    {24, nullptr, kTarnEntitlementDataMigration, 1, 0, 0},  // data-migrator migration
-    {25, nullptr, kTarnEntitlementTestability, 1, 0, 0},  // crash-and-retry test
-    {26, nullptr, kTarnEntitlementStageSharedContent, 1, 0, 0},  // stage shared content
-    {27, TarnHandleUnsupportedCommand, ALLOWED, 1, 0, 0},  // not supported
-    {28, nullptr, kTarnEntitlementUserManagedAssets, 1, 1, 0},  // user-managed assets path
-    {29, nullptr, kTarnEntitlementUserManagedAssets, 1, 0, 0},  // delete a user-managed asset
-    {30, nullptr, ALLOWED, 1, 0, 0},  // per-user data migration
-    {31, TarnHandleTestLockCommand, kTarnEntitlementTestability, 1, 0, 0},  // test locks
-    {32, nullptr, ALLOWED, 1, 1, 1},  // persona unique strings
+    {.command = 0, .handler = TarnHandleCreateOrLookupCommand, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // create or look up a container
+    {.command = 1, .handler = TarnHandleContainersWithClassCommand, .entitlement = kAllowed, .lookupAllowed = 1},  // list the containers of a class
+    {.command = 2, .entitlement = kAllowed},  // replace one container by another
+    {.command = 3, .handler = TarnHandleStageForDeleteCommand, .entitlement = kAllowed},  // stage containers for deletion
+    {.command = 4, .handler = TarnHandleDeleteDeathRowCommand, .entitlement = kTarnEntitlementUserManagedAssets, .replyOnReturn = 0},  // delete death row
+    {.command = 5, .handler = TarnHandleSetInfoValueCommand, .entitlement = kAllowed},  // set a metadata info value
+    {.command = 6, .handler = TarnHandleInfoValueCommand, .entitlement = kAllowed},  // read a metadata info value
+    {.command = 7, .handler = TarnHandleMetadataCommand, .entitlement = kAllowed},  // read a container's metadata
+    {.command = 8, .handler = TarnHandleRecreateStructureCommand, .entitlement = kAllowed},  // recreate the default structure
+    {.command = 9, .handler = TarnHandleRegenerateUUIDCommand, .entitlement = kAllowed},  // new directory UUID
+    {.command = 10, .handler = TarnHandleDeleteContainerCommand, .entitlement = kAllowed},  // delete a container
+    {.command = 11, .entitlement = kTarnEntitlementWipeContainer},  // wipe an entitled data container
+    {.command = 12, .entitlement = kTarnEntitlementDeleteContainerContent},  // wipe any container
+    {.command = 13, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // the client's group containers
+    {.command = 14, .entitlement = kAllowed, .lookupAllowed = 1},  // group identifiers of an owner
+    {.command = 15, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // path of a system container
+    {.command = 16, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // system group containers of an owner
+    {.command = 17, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // path of one system group container
+    {.command = 18, .entitlement = kAllowed},  // record code-signing information
+    {.command = 19, .handler = TarnHandleGetCodeSigningInfoCommand, .entitlement = kAllowed},  // read code-signing information
+    {.command = 20, .entitlement = kAllowed},  // invalidate code-signing info without bundle
+    {.command = 21, .entitlement = kAllowed, .replyOnReturn = 0},  // set data protection
+    {.command = 22, .handler = TarnHandleRecreateStructureCommand, .entitlement = kAllowed},  // same as 8
+    {.command = 23, .handler = TarnHandleDiskUsageCommand, .entitlement = kAllowed, .lookupAllowed = 1},  // disk usage
+    {.command = 24, .entitlement = kTarnEntitlementDataMigration},  // data-migrator migration
+    {.command = 25, .entitlement = kTarnEntitlementTestability},  // crash-and-retry test
+    {.command = 26, .entitlement = kTarnEntitlementStageSharedContent},  // stage shared content
+    {.command = 27, .handler = TarnHandleUnsupportedCommand, .entitlement = kAllowed},  // not supported
+    {.command = 28, .entitlement = kTarnEntitlementUserManagedAssets, .anyClient = 1},  // user-managed assets path
+    {.command = 29, .entitlement = kTarnEntitlementUserManagedAssets},  // delete a user-managed asset
+    {.command = 30, .entitlement = kAllowed},  // per-user data migration
+    {.command = 31, .handler = TarnHandleTestLockCommand, .entitlement = kTarnEntitlementTestability},  // test locks
+    {.command = 32, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // persona unique strings
 };
 // clang-format on
 

@@ -6,24 +6,34 @@
 #include <cstdint>
 #include <memory>
 
+#include "Daemon/TarnRequestContext.h"
 #include "Platform/PropertyList.h"
 
 namespace tarn {
 
 class TarnClientConnection;
 
-// A handler writes reply keys into `reply` and, on failure, a code into *error.
-// It never sends the reply itself unless its row has replyOnReturn 0.
-using TarnCommandHandler = void (*)(const PlistValue& request, PlistValue& reply,
-                                    TarnClientConnection* connection, uint64_t* error);
+// A handler writes reply keys into `reply` and, on failure, a code into *error
+// (the request's error slot: 1 until something fails). It never sends the
+// reply itself unless its row has replyOnReturn 0; then, once it has started
+// its operation, the operation's completion answers through
+// context.deferredReply.
+using TarnCommandHandler = void (*)(const TarnRequestContext& context, const PlistValue& request,
+                                    PlistValue& reply, TarnClientConnection* connection,
+                                    uint64_t* error);
 
 struct TarnCommandTableRow {
-    uint64_t command;
-    TarnCommandHandler handler;  // may be null: the command answers 49
-    const char* entitlement;
-    uint8_t replyOnReturn;
-    uint8_t anyClient;
-    uint8_t lookupAllowed;
+    uint64_t command = 0;
+    TarnCommandHandler handler = nullptr;  // null: the command answers TarnErrorInvalidCommand
+    const char* entitlement = nullptr;
+    // The processor answers when the handler returns; 0: on success the
+    // handler's completion answers.
+    uint8_t replyOnReturn = 1;
+    // A connection is built even for a caller without the entitlement (it
+    // then applies the per-container lookup rules).
+    uint8_t anyClient = 0;
+    // The caller's lookup entitlement is honoured.
+    uint8_t lookupAllowed = 0;
 };
 
 inline constexpr size_t kTarnCommandCount = 33;
@@ -47,20 +57,10 @@ inline constexpr const char* kTarnEntitlementTestability =
 inline constexpr const char* kTarnEntitlementStageSharedContent =
     "com.ostrea.private.TarnKeeper.stageSharedContent";
 
-// Asynchronous replies (rows with replyOnReturn 0): inside a handler, take the
-// request's reply; the completion later calls send(code), which sets
-// "ReplyError" and sends it. Valid only on the handler's thread, while it runs.
-class TarnDeferredReply {
-public:
-    virtual ~TarnDeferredReply() = default;
-    virtual PlistValue& body() = 0;
-    virtual void send(uint64_t code) = 0;
-};
-std::shared_ptr<TarnDeferredReply> TarnTakeDeferredReply();
-
-// Handlers that do not exist yet answer 49 through a null entry; this one is
-// for commands that never will (27).
-void TarnHandleUnsupportedCommand(const PlistValue& request, PlistValue& reply,
-                                  TarnClientConnection* connection, uint64_t* error);
+// Handlers that do not exist yet answer TarnErrorInvalidCommand through a
+// null entry; this one is for a command that never will (27).
+void TarnHandleUnsupportedCommand(const TarnRequestContext& context, const PlistValue& request,
+                                  PlistValue& reply, TarnClientConnection* connection,
+                                  uint64_t* error);
 
 }  // namespace tarn

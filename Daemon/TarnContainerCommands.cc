@@ -254,8 +254,9 @@ void issueSandboxExtension(PlistValue& reply, const char* replyKey, const TarnMe
 
 // ---- Handlers ----
 
-void TarnHandleCreateOrLookupCommand(const PlistValue& request, PlistValue& reply,
-                                     TarnClientConnection* connection, uint64_t* error) {
+void TarnHandleCreateOrLookupCommand(const TarnRequestContext& context, const PlistValue& request,
+                                     PlistValue& reply, TarnClientConnection* connection,
+                                     uint64_t* error) {
     TarnContainerIdentityRef identity =
         validatedContainerIdentity(request, *connection, nullptr, "ContainerClass", error);
     if (!identity) return;
@@ -273,7 +274,8 @@ void TarnHandleCreateOrLookupCommand(const PlistValue& request, PlistValue& repl
                           connection->clientIdentity().get());
 }
 
-void TarnHandleContainersWithClassCommand(const PlistValue& request, PlistValue& reply,
+void TarnHandleContainersWithClassCommand(const TarnRequestContext& context,
+                                          const PlistValue& request, PlistValue& reply,
                                           TarnClientConnection* connection, uint64_t* error) {
     std::optional<std::vector<TarnMetadataRef>> containers = connection->containersWithClass(
         uint64ForKey(request, "ContainerClass"), boolForKey(request, "Transient"), error);
@@ -295,8 +297,9 @@ void TarnHandleContainersWithClassCommand(const PlistValue& request, PlistValue&
     reply.set("ReplyPersonaUniqueStringsArray", std::move(personas));
 }
 
-void TarnHandleStageForDeleteCommand(const PlistValue& request, PlistValue& reply,
-                                     TarnClientConnection* connection, uint64_t* error) {
+void TarnHandleStageForDeleteCommand(const TarnRequestContext& context, const PlistValue& request,
+                                     PlistValue& reply, TarnClientConnection* connection,
+                                     uint64_t* error) {
     static const PlistArray kNone;
     const PlistArray* classes = arrayForKey(request, "ContainerClassesArray");
     const PlistArray* uuids = arrayForKey(request, "UUIDsArray");
@@ -327,7 +330,8 @@ void TarnHandleStageForDeleteCommand(const PlistValue& request, PlistValue& repl
             user = userIdentityForPersonaUniqueString(
                 *connection, persona ? std::optional<std::string>(*persona) : std::nullopt, error);
         } else {
-            user = connection->userIdentityCache().userIdentityForCurrentContext();
+            user = connection->userIdentityCache().userIdentityForCurrentContext(
+                context.personaUniqueString);
         }
         // One container of someone else's persona spoils the whole request.
         if (!user) {
@@ -345,8 +349,9 @@ void TarnHandleStageForDeleteCommand(const PlistValue& request, PlistValue& repl
             std::move(identities), /*useLocking=*/true, nullptr));
 }
 
-void TarnHandleDeleteDeathRowCommand(const PlistValue& request, PlistValue& reply,
-                                     TarnClientConnection* connection, uint64_t* error) {
+void TarnHandleDeleteDeathRowCommand(const TarnRequestContext& context, const PlistValue& request,
+                                     PlistValue& reply, TarnClientConnection* connection,
+                                     uint64_t* error) {
     // Run what the request queued (entitlement registration) before the pass
     // starts: a failure there must be the one reply, not a second one after
     // the completion's. The processor's own run then finds the queue empty;
@@ -355,7 +360,7 @@ void TarnHandleDeleteDeathRowCommand(const PlistValue& request, PlistValue& repl
         connection->commandQueue()->removeAllCommands();
         return;
     }
-    std::shared_ptr<TarnDeferredReply> deferred = TarnTakeDeferredReply();
+    std::shared_ptr<TarnDeferredReply> deferred = context.deferredReply;
     if (!deferred) {
         // Called outside a request (no reply to keep): just start the pass.
         connection->deleteContainersOnDeathRowWithCompletion(nullptr);
@@ -365,8 +370,9 @@ void TarnHandleDeleteDeathRowCommand(const PlistValue& request, PlistValue& repl
         [deferred](uint64_t code) { deferred->send(code); });
 }
 
-void TarnHandleSetInfoValueCommand(const PlistValue& request, PlistValue& reply,
-                                   TarnClientConnection* connection, uint64_t* error) {
+void TarnHandleSetInfoValueCommand(const TarnRequestContext& context, const PlistValue& request,
+                                   PlistValue& reply, TarnClientConnection* connection,
+                                   uint64_t* error) {
     TarnConcreteContainerIdentityRef identity =
         concreteContainerIdentity(request, *connection, {}, error);
     if (!identity) return;
@@ -374,8 +380,9 @@ void TarnHandleSetInfoValueCommand(const PlistValue& request, PlistValue& reply,
                              /*useLocking=*/true, error);
 }
 
-void TarnHandleInfoValueCommand(const PlistValue& request, PlistValue& reply,
-                                TarnClientConnection* connection, uint64_t* error) {
+void TarnHandleInfoValueCommand(const TarnRequestContext& context, const PlistValue& request,
+                                PlistValue& reply, TarnClientConnection* connection,
+                                uint64_t* error) {
     TarnConcreteContainerIdentityRef identity =
         concreteContainerIdentity(request, *connection, {}, error);
     if (!identity) return;
@@ -384,8 +391,9 @@ void TarnHandleInfoValueCommand(const PlistValue& request, PlistValue& reply,
     if (value) reply.set("ReplyInfoValue", std::move(*value));
 }
 
-void TarnHandleMetadataCommand(const PlistValue& request, PlistValue& reply,
-                               TarnClientConnection* connection, uint64_t* error) {
+void TarnHandleMetadataCommand(const TarnRequestContext& context, const PlistValue& request,
+                               PlistValue& reply, TarnClientConnection* connection,
+                               uint64_t* error) {
     TarnConcreteContainerIdentityRef identity =
         concreteContainerIdentity(request, *connection, {}, error);
     if (!identity) return;
@@ -401,7 +409,8 @@ void TarnHandleMetadataCommand(const PlistValue& request, PlistValue& reply,
         reply.set("ReplyPersonaUniqueString", *container->userIdentity()->personaUniqueString());
 }
 
-void TarnHandleRecreateStructureCommand(const PlistValue& request, PlistValue& reply,
+void TarnHandleRecreateStructureCommand(const TarnRequestContext& context,
+                                        const PlistValue& request, PlistValue& reply,
                                         TarnClientConnection* connection, uint64_t* error) {
     TarnConcreteContainerIdentityRef identity =
         concreteContainerIdentity(request, *connection, {}, error);
@@ -409,16 +418,18 @@ void TarnHandleRecreateStructureCommand(const PlistValue& request, PlistValue& r
     connection->recreateDefaultStructureWithContainerIdentity(identity, error);
 }
 
-void TarnHandleRegenerateUUIDCommand(const PlistValue& request, PlistValue& reply,
-                                     TarnClientConnection* connection, uint64_t* error) {
+void TarnHandleRegenerateUUIDCommand(const TarnRequestContext& context, const PlistValue& request,
+                                     PlistValue& reply, TarnClientConnection* connection,
+                                     uint64_t* error) {
     TarnConcreteContainerIdentityRef identity =
         concreteContainerIdentity(request, *connection, {}, error);
     if (!identity) return;
     connection->regenerateDirectoryUUIDWithContainerIdentity(identity, error);
 }
 
-void TarnHandleDeleteContainerCommand(const PlistValue& request, PlistValue& reply,
-                                      TarnClientConnection* connection, uint64_t* error) {
+void TarnHandleDeleteContainerCommand(const TarnRequestContext& context, const PlistValue& request,
+                                      PlistValue& reply, TarnClientConnection* connection,
+                                      uint64_t* error) {
     TarnContainerIdentityRef identity =
         validatedContainerIdentity(request, *connection, "Identifier", "ContainerClass", error);
     if (!identity) return;
@@ -426,8 +437,9 @@ void TarnHandleDeleteContainerCommand(const PlistValue& request, PlistValue& rep
                                                      error);
 }
 
-void TarnHandleDiskUsageCommand(const PlistValue& request, PlistValue& reply,
-                                TarnClientConnection* connection, uint64_t* error) {
+void TarnHandleDiskUsageCommand(const TarnRequestContext& context, const PlistValue& request,
+                                PlistValue& reply, TarnClientConnection* connection,
+                                uint64_t* error) {
     TarnConcreteContainerIdentityRef identity =
         concreteContainerIdentity(request, *connection, {}, error);
     if (!identity) return;

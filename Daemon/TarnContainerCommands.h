@@ -18,6 +18,7 @@
 #include "Daemon/TarnContainerClass.h"
 #include "Daemon/TarnContainerIdentity.h"
 #include "Daemon/TarnMetadata.h"
+#include "Daemon/TarnRequestContext.h"
 #include "Daemon/TarnUserIdentity.h"
 #include "Platform/PropertyList.h"
 
@@ -95,29 +96,40 @@ void issueSandboxExtension(PlistValue& reply, const char* replyKey, const TarnMe
 
 // ---- Handlers ----
 
-void TarnHandleCreateOrLookupCommand(const PlistValue& request, PlistValue& reply,
-                                     TarnClientConnection* connection, uint64_t* error);  // 0
-void TarnHandleContainersWithClassCommand(const PlistValue& request, PlistValue& reply,
+void TarnHandleCreateOrLookupCommand(const TarnRequestContext& context, const PlistValue& request,
+                                     PlistValue& reply, TarnClientConnection* connection,
+                                     uint64_t* error);  // 0
+void TarnHandleContainersWithClassCommand(const TarnRequestContext& context,
+                                          const PlistValue& request, PlistValue& reply,
                                           TarnClientConnection* connection, uint64_t* error);  // 1
-void TarnHandleStageForDeleteCommand(const PlistValue& request, PlistValue& reply,
-                                     TarnClientConnection* connection, uint64_t* error);  // 3
+void TarnHandleStageForDeleteCommand(const TarnRequestContext& context, const PlistValue& request,
+                                     PlistValue& reply, TarnClientConnection* connection,
+                                     uint64_t* error);  // 3
 // Replies from the deletion pass's completion (asynchronous reply).
-void TarnHandleDeleteDeathRowCommand(const PlistValue& request, PlistValue& reply,
-                                     TarnClientConnection* connection, uint64_t* error);  // 4
-void TarnHandleSetInfoValueCommand(const PlistValue& request, PlistValue& reply,
-                                   TarnClientConnection* connection, uint64_t* error);  // 5
-void TarnHandleInfoValueCommand(const PlistValue& request, PlistValue& reply,
-                                TarnClientConnection* connection, uint64_t* error);  // 6
-void TarnHandleMetadataCommand(const PlistValue& request, PlistValue& reply,
-                               TarnClientConnection* connection, uint64_t* error);  // 7
-void TarnHandleRecreateStructureCommand(const PlistValue& request, PlistValue& reply,
+void TarnHandleDeleteDeathRowCommand(const TarnRequestContext& context, const PlistValue& request,
+                                     PlistValue& reply, TarnClientConnection* connection,
+                                     uint64_t* error);  // 4
+void TarnHandleSetInfoValueCommand(const TarnRequestContext& context, const PlistValue& request,
+                                   PlistValue& reply, TarnClientConnection* connection,
+                                   uint64_t* error);  // 5
+void TarnHandleInfoValueCommand(const TarnRequestContext& context, const PlistValue& request,
+                                PlistValue& reply, TarnClientConnection* connection,
+                                uint64_t* error);  // 6
+void TarnHandleMetadataCommand(const TarnRequestContext& context, const PlistValue& request,
+                               PlistValue& reply, TarnClientConnection* connection,
+                               uint64_t* error);  // 7
+void TarnHandleRecreateStructureCommand(const TarnRequestContext& context,
+                                        const PlistValue& request, PlistValue& reply,
                                         TarnClientConnection* connection,
                                         uint64_t* error);  // 8, 22
-void TarnHandleRegenerateUUIDCommand(const PlistValue& request, PlistValue& reply,
-                                     TarnClientConnection* connection, uint64_t* error);  // 9
-void TarnHandleDeleteContainerCommand(const PlistValue& request, PlistValue& reply,
-                                      TarnClientConnection* connection, uint64_t* error);  // 10
-void TarnHandleDiskUsageCommand(const PlistValue& request, PlistValue& reply,
-                                TarnClientConnection* connection, uint64_t* error);  // 23
+void TarnHandleRegenerateUUIDCommand(const TarnRequestContext& context, const PlistValue& request,
+                                     PlistValue& reply, TarnClientConnection* connection,
+                                     uint64_t* error);  // 9
+void TarnHandleDeleteContainerCommand(const TarnRequestContext& context, const PlistValue& request,
+                                      PlistValue& reply, TarnClientConnection* connection,
+                                      uint64_t* error);  // 10
+void TarnHandleDiskUsageCommand(const TarnRequestContext& context, const PlistValue& request,
+                                PlistValue& reply, TarnClientConnection* connection,
+                                uint64_t* error);  // 23
 
 }  // namespace tarn

@@ -1,13 +1,5 @@
 #include "Daemon/TarnRequestProcessor.h"
 
-#include <pthread.h>
-
-#include <cstdio>
-#include <cstdlib>
-#include <cstring>
-#include <mutex>
-#include <typeinfo>
-
 #include "Daemon/TarnClientConnection.h"
 #include "Daemon/TarnClientIdentity.h"
 #include "Daemon/TarnCodeSigningMapping.h"
@@ -25,11 +17,11 @@ namespace tarn {
 namespace {
 
 constexpr const char* kTag = "TarnProcessConduitEvent";
+constexpr const char* kGateTag = "checkEntitlementsAndInitClientObject";
 
-// The reply of the request being handled on this thread, for handlers that
-// answer from a completion.
+// The reply of a request whose completion answers (rows with replyOnReturn 0).
 class ConduitDeferredReply final : public TarnDeferredReply {
-public:
+  public:
     explicit ConduitDeferredReply(conduit::MessageRef reply) : reply_(std::move(reply)) {}
     PlistValue& body() override { return reply_->body(); }
     void send(uint64_t code) override {
@@ -37,17 +29,80 @@ public:
         if (auto remote = reply_->remoteConnection()) remote->send(reply_);
     }
 
-private:
+  private:
     conduit::MessageRef reply_;
 };
 
-thread_local conduit::MessageRef* tCurrentReply = nullptr;
+// The command's row, or nullptr with its line and TarnErrorInvalidCommand.
+const TarnCommandTableRow* commandTableRow(uint64_t command, uint64_t* error) {
+    if (command >= kTarnCommandCount) {
+        TarnLog(kLogError, kTag, "Invalid command index: %lld", command);
+    } else if (gTarnCommandTable[command].command != command) {
+        TarnLog(kLogError, kTag, "Invalid command at index %llu", command);
+    } else if (!gTarnCommandTable[command].handler) {
+        TarnLog(kLogError, kTag, "Invalid command handler: %lld", command);
+    } else {
+        return &gTarnCommandTable[command];
+    }
+    TarnSetError(error, TarnErrorInvalidCommand);
+    return nullptr;
+}
+
+// Admission: the caller's identity, the entitlement gate, the registration of
+// the caller's entitlements and the client connection with the caller's
+// rights. Fills the context's persona; nullptr with TarnErrorNotEntitled for
+// a caller the gate turns away.
+std::shared_ptr<TarnClientConnection> admitClient(const std::shared_ptr<conduit::Connection>& peer,
+                                                  const TarnCommandTableRow& row,
+                                                  TarnRequestContext& context,
+                                                  TarnClientIdentity::Reuse* reuse,
+                                                  uint64_t* error) {
+    auto codeSignInfo = TarnClientIdentity::codeSignInfoForConnection(peer);
+    context.personaUniqueString = codeSignInfo ? codeSignInfo->personaUniqueString : std::nullopt;
+    TarnClientIdentityRef identity =
+        TarnClientIdentity::clientIdentityWithConduitConnection(peer, codeSignInfo, reuse);
+    TarnEntitlementGate gate = TarnCheckEntitlements(identity, row);
+    if (!gate.admitted) {
+        TarnLog(kLogError, kGateTag, "connection attempt from pid %d (%@) is not entitled",
+                identity ? identity->posixPID() : peer->pid(),
+                identity ? identity->bundleIdentifier() : std::string("(null)"));
+        TarnSetError(error, TarnErrorNotEntitled);
+        return nullptr;
+    }
+    // Without a code-signing store (it could not be opened) there is nothing
+    // to register; the request itself still goes ahead.
+    TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance();
+    if (identity && mapping) {
+        uint64_t result = mapping->processCallerRegisteredEntitlements(
+            *identity->entitlements().asDict(), identity->bundleIdentifier(),
+            context.commandQueue.get());
+        if (result != TarnSuccess)
+            TarnLog(kLogError, kGateTag, "Error processing entitlements for %@ : %llu",
+                    identity->bundleIdentifier(), result);
+    }
+    return TarnClientConnection::initWithClientIdentity(
+        identity, gate.entitled, gate.allowOtherIdLookup, gate.unrestricted, gate.lookup,
+        gate.wipeList, context.commandQueue);
+}
+
+// The handler, then the request's queued commands. The queue runs even after
+// a handler that threw: what was queued before (staged deletions, say) was
+// asked for by this request.
+void runCommand(const TarnCommandTableRow& row, const TarnRequestContext& context,
+                const PlistValue& request, PlistValue& reply, TarnClientConnection& connection,
+                uint64_t* error) {
+    auto fenced = [&](auto&& step) {
+        TarnStatus status = TarnFenceExceptions(kTag, step);
+        if (!status.ok()) *error = status.code(TarnErrorException);
+    };
+    fenced([&] { row.handler(context, request, reply, &connection, error); });
+    fenced([&] { connection.completeWithError(error); });
+}
 
 }  // namespace
 
 TarnEntitlementGate TarnCheckEntitlements(const TarnClientIdentityRef& identity,
                                           const TarnCommandTableRow& row) {
-    const char* tag = "checkEntitlementsAndInitClientObject";
     TarnEntitlementGate g;
     if (!identity) {
         g.admitted = row.anyClient;
@@ -70,7 +125,7 @@ TarnEntitlementGate TarnCheckEntitlements(const TarnClientIdentityRef& identity,
             g.wipeList = *w;
             g.entitled = true;
         } else {
-            TarnLog(kLogError, tag, "No entitled containers to wipe");
+            TarnLog(kLogError, kGateTag, "No entitled containers to wipe");
             g.entitled = g.unrestricted;
         }
     } else {
@@ -79,27 +134,6 @@ TarnEntitlementGate TarnCheckEntitlements(const TarnClientIdentityRef& identity,
     g.admitted = row.anyClient || g.lookup || g.entitled;
     return g;
 }
-
-std::shared_ptr<TarnDeferredReply> TarnTakeDeferredReply() {
-    if (!tCurrentReply || !*tCurrentReply) return nullptr;
-    return std::make_shared<ConduitDeferredReply>(*tCurrentReply);
-}
-
-namespace {
-
-// Runs one step of a request; an exception becomes error 40 in *error.
-template <class Step>
-void guardOperation(uint64_t* error, Step&& step) {
-    try {
-        step();
-    } catch (const std::exception& e) {
-        *error = TarnHandleCaughtException(kTag, &e);
-    } catch (...) {
-        *error = TarnHandleCaughtException(kTag, nullptr);
-    }
-}
-
-}  // namespace
 
 void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
                              const conduit::Event& event, TarnClientIdentity::Reuse* reuse) {
@@ -118,62 +152,21 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
 
     // The attribute strings are built only when someone records signposts.
     const bool recording = PlatformLogVerbose();
-    SignpostInterval signpost("conduit", recording ? "ConduitEventProcessing" : std::string(),
-                              recording ? std::vector<std::pair<std::string, std::string>>{
-                                              {"command", std::to_string(command)}}
-                                        : std::vector<std::pair<std::string, std::string>>{});
+    SignpostInterval signpost(
+        "conduit", recording ? "ConduitEventProcessing" : std::string(),
+        recording
+            ? std::vector<std::pair<std::string, std::string>>{{"command", std::to_string(command)}}
+            : std::vector<std::pair<std::string, std::string>>{});
+
     std::shared_ptr<TarnClientConnection> connection;
-    const TarnCommandTableRow* row = nullptr;
-    if (command >= kTarnCommandCount) {
-        TarnLog(kLogError, kTag, "Invalid command index: %lld", command);
-        error = TarnErrorInvalidCommand;
-    } else if (gTarnCommandTable[command].command != command) {
-        TarnLog(kLogError, kTag, "Invalid command at index %llu", command);
-        error = TarnErrorInvalidCommand;
-    } else if (!gTarnCommandTable[command].handler) {
-        TarnLog(kLogError, kTag, "Invalid command handler: %lld", command);
-        error = TarnErrorInvalidCommand;
-    } else {
-        row = &gTarnCommandTable[command];
-        auto commandQueue = std::make_shared<TarnCommandQueue>();
-        // The peer's persona is current for the whole request.
-        auto codeSignInfo = TarnClientIdentity::codeSignInfoForConnection(peer);
-        PersonaRoster::setCurrentPersonaUniqueString(
-            codeSignInfo ? codeSignInfo->personaUniqueString : std::nullopt);
-        TarnClientIdentityRef identity =
-            TarnClientIdentity::clientIdentityWithConduitConnection(peer, codeSignInfo, reuse);
-        TarnEntitlementGate gate = TarnCheckEntitlements(identity, *row);
-        // Without a code-signing store (it could not be opened) there is
-        // nothing to register; the request itself still goes ahead.
-        TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance();
-        if (identity && gate.admitted && mapping) {
-            uint64_t result = mapping->processCallerRegisteredEntitlements(
-                *identity->entitlements().asDict(), identity->bundleIdentifier(), commandQueue.get());
-            if (result != TarnSuccess)
-                TarnLog(kLogError, "checkEntitlementsAndInitClientObject",
-                        "Error processing entitlements for %@ : %llu", identity->bundleIdentifier(),
-                        result);
-        }
-        if (gate.admitted) {
-            connection = TarnClientConnection::initWithClientIdentity(
-                identity, gate.entitled, gate.allowOtherIdLookup, gate.unrestricted, gate.lookup,
-                gate.wipeList, commandQueue);
-        } else {
-            TarnLog(kLogError, "checkEntitlementsAndInitClientObject",
-                    "connection attempt from pid %d (%@) is not entitled",
-                    identity ? identity->posixPID() : peer->pid(),
-                    identity ? identity->bundleIdentifier() : std::string("(null)"));
-            error = TarnErrorNotEntitled;
-        }
-        if (connection) {
-            tCurrentReply = &reply;
-            // The queue runs even after a handler that threw: what was queued
-            // before (staged deletions, say) was asked for by this request.
-            guardOperation(&error, [&] { row->handler(request, reply->body(), connection.get(), &error); });
-            guardOperation(&error, [&] { connection->completeWithError(&error); });
-            tCurrentReply = nullptr;
-        }
-        PersonaRoster::setCurrentPersonaUniqueString(std::nullopt);
+    const TarnCommandTableRow* row = commandTableRow(command, &error);
+    if (row) {
+        TarnRequestContext context;
+        context.commandQueue = std::make_shared<TarnCommandQueue>();
+        if (!row->replyOnReturn)
+            context.deferredReply = std::make_shared<ConduitDeferredReply>(reply);
+        connection = admitClient(peer, *row, context, reuse, &error);
+        if (connection) runCommand(*row, context, request, reply->body(), *connection, &error);
     }
 
     // "<unknown>" means no connection was made; a connection without a bundle

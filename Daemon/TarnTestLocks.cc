@@ -157,8 +157,9 @@ std::bitset<TarnTestLocks::kLockCount> gHeldTestLocks GUARDED_BY(gTestLockComman
 
 }  // namespace
 
-void TarnHandleTestLockCommand(const PlistValue& request, PlistValue& reply,
-                               TarnClientConnection* connection, uint64_t* error) {
+void TarnHandleTestLockCommand(const TarnRequestContext& context, const PlistValue& request,
+                               PlistValue& reply, TarnClientConnection* connection,
+                               uint64_t* error) {
     if (!HostConfiguration::shared().internalBuild) {
         TarnLog(kLogError, "setTestLock", "Unsupported call to set lock!");
         return;

@@ -29,6 +29,7 @@
 #include <memory>
 #include <semaphore>
 
+#include "Daemon/TarnRequestContext.h"
 #include "Platform/Dispatch.h"
 #include "Platform/PropertyList.h"
 
@@ -82,7 +83,8 @@ class TarnTestLocks {
 
 // Command 31: take or release one test lock ("TestLock", "Enable"); internal
 // builds only. Keeps the process-wide set of locks held through this command.
-void TarnHandleTestLockCommand(const PlistValue& request, PlistValue& reply,
-                               TarnClientConnection* connection, uint64_t* error);
+void TarnHandleTestLockCommand(const TarnRequestContext& context, const PlistValue& request,
+                               PlistValue& reply, TarnClientConnection* connection,
+                               uint64_t* error);
 
 }  // namespace tarn

@@ -360,14 +360,15 @@ TarnUserIdentityRef TarnUserIdentityCache::lock_userIdentityForUnspecificPersona
 
 // ---- Public answers ----
 
-TarnUserIdentityRef TarnUserIdentityCache::userIdentityForCurrentContext() {
+TarnUserIdentityRef TarnUserIdentityCache::userIdentityForCurrentContext(
+    const std::optional<std::string>& personaUniqueString) {
     uint32_t uid = 0, gid = 0;
     mobileIds(&uid, &gid);
-    return userIdentityForCurrentContextWithUID(uid, gid);
+    return userIdentityForCurrentContextWithUID(uid, gid, personaUniqueString);
 }
 
-TarnUserIdentityRef TarnUserIdentityCache::userIdentityForCurrentContextWithUID(uint32_t uid,
-                                                                                uint32_t GID) {
+TarnUserIdentityRef TarnUserIdentityCache::userIdentityForCurrentContextWithUID(
+    uint32_t uid, uint32_t GID, const std::optional<std::string>& personaUniqueString) {
     if (uid < kFirstNonRoleUID) mobileIds(&uid, &GID);
     TarnUserIdentityRef result;
     if (!personasAreSupported()) {
@@ -376,7 +377,7 @@ TarnUserIdentityRef TarnUserIdentityCache::userIdentityForCurrentContextWithUID(
                     uid, GID, result);
         return result;
     }
-    PersonaAttributesRef persona = roster_.currentPersona();
+    PersonaAttributesRef persona = roster_.currentPersona(personaUniqueString);
     std::optional<std::string> unique = persona ? persona->userPersonaUniqueString() : std::nullopt;
     if (persona && persona->isPersonalPersona()) {
         result = userIdentityForPersonalPersonaWithUID(uid, GID);

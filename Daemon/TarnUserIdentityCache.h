@@ -38,14 +38,14 @@ class TarnUserIdentityCache;
 struct HostConfiguration;
 
 class TarnUserIdentityCacheObserver {
-public:
+  public:
     virtual ~TarnUserIdentityCacheObserver() = default;
     virtual void userIdentityCache(TarnUserIdentityCache& cache,
                                    const TarnUserIdentityRef& didInvalidateUserIdentity) = 0;
 };
 
 class TarnUserIdentityCache {
-public:
+  public:
     // Registers with `roster` for list updates; the roster must outlive the cache.
     explicit TarnUserIdentityCache(PersonaRoster& roster);
     virtual ~TarnUserIdentityCache();
@@ -68,8 +68,13 @@ public:
     static bool computePersonasAreSupported(const HostConfiguration& host);
     static void TEST_setPersonasAreSupported(std::optional<bool> supported);
 
-    TarnUserIdentityRef userIdentityForCurrentContext();
-    TarnUserIdentityRef userIdentityForCurrentContextWithUID(uint32_t uid, uint32_t GID);
+    // The identity a request acts for: its persona (`personaUniqueString`,
+    // the peer's; empty for none) on the mobile user, or on `uid` unless that
+    // is a role account.
+    TarnUserIdentityRef userIdentityForCurrentContext(
+        const std::optional<std::string>& personaUniqueString);
+    TarnUserIdentityRef userIdentityForCurrentContextWithUID(
+        uint32_t uid, uint32_t GID, const std::optional<std::string>& personaUniqueString);
     TarnUserIdentityRef userIdentityForPersonalPersona();
     TarnUserIdentityRef userIdentityForPersonalPersonaWithUID(uint32_t uid, uint32_t GID);
     TarnUserIdentityRef unspecificUserIdentity();
@@ -110,11 +115,10 @@ public:
 
     // Identities from persona attributes (nullptr attributes: the user id as
     // persona id and the user's home).
-    static TarnUserIdentityRef userIdentityWithPersonaAttributes(const PersonaAttributes* attributes,
-                                                                 bool forceUnspecific = false);
-    static TarnUserIdentityRef userIdentityWithPersonaAttributes(const PersonaAttributes* attributes,
-                                                                 uint32_t UID, uint32_t GID,
-                                                                 bool forceUnspecific);
+    static TarnUserIdentityRef userIdentityWithPersonaAttributes(
+        const PersonaAttributes* attributes, bool forceUnspecific = false);
+    static TarnUserIdentityRef userIdentityWithPersonaAttributes(
+        const PersonaAttributes* attributes, uint32_t UID, uint32_t GID, bool forceUnspecific);
     static TarnUserIdentityRef _updateUserIdentity(const TarnUserIdentityRef& userIdentity,
                                                    uint32_t withUID, uint32_t GID);
 
@@ -126,7 +130,7 @@ public:
     // Waits until flushes queued so far have run.
     void TEST_drainFlushQueue();
 
-private:
+  private:
     class RosterTrampoline;
 
     void _lock_resync() REQUIRES(lock_);
@@ -167,7 +171,7 @@ private:
 // The process-wide cache over PersonaRoster::sharedManager(). Made once per
 // root prefix (tests change it); earlier instances stay alive.
 class TarnUserIdentitySharedCache : public TarnUserIdentityCache {
-public:
+  public:
     static TarnUserIdentitySharedCache& sharedInstance();
     explicit TarnUserIdentitySharedCache(PersonaRoster& roster) : TarnUserIdentityCache(roster) {}
 };

@@ -21,8 +21,6 @@ constexpr const char* kListFile = "/etc/tarnkeeper/personas.plist";
 constexpr size_t kMaxListBytes = 1024 * 1024;
 constexpr size_t kMaxPersonas = 4096;
 
-thread_local std::optional<std::string> tCurrentPersonaUniqueString;
-
 PersonaAttributes::Kind kindForType(const std::string& type) {
     if (type == "personal") return PersonaAttributes::Kind::Personal;
     if (type == "enterprise") return PersonaAttributes::Kind::Enterprise;
@@ -119,8 +117,7 @@ PersonaAttributesRef PersonaRoster::personaInfoForPersonaID(uint32_t personaID) 
     return nullptr;
 }
 
-PersonaAttributesRef PersonaRoster::currentPersona() {
-    const auto& unique = currentPersonaUniqueString();
+PersonaAttributesRef PersonaRoster::currentPersona(const std::optional<std::string>& unique) {
     if (!unique) return nullptr;
     auto list = listAllPersonaWithAttributes();
     if (!list) return nullptr;
@@ -143,14 +140,6 @@ void PersonaRoster::registerPersonaListUpdateObserver(
         completionHandler(ok ? std::nullopt
                              : std::optional<std::string>(Format("%@: %@", withService, why)));
     }
-}
-
-void PersonaRoster::setCurrentPersonaUniqueString(std::optional<std::string> uniqueString) {
-    tCurrentPersonaUniqueString = std::move(uniqueString);
-}
-
-const std::optional<std::string>& PersonaRoster::currentPersonaUniqueString() {
-    return tCurrentPersonaUniqueString;
 }
 
 void PersonaRoster::notifyObservers() {

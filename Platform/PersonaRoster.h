@@ -87,19 +87,16 @@ public:
     virtual std::optional<PersonaAttributesList> listAllPersonaWithAttributes() = 0;
     // Kernel persona information by persona id; nullptr when unknown.
     virtual PersonaAttributesRef personaInfoForPersonaID(uint32_t personaID);
-    // The persona the calling thread acts for: the list entry whose unique
-    // string is the thread's current one; nullptr when none is set or known.
-    virtual PersonaAttributesRef currentPersona();
+    // The persona a request acts for: the list entry whose unique string is
+    // the request's (the peer's, see TarnRequestContext); nullptr when the
+    // request names none or the list does not know it.
+    virtual PersonaAttributesRef currentPersona(const std::optional<std::string>& uniqueString);
 
     // Observers are held weakly. The completion handler runs before this
     // returns, with an error text when watching could not start.
     virtual void registerPersonaListUpdateObserver(
         std::weak_ptr<PersonaListUpdateObserver> observer, const std::string& withService,
         const std::function<void(const std::optional<std::string>& error)>& completionHandler);
-
-    // Thread-local; set by the request processor around one request.
-    static void setCurrentPersonaUniqueString(std::optional<std::string> uniqueString);
-    static const std::optional<std::string>& currentPersonaUniqueString();
 
 protected:
     // Calls personaListDidUpdate() on every live observer.

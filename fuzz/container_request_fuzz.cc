@@ -72,7 +72,7 @@ void checkConnection(const PlistValue& request, TarnClientConnection& connection
         connection.clientIdentity(), true, true, true, std::nullopt, std::nullopt, queued);
     PlistValue reply{PlistDict{}};
     error = TarnSuccess;
-    TarnHandleStageForDeleteCommand(request, reply, fresh.get(), &error);
+    TarnHandleStageForDeleteCommand({}, request, reply, fresh.get(), &error);
     // A refused request queues nothing.
     if ((error == TarnErrorBadInput || error == TarnErrorPersonaMismatch) &&
         queued->TEST_count() != 0)

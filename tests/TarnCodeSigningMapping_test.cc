@@ -243,7 +243,7 @@ TEST_F(TarnCodeSigningMappingTest, GetCodeSigningInfoCommand) {
     for (const Case& c : cases) {
         PlistValue reply{PlistDict{}};
         uint64_t error = TarnSuccess;
-        TarnHandleGetCodeSigningInfoCommand(c.request, reply, nullptr, &error);
+        TarnHandleGetCodeSigningInfoCommand({}, c.request, reply, nullptr, &error);
         EXPECT_EQ(error, c.code) << c.request.description();
         if (c.code == TarnSuccess) {
             ASSERT_TRUE(reply.find("ReplyInfoDictionary"));

@@ -279,7 +279,7 @@ TEST_F(ContainerCommandsDecodingTest, DeathRowCommandRunsQueuedWorkFirst) {
         nullptr, true, true, true, std::nullopt, std::nullopt, queue);
     PlistValue reply{PlistDict{}};
     uint64_t error = TarnSuccess;
-    TarnHandleDeleteDeathRowCommand(PlistValue(PlistDict{}), reply, connection.get(), &error);
+    TarnHandleDeleteDeathRowCommand({}, PlistValue(PlistDict{}), reply, connection.get(), &error);
     EXPECT_EQ(error, TarnErrorCacheRemoveFailed);
     // What followed the failure never runs, not even in the processor's own
     // run after the handler.

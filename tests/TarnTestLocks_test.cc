@@ -130,7 +130,7 @@ class TarnTestLockCommandTest : public ::testing::Test {
             PlistDict{{"Command", uint64_t{31}}, {"TestLock", lock}, {"Enable", enable}});
         PlistValue reply;
         uint64_t error = TarnSuccess;
-        TarnHandleTestLockCommand(request, reply, nullptr, &error);
+        TarnHandleTestLockCommand({}, request, reply, nullptr, &error);
         return error;
     }
 

@@ -251,7 +251,7 @@ TEST_F(TarnUserIdentityCacheTest, WithoutPersonaSupportTheRosterIsNeverAsked) {
     TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
     roster_.setList(std::nullopt);
     auto cache = makeCache();
-    auto p = cache->userIdentityForCurrentContextWithUID(0, 0);
+    auto p = cache->userIdentityForCurrentContextWithUID(0, 0, std::nullopt);
     ASSERT_TRUE(p);
     EXPECT_EQ(p->posixUID(), 501u) << "role users act for the mobile user";
     EXPECT_TRUE(cache->isBundleIdentifier("com.x", p));
@@ -321,14 +321,12 @@ TEST_F(TarnUserIdentityCacheTest, ChoosesTheIdentityOfTheRequest) {
         {"unknown", 501, "501", TarnPersonaTypeUnspecific, 501},
     };
     for (const auto& c : cases) {
-        PersonaRoster::setCurrentPersonaUniqueString(c.current);
-        auto u = cache->userIdentityForCurrentContextWithUID(c.uid, c.uid);
+        auto u = cache->userIdentityForCurrentContextWithUID(c.uid, c.uid, c.current);
         ASSERT_TRUE(u) << c.current.value_or("none");
         EXPECT_EQ(u->identifier(), c.identifier) << c.current.value_or("none");
         EXPECT_EQ(u->personaType(), c.type) << c.current.value_or("none");
         EXPECT_EQ(u->posixUID(), c.expectedUID) << c.current.value_or("none");
     }
-    PersonaRoster::setCurrentPersonaUniqueString(std::nullopt);
 
     // Adjusting keeps an enterprise home and moves other homes to the new user.
     auto e = cache->userIdentityForPersonaUniqueString("E-1", 700, 700);
