@@ -7,6 +7,7 @@
 #include <map>
 #include <set>
 
+#include "Daemon/TarnError.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Tools/tarnctl/Json.h"
 #include "support/DaemonHarness.h"
@@ -95,16 +96,18 @@ TEST_F(ContainerCommandsTest, CreateLookUpAndRefuseBadIdentities) {
     // Looking up a missing container without creating it leaves nothing behind.
     EXPECT_EQ(
         errorOf(send(admin_, R"({"Command": 0, "ContainerClass": 2, "Identifier": "com.a"})")),
-        21u);
+        TarnErrorNotFound);
     const std::string createA =
         R"({"Command": 0, "CreateIfNecessary": true, "Identifier": "com.a")";
-    EXPECT_EQ(errorOf(send(admin_, createA + R"(, "ContainerClass": 0})")), 20u);
-    EXPECT_EQ(errorOf(send(admin_, createA + R"(, "ContainerClass": 14})")), 20u);
+    EXPECT_EQ(errorOf(send(admin_, createA + R"(, "ContainerClass": 0})")),
+              TarnErrorInvalidContainerClass);
+    EXPECT_EQ(errorOf(send(admin_, createA + R"(, "ContainerClass": 14})")),
+              TarnErrorInvalidContainerClass);
     const std::string live = root_.at("/private/var/mobile/Containers/Data/Application");
     EXPECT_TRUE(!fs::exists(live) || fs::is_empty(live));
 
     PlistValue made = create("com.a");
-    ASSERT_EQ(errorOf(made), 1u);
+    ASSERT_EQ(errorOf(made), TarnSuccess);
     const std::string path = stringOf(made, "ReplyPath");
     EXPECT_TRUE(fs::is_directory(path)) << path;
     EXPECT_EQ(made.find("ReplyExisted")->asBool(), false);
@@ -121,10 +124,10 @@ TEST_F(ContainerCommandsTest, CreateLookUpAndRefuseBadIdentities) {
     // container, and nobody else's.
     PlistValue own =
         send(guest, R"({"Command": 0, "ContainerClass": 2, "CreateIfNecessary": true})");
-    EXPECT_EQ(errorOf(own), 1u);
+    EXPECT_EQ(errorOf(own), TarnSuccess);
     EXPECT_EQ(stringOf(own, "ReplyIdentifier"), "com.ostrea.test.guest");
     EXPECT_EQ(errorOf(send(guest, R"({"Command": 0, "ContainerClass": 2, "Identifier": "com.a"})")),
-              55u);
+              TarnErrorNotEntitled);
 }
 
 TEST_F(ContainerCommandsTest, ConcurrentCreationsMakeOneContainerAndTransientsAreAlwaysNew) {
@@ -141,8 +144,8 @@ TEST_F(ContainerCommandsTest, ConcurrentCreationsMakeOneContainerAndTransientsAr
     auto first = std::async(std::launch::async, run, admin_);
     auto second = std::async(std::launch::async, run, other);
     PlistValue a = first.get(), b = second.get();
-    ASSERT_EQ(errorOf(a), 1u);
-    ASSERT_EQ(errorOf(b), 1u);
+    ASSERT_EQ(errorOf(a), TarnSuccess);
+    ASSERT_EQ(errorOf(b), TarnSuccess);
     EXPECT_EQ(uuidOf(a), uuidOf(b));
     EXPECT_EQ(stringOf(a, "ReplyPath"), stringOf(b, "ReplyPath"));
     std::multiset<bool> existed = {*a.find("ReplyExisted")->asBool(),
@@ -152,7 +155,7 @@ TEST_F(ContainerCommandsTest, ConcurrentCreationsMakeOneContainerAndTransientsAr
     std::set<std::string> paths, uuids;
     for (int i = 0; i < 3; ++i) {
         PlistValue t = create("com.transient", /*transient=*/true);
-        ASSERT_EQ(errorOf(t), 1u);
+        ASSERT_EQ(errorOf(t), TarnSuccess);
         paths.insert(stringOf(t, "ReplyPath"));
         uuids.insert(uuidOf(t));
     }
@@ -165,12 +168,12 @@ TEST_F(ContainerCommandsTest, ListDeleteAndEmptyDeathRow) {
     std::map<std::string, std::string> made;  // identifier -> UUID
     for (const char* id : {"com.list.one", "com.list.two"}) {
         PlistValue r = create(id);
-        ASSERT_EQ(errorOf(r), 1u);
+        ASSERT_EQ(errorOf(r), TarnSuccess);
         made[id] = uuidOf(r);
     }
 
     PlistValue list = send(admin_, R"({"Command": 1, "ContainerClass": 2})");
-    ASSERT_EQ(errorOf(list), 1u);
+    ASSERT_EQ(errorOf(list), TarnSuccess);
     const PlistArray* ids = list.find("ReplyIdsArray")->asArray();
     const PlistArray* uuids = list.find("ReplyUUIDsArray")->asArray();
     const PlistArray* personas = list.find("ReplyPersonaUniqueStringsArray")->asArray();
@@ -181,27 +184,29 @@ TEST_F(ContainerCommandsTest, ListDeleteAndEmptyDeathRow) {
     for (size_t i = 0; i < ids->size(); ++i)
         listed[*(*ids)[i].asString()] = (*uuids)[i].asUuid()->string();
     for (const auto& [id, uuid] : made) EXPECT_EQ(listed[id], uuid) << id;
-    EXPECT_EQ(errorOf(send(admin_, R"({"Command": 1, "ContainerClass": 99})")), 11u);
+    EXPECT_EQ(errorOf(send(admin_, R"({"Command": 1, "ContainerClass": 99})")),
+              TarnErrorInvalidArgument);
 
     // Deletion moves the container to death row; command 4 empties it and
     // answers from the pass's completion.
     const std::string path = stringOf(create("com.list.one"), "ReplyPath");
-    EXPECT_EQ(errorOf(send(admin_, R"({"Command": 10, "ContainerClass": 2})")), 18u)
+    EXPECT_EQ(errorOf(send(admin_, R"({"Command": 10, "ContainerClass": 2})")),
+              TarnErrorMissingIdentifier)
         << "deletion never defaults to the caller's own container";
     ASSERT_EQ(errorOf(send(
                   admin_, R"({"Command": 10, "ContainerClass": 2, "Identifier": "com.list.one"})")),
-              1u);
+              TarnSuccess);
     EXPECT_FALSE(fs::exists(path));
     EXPECT_EQ(errorOf(send(admin_,
                            R"({"Command": 0, "ContainerClass": 2, "Identifier": "com.list.one"})")),
-              21u);
+              TarnErrorNotFound);
     EXPECT_GE(deathRowCount(), 1u);
     EXPECT_EQ(errorOf(send(
                   admin_, R"({"Command": 10, "ContainerClass": 2, "Identifier": "com.list.one"})")),
-              21u);
+              TarnErrorNotFound);
 
     PlistValue emptied = send(admin_, R"({"Command": 4})");
-    EXPECT_EQ(errorOf(emptied), 1u);
+    EXPECT_EQ(errorOf(emptied), TarnSuccess);
     EXPECT_EQ(deathRowCount(), 0u);
 }
 
@@ -209,7 +214,7 @@ TEST_F(ContainerCommandsTest, StageForDeleteIsAllOrNothingOnBadInput) {
     enablePersonas();
     daemon_->start();
     PlistValue made = create("com.stage");
-    ASSERT_EQ(errorOf(made), 1u);
+    ASSERT_EQ(errorOf(made), TarnSuccess);
     const std::string path = stringOf(made, "ReplyPath");
     const std::string uuid = uuidOf(made);
     auto stage = [&](const std::string& classes, const std::string& uuids, const std::string& ids,
@@ -241,24 +246,24 @@ TEST_F(ContainerCommandsTest, StageForDeleteIsAllOrNothingOnBadInput) {
 TEST_F(ContainerCommandsTest, MetadataReturnsInfoOnlyWhenAsked) {
     daemon_->start();
     PlistValue made = create("com.meta");
-    ASSERT_EQ(errorOf(made), 1u);
+    ASSERT_EQ(errorOf(made), TarnSuccess);
     const std::string concrete =
         R"("Identifier": "com.meta", "ContainerClass": 2, "UUID": {"$uuid": ")" + uuidOf(made) +
         R"("})";
     ASSERT_EQ(errorOf(send(
                   admin_, R"({"Command": 5, "Key": "Colour", "Value": "teal", )" + concrete + "}")),
-              1u);
+              TarnSuccess);
 
     PlistValue plain =
         send(admin_, R"({"Command": 7, "InfoDictRequested": false, )" + concrete + "}");
-    ASSERT_EQ(errorOf(plain), 1u);
+    ASSERT_EQ(errorOf(plain), TarnSuccess);
     EXPECT_EQ(stringOf(plain, "ReplyPath"), stringOf(made, "ReplyPath"));
     EXPECT_EQ(plain.find("ReplyTransient")->asBool(), false);
     EXPECT_FALSE(plain.find("ReplyInfoDictionary"));
 
     PlistValue withInfo =
         send(admin_, R"({"Command": 7, "InfoDictRequested": true, )" + concrete + "}");
-    ASSERT_EQ(errorOf(withInfo), 1u);
+    ASSERT_EQ(errorOf(withInfo), TarnSuccess);
     ASSERT_TRUE(withInfo.find("ReplyInfoDictionary"));
     EXPECT_EQ(stringOf(*withInfo.find("ReplyInfoDictionary"), "Colour"), "teal");
 }
@@ -274,12 +279,12 @@ TEST_F(ContainerCommandsTest, SandboxTokensOnlyForEnterpriseContainers) {
 
     const std::string own = R"({"Command": 0, "ContainerClass": 2, "CreateIfNecessary": true})";
     PlistValue p = send(personal, own);
-    ASSERT_EQ(errorOf(p), 1u);
+    ASSERT_EQ(errorOf(p), TarnSuccess);
     EXPECT_FALSE(p.find("ReplySandboxToken")) << "a personal container is in the common sandbox";
     EXPECT_EQ(stringOf(p, "ReplyPersonaUniqueString"), kPersonal);
 
     PlistValue e = send(enterprise, own);
-    ASSERT_EQ(errorOf(e), 1u);
+    ASSERT_EQ(errorOf(e), TarnSuccess);
     EXPECT_EQ(stringOf(e, "ReplyPersonaUniqueString"), kEnterprise);
     const std::string token = stringOf(e, "ReplySandboxToken");
     EXPECT_EQ(token.rfind("1;com.ostrea.sandbox.container;", 0), 0u) << token;

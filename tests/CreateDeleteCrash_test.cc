@@ -13,6 +13,7 @@
 #include <random>
 #include <thread>
 
+#include "Daemon/TarnError.h"
 #include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/Failpoints.h"
@@ -132,13 +133,13 @@ class CreateDeleteCrashTest : public test::ScratchRootTest {
             if (errorOf(found) == 44u) found = send(containerRequest(id, false, false));
             auto it = live.find(id);
             if (it == live.end()) {
-                EXPECT_EQ(errorOf(found), 21u) << id;
+                EXPECT_EQ(errorOf(found), TarnErrorNotFound) << id;
             } else {
-                EXPECT_EQ(errorOf(found), 1u) << id;
+                EXPECT_EQ(errorOf(found), TarnSuccess) << id;
                 EXPECT_EQ(pathOf(found), it->second) << id;
             }
             auto made = send(containerRequest(id, true, false));
-            EXPECT_EQ(errorOf(made), 1u) << id;
+            EXPECT_EQ(errorOf(made), TarnSuccess) << id;
             EXPECT_TRUE(fs::is_directory(pathOf(made))) << id;
         }
     }

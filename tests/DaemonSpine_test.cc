@@ -11,6 +11,7 @@
 #include <optional>
 #include <thread>
 
+#include "Daemon/TarnError.h"
 #include "Platform/Conduit.h"
 #include "Platform/ConduitHarness.h"
 #include "support/DaemonHarness.h"
@@ -69,11 +70,11 @@ protected:
 
 TEST_F(DaemonSpineTest, CommandTableAndGateOverIpc) {
     daemon_->start();
-    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 27})"), 49u);
-    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 33})"), 49u);
-    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 4000000000})"), 49u);
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 27})"), TarnErrorInvalidCommand);
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 33})"), TarnErrorInvalidCommand);
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 4000000000})"), TarnErrorInvalidCommand);
     // The unentitled client is refused before the handler of 27 could answer.
-    EXPECT_EQ(daemon_->sendError(guest_, R"({"Command": 27})"), 55u);
+    EXPECT_EQ(daemon_->sendError(guest_, R"({"Command": 27})"), TarnErrorNotEntitled);
     // A request without "Command" is command 0.
     auto reply = daemon_->send(admin_, R"({"Identifier": "x"})");
     ASSERT_TRUE(reply) << daemon_->lastResult().err;
@@ -82,9 +83,10 @@ TEST_F(DaemonSpineTest, CommandTableAndGateOverIpc) {
     EXPECT_GE(count("command=27, client=<unknown>, error=55"), 1u);
     EXPECT_GE(count("command=27, client=com.ostrea.test.admin, error=49"), 1u);
     // A creation is marked in the log without its private attributes.
-    EXPECT_EQ(daemon_->sendError(
-                  admin_, R"({"Identifier": "com.x", "ContainerClass": 2, "CreateIfNecessary": true})"),
-              1u);
+    EXPECT_EQ(
+        daemon_->sendError(
+            admin_, R"({"Identifier": "com.x", "ContainerClass": 2, "CreateIfNecessary": true})"),
+        TarnSuccess);
     EXPECT_EQ(count("signpost event CreatingContainer uuid=<private> identifier=<private> class=2"), 1u);
     EXPECT_EQ(count("identifier=com.x"), 0u);
 }
@@ -99,7 +101,7 @@ TEST_F(DaemonSpineTest, AnUnregisteredCallerIsLoggedAsNil) {
     request.set("Identifier", "com.ostrea.test.nobody");
     request.set("ContainerClass", uint64_t{2});
     ASSERT_TRUE(sendOn(*client, request));
-    EXPECT_EQ(count("command=0, client=(null), error="), 1u);
+    EXPECT_EQ(count("command=0, client=(null), error="), TarnSuccess);
 }
 
 // A registration without usable entitlements is reported by every request,
@@ -159,7 +161,7 @@ TEST_F(DaemonSpineTest, GarbageOnTheSocketOnlyDropsThatPeer) {
         EXPECT_LE(::read(fd, buf, sizeof buf), 0);
         ::close(fd);
     }
-    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 27})"), 49u);
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 27})"), TarnErrorInvalidCommand);
 }
 
 TEST_F(DaemonSpineTest, FirstBootWorkRunsOncePerBoot) {
@@ -169,7 +171,7 @@ TEST_F(DaemonSpineTest, FirstBootWorkRunsOncePerBoot) {
     EXPECT_EQ(daemon_->stop(), 0);
     EXPECT_EQ(count("tarnkeeperd performing first boot initialization"), 1u);
     daemon_->start();
-    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 27})"), 49u)
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 27})"), TarnErrorInvalidCommand)
         << daemon_->lastResult().err;
     EXPECT_EQ(daemon_->stop(), 0);
     EXPECT_EQ(count("tarnkeeperd performing first boot initialization"), 1u);
@@ -210,7 +212,7 @@ TEST_F(DaemonSpineTest, LockStateCommandsDriveTheDaemon) {
     EXPECT_EQ(daemon_->tarnctl(admin_, {"lock"}).exitCode, 0);
     EXPECT_EQ(daemon_->tarnctl(admin_, {"unlock"}).exitCode, 0);
     // The daemon is still serving after the suspend/resume round.
-    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 27})"), 49u);
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 27})"), TarnErrorInvalidCommand);
     auto r = daemon_->tarnctl(admin_, {"wait-notification", "com.ostrea.never", "--timeout", "0.2"});
     EXPECT_NE(r.exitCode, 0);
 }
@@ -237,9 +239,12 @@ protected:
 
 TEST_F(DaemonCommandsTest, TestLocksNeedTestabilityEvenWithAllowed) {
     daemon_->start();
-    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 7, "Enable": true})"), 38u);
-    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 7, "Enable": false})"), 1u);
-    EXPECT_EQ(daemon_->sendError(allowed_, R"({"Command": 31, "TestLock": 7, "Enable": false})"), 55u);
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 7, "Enable": true})"),
+              TarnErrorBadInput);
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 7, "Enable": false})"),
+              TarnSuccess);
+    EXPECT_EQ(daemon_->sendError(allowed_, R"({"Command": 31, "TestLock": 7, "Enable": false})"),
+              TarnErrorNotEntitled);
 }
 
 TEST_F(DaemonCommandsTest, TestLocksAreInertOnCustomerBuilds) {
@@ -247,12 +252,14 @@ TEST_F(DaemonCommandsTest, TestLocksAreInertOnCustomerBuilds) {
     host.set("InternalBuild", false);
     daemon_->writeHostConfig(host);
     daemon_->start();
-    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 7, "Enable": true})"), 1u);
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 7, "Enable": true})"),
+              TarnSuccess);
 }
 
 TEST_F(DaemonCommandsTest, CodeSigningInfoIsNotFoundForAnUnknownIdentifier) {
     daemon_->start();
-    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 19, "Identifier": "com.ostrea.none"})"), 21u);
+    EXPECT_EQ(daemon_->sendError(admin_, R"({"Command": 19, "Identifier": "com.ostrea.none"})"),
+              TarnErrorNotFound);
     EXPECT_TRUE(std::filesystem::exists(
         root_.at("/private/var/root/Library/TarnKeeper/containers.sqlite3")));
 }
