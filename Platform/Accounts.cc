@@ -4,6 +4,7 @@
 #include <pwd.h>
 #include <unistd.h>
 
+#include <charconv>
 #include <fstream>
 #include <sstream>
 #include <vector>
@@ -23,6 +24,15 @@ std::vector<std::string> splitColon(const std::string& line) {
     return out;
 }
 
+// A numeric id field: plain decimal digits that fit, nothing else (no sign,
+// no blanks), so that "-1" is not read as the largest id.
+template <class Id>
+bool parseId(const std::string& field, Id* id) {
+    const char* end = field.data() + field.size();
+    auto [at, ec] = std::from_chars(field.data(), end, *id);
+    return !field.empty() && ec == std::errc() && at == end;
+}
+
 template <class Match>
 std::optional<AccountUser> scanPasswd(Match match) {
     std::ifstream in(RootPath("/etc/passwd"));
@@ -32,12 +42,8 @@ std::optional<AccountUser> scanPasswd(Match match) {
         if (f.size() < 6) continue;
         AccountUser u;
         u.name = f[0];
-        try {
-            u.uid = static_cast<uid_t>(std::stoul(f[2]));
-            u.gid = static_cast<gid_t>(std::stoul(f[3]));
-        } catch (...) {
-            continue;  // a malformed line is skipped, as libc does
-        }
+        // A malformed line is skipped, as libc does.
+        if (!parseId(f[2], &u.uid) || !parseId(f[3], &u.gid)) continue;
         u.home = f[5];
         if (match(u)) return u;
     }
@@ -74,11 +80,8 @@ std::optional<AccountGroup> AccountGroupByName(const std::string& name) {
         while (std::getline(in, line)) {
             auto f = splitColon(line);
             if (f.size() < 3 || f[0] != name) continue;
-            try {
-                return AccountGroup{f[0], static_cast<gid_t>(std::stoul(f[2]))};
-            } catch (...) {
-                continue;
-            }
+            gid_t gid = 0;
+            if (parseId(f[2], &gid)) return AccountGroup{f[0], gid};
         }
         return std::nullopt;
     }

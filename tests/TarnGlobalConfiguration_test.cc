@@ -111,6 +111,18 @@ TEST_F(TarnGlobalConfigurationTest, MobileAccountAndHomes) {
         EXPECT_EQ(config.currentMobileUserId(), 501u);
         EXPECT_EQ(config.currentMobileGroupId(), 501u);
     }
+    // Malformed id fields are skipped line by line, and a negative one is not
+    // read as the largest id.
+    root_.writeFile("/etc/passwd",
+                    "mobile:x:-1:501:m:/private/var/mobile:/bin/sh\n"
+                    "mobile:x:5 01:501:m:/private/var/mobile:/bin/sh\n"
+                    "mobile:x:99999999999:501:m:/private/var/mobile:/bin/sh\n"
+                    "mobile:x:777:778:m:/private/var/mobile:/bin/sh\n");
+    {
+        TarnGlobalConfiguration config;
+        EXPECT_EQ(config.currentMobileUserId(), 777u);
+        EXPECT_EQ(config.currentMobileGroupId(), 778u);
+    }
     root_.writeFile("/etc/passwd", "root:x:0:0:root:/private/var/root:/bin/sh\n");
     TarnGlobalConfiguration config;
     EXPECT_EQ(config.currentMobileUserId(), 0u);
