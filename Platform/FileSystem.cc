@@ -123,6 +123,18 @@ int readNames(int dirFd, std::vector<std::pair<std::string, unsigned char>>* out
         dirFd, [out](const char* name, unsigned char type) { out->emplace_back(name, type); });
 }
 
+// The entry that reports a directory whose listing failed with `err`: it
+// stands one level above its children, at the directory itself.
+FsWalkEntry listingErrorEntry(int dirFd, const std::string& dirPath, int level, int err) {
+    FsWalkEntry e;
+    e.path = dirPath;
+    e.level = level - 1;
+    e.type = FsWalkType::Error;
+    e.error = err;
+    e.fd = dirFd;
+    return e;
+}
+
 int openDirAt(int dirFd, const std::string& name, FsFd* fd) {
     int f = noEintr([&] {
         return ::openat(dirFd, name.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC);
@@ -545,13 +557,7 @@ struct Walker {
     void children(int dirFd, const std::string& dirPath, int level) {
         std::vector<std::pair<std::string, unsigned char>> names;
         if (int err = readNames(dirFd, &names)) {
-            FsWalkEntry e;
-            e.path = dirPath;
-            e.level = level - 1;
-            e.type = FsWalkType::Error;
-            e.error = err;
-            e.fd = dirFd;
-            if (!visit(e)) stopped = true;
+            if (!visit(listingErrorEntry(dirFd, dirPath, level, err))) stopped = true;
             return;
         }
         for (auto& [name, dtype] : names) {
@@ -640,12 +646,7 @@ struct Remover {
     bool children(int dirFd, const std::string& dirPath, int level) {
         std::vector<std::pair<std::string, unsigned char>> names;
         if (int err = readNames(dirFd, &names)) {
-            FsWalkEntry e;
-            e.path = dirPath;
-            e.level = level - 1;
-            e.type = FsWalkType::Error;
-            e.fd = dirFd;
-            onError(e, err);
+            onError(listingErrorEntry(dirFd, dirPath, level, err), err);
             return false;
         }
         bool all = true;
