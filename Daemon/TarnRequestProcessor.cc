@@ -147,12 +147,12 @@ void TarnProcessConduitEvent(const std::shared_ptr<conduit::Connection>& peer,
         // nothing to register; the request itself still goes ahead.
         TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance();
         if (identity && gate.admitted && mapping) {
-            uint64_t result = mapping->processCallerRegisteredEntitlements(
+            TarnStatus registered = mapping->processCallerRegisteredEntitlements(
                 *identity->entitlements().asDict(), identity->bundleIdentifier(), commandQueue.get());
-            if (result != TarnSuccess)
+            if (!registered.ok())
                 TarnLog(kLogError, "checkEntitlementsAndInitClientObject",
                         "Error processing entitlements for %@ : %llu", identity->bundleIdentifier(),
-                        result);
+                        registered.code(TarnErrorDatabase));
         }
         if (gate.admitted) {
             connection = TarnClientConnection::initWithClientIdentity(

@@ -95,16 +95,13 @@ class TarnCommandStageForDeleteTest : public test::ScratchRootTest {
             PlistDict{{kTarnEntitlementsKey, PlistDict{}}}, 3);
         entry->setChildBundleIdentifiers(std::move(children));
         auto* mapping = TarnCodeSigningMapping::sharedInstance();
-        TarnErrorRef e;
-        bool ok = false;
+        TarnStatus added;
         mapping->queue()->sync(
-            [&] { ok = mapping->codeSigningMappingDB()->addCodeSigningEntry(entry, id, &e); });
-        ASSERT_TRUE(ok) << (e ? e->description() : "");
+            [&] { added = mapping->codeSigningMappingDB()->addCodeSigningEntry(entry, id); });
+        ASSERT_TRUE(added.ok()) << added.error()->description();
     }
     static bool stored(const std::string& id) {
-        TarnErrorRef e;
-        return TarnCodeSigningMapping::sharedInstance()->codeSigningEntryForIdentifier(id, &e) !=
-               nullptr;
+        return TarnCodeSigningMapping::sharedInstance()->codeSigningEntryForIdentifier(id).ok();
     }
 
     TarnClientConnection connection_;
