@@ -538,26 +538,23 @@ TarnStatus TarnCodeSigningMapping::processCallerRegisteredEntitlements(const Pli
 
 // ---- command 19 ----
 
+// What this handler throws is fenced by the request processor, as for every
+// other handler.
 void TarnHandleGetCodeSigningInfoCommand(const PlistValue& request, PlistValue& reply,
                                          TarnClientConnection* connection, uint64_t* error) {
-    try {
-        std::string identifier;
-        if (const PlistValue* value = request.find("Identifier")) {
-            if (const std::string* s = value->asString()) identifier = *s;
-        }
-        std::optional<PlistDict> info;
-        if (TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance()) {
-            info = mapping->getCodeSigningInfoForIdentifier(identifier);
-        }
-        if (!info) {
-            TarnSetError(error, TarnErrorNotFound);
-            return;
-        }
-        reply.set("ReplyInfoDictionary", std::move(*info));
-    } catch (const std::exception& ex) {
-        TarnErrorRef e = TARN_ERROR(TarnErrorException, nullptr, "Got exception: %@ : %@", ex.what(), "()");
-        TarnSetError(error, e->code());
+    std::string identifier;
+    if (const PlistValue* value = request.find("Identifier")) {
+        if (const std::string* s = value->asString()) identifier = *s;
     }
+    std::optional<PlistDict> info;
+    if (TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance()) {
+        info = mapping->getCodeSigningInfoForIdentifier(identifier);
+    }
+    if (!info) {
+        TarnSetError(error, TarnErrorNotFound);
+        return;
+    }
+    reply.set("ReplyInfoDictionary", std::move(*info));
 }
 
 }  // namespace tarn
