@@ -7,6 +7,7 @@
 #include <fstream>
 #include <future>
 
+#include "Daemon/TarnError.h"
 #include "Daemon/TarnFileManager.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnMetadata.h"
@@ -93,21 +94,24 @@ TEST_F(PerContainerCommandsTest, InfoValuesRoundTripAndAbsentValueRemovesTheKey)
 
     EXPECT_EQ(daemon_->sendError(
                   admin_, request(5, id, 1, app.uuid, R"(, "Key": "Colour", "Value": "red")")),
-              1u);
+              TarnSuccess);
     auto reply = daemon_->send(admin_, request(6, id, 1, app.uuid, R"(, "Key": "Colour")"));
-    ASSERT_EQ(replyError(reply), 1u) << daemon_->lastResult().err;
+    ASSERT_EQ(replyError(reply), TarnSuccess) << daemon_->lastResult().err;
     ASSERT_TRUE(reply->find("ReplyInfoValue"));
     EXPECT_EQ(*reply->find("ReplyInfoValue"), PlistValue("red"));
     EXPECT_EQ(infoValueOnDisk(app.url, "Colour"), PlistValue("red"));
 
     // No "Value": the key goes, in the daemon and in the file.
-    EXPECT_EQ(daemon_->sendError(admin_, request(5, id, 1, app.uuid, R"(, "Key": "Colour")")), 1u);
-    EXPECT_EQ(daemon_->sendError(admin_, request(6, id, 1, app.uuid, R"(, "Key": "Colour")")), 24u);
+    EXPECT_EQ(daemon_->sendError(admin_, request(5, id, 1, app.uuid, R"(, "Key": "Colour")")),
+              TarnSuccess);
+    EXPECT_EQ(daemon_->sendError(admin_, request(6, id, 1, app.uuid, R"(, "Key": "Colour")")),
+              TarnErrorInfoValueNotFound);
     EXPECT_FALSE(infoValueOnDisk(app.url, "Colour"));
 
-    EXPECT_EQ(daemon_->sendError(admin_, request(6, id, 1, app.uuid, R"(, "Key": 7)")), 38u);
+    EXPECT_EQ(daemon_->sendError(admin_, request(6, id, 1, app.uuid, R"(, "Key": 7)")),
+              TarnErrorBadInput);
     EXPECT_EQ(daemon_->sendError(admin_, request(6, id, 1, Uuid::generate(), R"(, "Key": "k")")),
-              21u);
+              TarnErrorNotFound);
     // The line is tagged with the operation that failed.
     const std::string log = daemon_->platformLog();
     EXPECT_NE(log.find("[infoValueForKey] "), std::string::npos);
@@ -120,7 +124,8 @@ TEST_F(PerContainerCommandsTest, DiskUsageIsHeldAtGateTwoAndRememberedForBundles
     std::ofstream(PathJoin(bundle.url, "App.bin")) << std::string(100 * 1024, 'a');
     daemon_->start();
 
-    ASSERT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 2, "Enable": true})"), 1u);
+    ASSERT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 2, "Enable": true})"),
+              TarnSuccess);
     // The tarnctl run of the background request is its own client connection.
     const std::string client = admin_;
     const std::string rootPath = root_.path();
@@ -132,15 +137,16 @@ TEST_F(PerContainerCommandsTest, DiskUsageIsHeldAtGateTwoAndRememberedForBundles
     // The same container can be written while its measurement waits.
     EXPECT_EQ(
         daemon_->sendError(admin_, request(5, id, 1, bundle.uuid, R"(, "Key": "k", "Value": "v")")),
-        1u);
+        TarnSuccess);
     EXPECT_EQ(measuring.wait_for(0ms), std::future_status::timeout);
-    ASSERT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 2, "Enable": false})"), 1u);
+    ASSERT_EQ(daemon_->sendError(admin_, R"({"Command": 31, "TestLock": 2, "Enable": false})"),
+              TarnSuccess);
 
     ASSERT_EQ(measuring.wait_for(20s), std::future_status::ready);
     test::ProcessResult result = measuring.get();
     std::string why;
     auto reply = tarnctl::JsonToPlist(result.out, &why);
-    ASSERT_EQ(replyError(reply), 1u) << result.err << why;
+    ASSERT_EQ(replyError(reply), TarnSuccess) << result.err << why;
     ASSERT_TRUE(reply->find("ReplyDiskUsage"));
     const uint64_t first = reply->find("ReplyDiskUsage")->asUInt64().value_or(0);
     EXPECT_GE(first, 100u * 1024);
@@ -148,7 +154,7 @@ TEST_F(PerContainerCommandsTest, DiskUsageIsHeldAtGateTwoAndRememberedForBundles
     // A bundle is measured once: growth behind the daemon's back is not seen.
     std::ofstream(PathJoin(bundle.url, "More.bin")) << std::string(300 * 1024, 'b');
     reply = daemon_->send(admin_, json);
-    ASSERT_EQ(replyError(reply), 1u);
+    ASSERT_EQ(replyError(reply), TarnSuccess);
     EXPECT_EQ(reply->find("ReplyDiskUsage")->asUInt64(), first);
     EXPECT_EQ(infoValueOnDisk(bundle.url, "StaticDiskUsage"), PlistValue(first));
 }
@@ -161,13 +167,15 @@ TEST_F(PerContainerCommandsTest, RegeneratingAWellKnownDirectoryIsRefused) {
     Container bundle = makeContainer(1, "com.ostrea.renamed");
     daemon_->start();
 
-    EXPECT_EQ(daemon_->sendError(admin_, request(9, id, 12, system.uuid)), 11u);
+    EXPECT_EQ(daemon_->sendError(admin_, request(9, id, 12, system.uuid)),
+              TarnErrorInvalidArgument);
     EXPECT_TRUE(fs::exists(PathJoin(system.url, kTarnMetadataFileName)));
 
-    EXPECT_EQ(daemon_->sendError(admin_, request(9, "com.ostrea.renamed", 1, bundle.uuid)), 1u);
+    EXPECT_EQ(daemon_->sendError(admin_, request(9, "com.ostrea.renamed", 1, bundle.uuid)),
+              TarnSuccess);
     EXPECT_FALSE(fs::exists(bundle.url));
     auto reply = daemon_->send(admin_, request(7, "com.ostrea.renamed", 1, bundle.uuid));
-    ASSERT_EQ(replyError(reply), 1u);
+    ASSERT_EQ(replyError(reply), TarnSuccess);
     ASSERT_TRUE(reply->find("ReplyPath") && reply->find("ReplyPath")->asString());
     const std::string moved = *reply->find("ReplyPath")->asString();
     EXPECT_EQ(PathParent(moved), PathParent(bundle.url));
