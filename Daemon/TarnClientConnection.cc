@@ -467,14 +467,15 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
     [&] {
         // The metadata's UUID is independent of the directory's name, so that
         // neither can be derived from the other.
-        uint64_t identityCode = TarnSuccess;
-        TarnConcreteContainerIdentityRef concrete =
-            TarnConcreteContainerIdentity::containerIdentityWithUUID(
-                Uuid::generate(), userIdentity, identifier, containerClass, &identityCode);
-        if (!concrete) {
-            failure = TARN_ERROR_CODE_IN(kCreateOrLookup, identityCode, nullptr);
+        TarnResult<TarnConcreteContainerIdentityRef> made =
+            TarnConcreteContainerIdentity::containerIdentityWithUUID(Uuid::generate(), userIdentity,
+                                                                     identifier, containerClass);
+        if (!made.ok()) {
+            failure =
+                TARN_ERROR_CODE_IN(kCreateOrLookup, made.code(TarnErrorInvalidArgument), nullptr);
             return;
         }
+        TarnConcreteContainerIdentityRef concrete = std::move(*made);
         metadata = TarnMetadata::initWithContainerIdentity(concrete, std::nullopt, stagingURL,
                                                            std::nullopt);
         metadata->setTransient(transient);

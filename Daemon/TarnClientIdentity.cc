@@ -5,6 +5,7 @@
 
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnLog.h"
+#include "Daemon/TarnResult.h"
 #include "Daemon/TarnUserIdentity.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/CodeSignRegistry.h"
@@ -95,14 +96,12 @@ std::shared_ptr<const CodeSignInfo> TarnClientIdentity::codeSignInfoForConnectio
     return exe ? CodeSignRegistry::shared().infoForExecutable(*exe) : nullptr;
 }
 
-std::optional<std::string> TarnClientIdentity::_bundleIdentifierFromAuditToken(
-    const std::shared_ptr<conduit::Connection>& connection, TarnErrorRef* error) {
+TarnResult<std::string> TarnClientIdentity::_bundleIdentifierFromAuditToken(
+    const std::shared_ptr<conduit::Connection>& connection) {
     auto info = codeSignInfoForConnection(connection);
     if (!info) {
-        if (error)
-            *error = TARN_POSIX_ERROR(ESRCH, "no code-signing registration for the executable of pid %d",
-                                      connection->pid());
-        return std::nullopt;
+        return TARN_POSIX_ERROR(ESRCH, "no code-signing registration for the executable of pid %d",
+                                connection->pid());
     }
     return info->signingIdentifier;
 }

@@ -19,7 +19,8 @@ namespace conduit {
 class Connection;
 }
 class TarnUserIdentity;
-class TarnError;
+template <class T>
+class TarnResult;  // Daemon/TarnResult.h
 struct CodeSignInfo;
 
 using TarnAuditToken = std::array<uint8_t, 32>;
@@ -83,9 +84,10 @@ public:
     // The peer's registration, read once per request through its pidfd.
     static std::shared_ptr<const CodeSignInfo> codeSignInfoForConnection(
         const std::shared_ptr<conduit::Connection>& connection);
-    // The code-signing identifier of the process behind the connection.
-    static std::optional<std::string> _bundleIdentifierFromAuditToken(
-        const std::shared_ptr<conduit::Connection>& connection, std::shared_ptr<const TarnError>* error);
+    // The code-signing identifier of the process behind the connection, or a
+    // POSIX ESRCH error when its executable has no code-signing registration.
+    static TarnResult<std::string> _bundleIdentifierFromAuditToken(
+        const std::shared_ptr<conduit::Connection>& connection);
     static TarnClientIdentityRef privilegedClientIdentityWithUserIdentity(
         std::shared_ptr<const TarnUserIdentity> userIdentity, bool kernel);
     static TarnClientIdentityRef anonymousPrivilegedClientIdentity();

@@ -31,6 +31,9 @@ std::unique_ptr<TarnCodeSigningMapping>& gSharedMapping =
 
 const std::optional<PlistDict> kNoInfo;
 
+// The store's answer for an identifier it has no record of.
+bool isNotFound(const TarnErrorRef& e) { return e && e->code() == TarnErrorDatabaseNotFound; }
+
 }  // namespace
 
 // ---- counted set ----
@@ -170,17 +173,13 @@ const std::optional<PlistDict>& TarnCodeSigningMapping::_codeSigningInfoForCodeS
 
 // ---- on the queue ----
 
-TarnCodeSigningEntryRef TarnCodeSigningMapping::_onQueue_codeSigningEntryForIdentifier(
-    const std::string& identifier, TarnErrorRef* withError) {
+TarnResult<TarnCodeSigningEntryRef> TarnCodeSigningMapping::_onQueue_codeSigningEntryForIdentifier(
+    const std::string& identifier) {
     assertOnQueue();
-    TarnErrorRef e;
-    TarnCodeSigningEntryRef entry = codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier, &e);
-    if (!entry && e) {
-        if (e->code() != TarnErrorDatabaseNotFound) {
-            TarnLog(kLogError, "_onQueue_codeSigningEntryForIdentifier",
-                    "Error retrieving entry from DB with identifier %@ : %@", identifier, e);
-        }
-        if (withError) *withError = e;
+    TarnResult<TarnCodeSigningEntryRef> entry = codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier);
+    if (!entry.ok() && !isNotFound(entry.error())) {
+        TarnLog(kLogError, "_onQueue_codeSigningEntryForIdentifier",
+                "Error retrieving entry from DB with identifier %@ : %@", identifier, entry.error());
     }
     return entry;
 }
@@ -188,78 +187,81 @@ TarnCodeSigningEntryRef TarnCodeSigningMapping::_onQueue_codeSigningEntryForIden
 std::optional<PlistDict> TarnCodeSigningMapping::_onQueue_codeSigningInfoForIdentifier(const std::string& identifier,
                                                                                       bool externalRequest) {
     assertOnQueue();
-    TarnCodeSigningEntryRef entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr);
-    return _codeSigningInfoForCodeSigningEntry(entry, externalRequest);
+    TarnResult<TarnCodeSigningEntryRef> entry = _onQueue_codeSigningEntryForIdentifier(identifier);
+    if (!entry.ok()) return std::nullopt;
+    return _codeSigningInfoForCodeSigningEntry(*entry, externalRequest);
 }
 
 std::optional<PlistDict> TarnCodeSigningMapping::_onQueue_entitlementsForIdentifier(const std::string& identifier) {
     assertOnQueue();
-    TarnCodeSigningEntryRef entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr);
-    if (const PlistDict* entitlements = _entitlementsFromCodeSigningEntry(entry)) return *entitlements;
+    TarnResult<TarnCodeSigningEntryRef> entry = _onQueue_codeSigningEntryForIdentifier(identifier);
+    if (!entry.ok()) return std::nullopt;
+    if (const PlistDict* entitlements = _entitlementsFromCodeSigningEntry(*entry)) return *entitlements;
     return std::nullopt;
 }
 
 uint64_t TarnCodeSigningMapping::_onQueue_dataContainerTypeForIdentifier(const std::string& identifier) {
     assertOnQueue();
-    TarnCodeSigningEntryRef entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr);
-    return entry ? entry->dataContainerClass() : 0;
+    TarnResult<TarnCodeSigningEntryRef> entry = _onQueue_codeSigningEntryForIdentifier(identifier);
+    return entry.ok() ? (*entry)->dataContainerClass() : 0;
 }
 
 bool TarnCodeSigningMapping::_onQueue_identifierHasCallerRegisteredEntitlements(const std::string& identifier) {
     assertOnQueue();
-    TarnCodeSigningEntryRef entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr);
-    return entry && entry->registeredByCaller();
+    TarnResult<TarnCodeSigningEntryRef> entry = _onQueue_codeSigningEntryForIdentifier(identifier);
+    return entry.ok() && (*entry)->registeredByCaller();
 }
 
 std::string TarnCodeSigningMapping::_onQueue_parentIdentifierForChildIdentifier(const std::string& identifier) {
     assertOnQueue();
-    TarnErrorRef e;
-    std::string parent = codeSigningMappingDB_->parentIdentifierForChildIdentifier(identifier, &e);
-    if (e && e->code() != TarnErrorDatabaseNotFound) {
+    TarnResult<std::string> parent = codeSigningMappingDB_->parentIdentifierForChildIdentifier(identifier);
+    if (parent.ok()) return std::move(*parent);
+    if (!isNotFound(parent.error())) {
         TarnLog(kLogError, "_onQueue_parentIdentifierForChildIdentifier",
-                "Error retrieving entry from DB with identifier %@ : %@", identifier, e);
+                "Error retrieving entry from DB with identifier %@ : %@", identifier, parent.error());
     }
-    return parent;
+    return std::string();
 }
 
 std::vector<std::string> TarnCodeSigningMapping::_onQueue_childBundleIdentifiersForParentIdentifier(
     const std::string& identifier) {
     assertOnQueue();
-    TarnErrorRef e;
-    std::vector<std::string> children = codeSigningMappingDB_->childIdentifiersForParentIdentifier(identifier, &e);
-    if (e && e->code() != TarnErrorDatabaseNotFound) {
+    TarnResult<std::vector<std::string>> children =
+        codeSigningMappingDB_->childIdentifiersForParentIdentifier(identifier);
+    if (children.ok()) return std::move(*children);
+    if (!isNotFound(children.error())) {
         TarnLog(kLogError, "_onQueue_childBundleIdentifiersForParentIdentifier",
-                "Error retrieving entry from DB with identifier %@ : %@", identifier, e);
+                "Error retrieving entry from DB with identifier %@ : %@", identifier, children.error());
     }
-    return children;
+    return {};
 }
 
-std::set<std::string> TarnCodeSigningMapping::_onQueue_identifiersWithError(TarnErrorRef* error) {
+TarnResult<std::set<std::string>> TarnCodeSigningMapping::_onQueue_identifiersWithError() {
     assertOnQueue();
-    return codeSigningMappingDB_->identifiersWithError(error);
+    return codeSigningMappingDB_->identifiersWithError();
 }
 
-bool TarnCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifier(const std::string& identifier,
-                                                                            TarnErrorRef* error) {
+TarnStatus TarnCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifier(
+    const std::string& identifier) {
     assertOnQueue();
-    return codeSigningMappingDB_->invalidateCodeSigningWithIdentifier(identifier, error);
+    return codeSigningMappingDB_->invalidateCodeSigningWithIdentifier(identifier);
 }
 
-bool TarnCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(
-    const std::string& identifier, TarnErrorRef* error) {
+TarnStatus TarnCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(
+    const std::string& identifier) {
     assertOnQueue();
-    return codeSigningMappingDB_->invalidateCodeSigningForIdentifierAndAllChildren(identifier, error);
+    return codeSigningMappingDB_->invalidateCodeSigningForIdentifierAndAllChildren(identifier);
 }
 
-bool TarnCodeSigningMapping::_onQueue_removeAllAdvanceCopiesWithError(TarnErrorRef* error) {
+TarnStatus TarnCodeSigningMapping::_onQueue_removeAllAdvanceCopiesWithError() {
     assertOnQueue();
-    return codeSigningMappingDB_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(error);
+    return codeSigningMappingDB_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError();
 }
 
 void TarnCodeSigningMapping::_onQueue_iterateGroupIdsWithKey(const char* key, const char* fallBackKey,
                                                              const GroupIdsBlock& forAllIdentifiersUsingBlock) {
     assertOnQueue();
-    TarnErrorRef e = codeSigningMappingDB_->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+    TarnStatus enumerated = codeSigningMappingDB_->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
         [&](const std::string& identifier, const TarnCodeSigningEntryRef& entry) {
             const PlistDict* entitlements = _entitlementsFromCodeSigningEntry(entry);
             const PlistValue* value = nullptr;
@@ -274,7 +276,10 @@ void TarnCodeSigningMapping::_onQueue_iterateGroupIdsWithKey(const char* key, co
             }
             forAllIdentifiersUsingBlock(identifier, value);
         });
-    if (e) TarnLog(kLogError, "_onQueue_iterateGroupIdsWithKey", "Failed to enumerate code signing info: %@", e);
+    if (!enumerated.ok()) {
+        TarnLog(kLogError, "_onQueue_iterateGroupIdsWithKey", "Failed to enumerate code signing info: %@",
+                enumerated.error());
+    }
 }
 
 TarnCountedSet TarnCodeSigningMapping::_onQueue_copyReferenceCountSetOfType(TarnGroupType type) {
@@ -301,31 +306,31 @@ TarnCountedSet TarnCodeSigningMapping::_onQueue_copyReferenceCountSetOfType(Tarn
     return counts;
 }
 
-uint64_t TarnCodeSigningMapping::_onQueue_setCodeSigningDictionaryValues(
+TarnStatus TarnCodeSigningMapping::_onQueue_setCodeSigningDictionaryValues(
     const std::vector<TarnCodeSigningEntryRef>& values, const std::vector<std::string>& forIdentifiers) {
     assertOnQueue();
     if (values.size() != forIdentifiers.size()) {
-        TarnErrorRef e = TARN_ERROR(TarnErrorMismatchedInput, nullptr,
-                                    "Can't act on an invalid input: values count: %ld, IDs count: %ld",
-                                    values.size(), forIdentifiers.size());
-        return e->code();
+        return TARN_ERROR(TarnErrorMismatchedInput, nullptr,
+                          "Can't act on an invalid input: values count: %ld, IDs count: %ld", values.size(),
+                          forIdentifiers.size());
     }
     for (size_t i = 0; i < values.size(); ++i) {
         const std::string& identifier = forIdentifiers[i];
         const TarnCodeSigningEntryRef& entry = values[i];
-        TarnErrorRef readError;
-        TarnCodeSigningEntryRef stored = codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier, &readError);
-        if (!stored && readError && readError->code() != TarnErrorDatabaseNotFound) {
+        TarnResult<TarnCodeSigningEntryRef> read =
+            codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier);
+        if (!read.ok() && !isNotFound(read.error())) {
             TarnLog(kLogError, "_onQueue_setCodeSigningDictionaryValues",
-                    "Error retrieving entry from DB with identifier %@ : %@", identifier, readError);
+                    "Error retrieving entry from DB with identifier %@ : %@", identifier, read.error());
             break;
         }
+        const TarnCodeSigningEntryRef stored = read.ok() ? std::move(*read) : nullptr;
         if (!entry || !entry->codeSigningInfo()) {
             if (!stored) continue;
-            TarnErrorRef deleteError;
-            if (!codeSigningMappingDB_->deleteCodeSigningEntryWithIdentifier(identifier, &deleteError)) {
+            TarnStatus deleted = codeSigningMappingDB_->deleteCodeSigningEntryWithIdentifier(identifier);
+            if (!deleted.ok()) {
                 TarnLog(kLogError, "_onQueue_setCodeSigningDictionaryValues",
-                        "Failed to delete code signing info from DB for %@ : %@", identifier, deleteError);
+                        "Failed to delete code signing info from DB for %@ : %@", identifier, deleted.error());
             } else {
                 PlatformLog("codesignmapping", PlatformLogType::Debug, "Deleted Code Signing Mapping for ID: %@",
                             identifier);
@@ -333,46 +338,33 @@ uint64_t TarnCodeSigningMapping::_onQueue_setCodeSigningDictionaryValues(
             continue;
         }
         if (TarnCodeSigningEntriesEqual(stored, entry)) continue;
-        TarnErrorRef writeError;
-        if (!codeSigningMappingDB_->addCodeSigningEntry(entry, identifier, &writeError)) {
+        TarnStatus written = codeSigningMappingDB_->addCodeSigningEntry(entry, identifier);
+        if (!written.ok()) {
             TarnLog(kLogError, "_onQueue_setCodeSigningDictionaryValues",
-                    "Failed to write code signing info to DB for %@ : %@", identifier, writeError);
+                    "Failed to write code signing info to DB for %@ : %@", identifier, written.error());
         } else {
             PlatformLog("codesignmapping", PlatformLogType::Default, "Set Code Signing Mapping for ID: %@ : %@",
                         identifier, entry);
         }
     }
-    return TarnSuccess;
+    return {};
 }
 
 // ---- legacy mapping file ----
 
-std::optional<PlistDict> TarnCodeSigningMapping::_readCodeSigningMappingFromDiskAtURL(const FileURL& url,
-                                                                                     TarnErrorRef* error) {
+TarnResult<PlistDict> TarnCodeSigningMapping::_readCodeSigningMappingFromDiskAtURL(const FileURL& url) {
     std::error_code ec;
     const uintmax_t size = std::filesystem::file_size(url, ec);
-    if (ec) {
-        if (error) *error = TARN_POSIX_ERROR(ec.value(), "%@: %s", url, ec.message());
-        return std::nullopt;
-    }
-    if (size > kMaxPlistBytes) {
-        if (error) *error = TARN_POSIX_ERROR(EFBIG, "%@ is too large to read (%llu bytes)", url, size);
-        return std::nullopt;
-    }
+    if (ec) return TARN_POSIX_ERROR(ec.value(), "%@: %s", url, ec.message());
+    if (size > kMaxPlistBytes) return TARN_POSIX_ERROR(EFBIG, "%@ is too large to read (%llu bytes)", url, size);
     std::ifstream in(url, std::ios::binary);
     std::vector<char> bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
-    if (!in.good() && !in.eof()) {
-        if (error) *error = TARN_POSIX_ERROR(EIO, "%@: read failed", url);
-        return std::nullopt;
-    }
+    if (!in.good() && !in.eof()) return TARN_POSIX_ERROR(EIO, "%@: read failed", url);
     std::string why;
     std::optional<PlistValue> parsed = PlistValue::fromBytes(bytes.data(), bytes.size(), &why);
     if (!parsed || !parsed->isDict()) {
-        if (error) {
-            *error = TARN_ERROR_SILENT(TarnErrorReadFailed, nullptr, "%@ is not a dictionary: %@", url,
-                                       parsed ? std::string("wrong root type") : why);
-        }
-        return std::nullopt;
+        return TARN_ERROR_SILENT(TarnErrorReadFailed, nullptr, "%@ is not a dictionary: %@", url,
+                                 parsed ? std::string("wrong root type") : why);
     }
     return std::move(*parsed->asDict());
 }
@@ -380,12 +372,11 @@ std::optional<PlistDict> TarnCodeSigningMapping::_readCodeSigningMappingFromDisk
 void TarnCodeSigningMapping::_onQueue_migrateFromMappingFileToDBIfNecessary() {
     assertOnQueue();
     const FileURL url = PathJoin(libraryDirectoryURL(), kLegacyMappingFileName);
-    TarnErrorRef readError;
-    std::optional<PlistDict> mapping = _readCodeSigningMappingFromDiskAtURL(url, &readError);
-    if (!mapping) {
-        if (!(readError && readError->posixCode() == ENOENT)) {
+    TarnResult<PlistDict> mapping = _readCodeSigningMappingFromDiskAtURL(url);
+    if (!mapping.ok()) {
+        if (!(mapping.error() && mapping.error()->posixCode() == ENOENT)) {
             TarnLog(kLogError, "_onQueue_migrateFromMappingFileToDBIfNecessary",
-                    "Failed to read code signing mapping file at %@ : %@", url, readError);
+                    "Failed to read code signing mapping file at %@ : %@", url, mapping.error());
         }
         return;
     }
@@ -396,13 +387,13 @@ void TarnCodeSigningMapping::_onQueue_migrateFromMappingFileToDBIfNecessary() {
         // An entry that cannot be decoded goes to the store as nothing, which
         // refuses it with its own error.
         TarnCodeSigningEntryRef entry = TarnCodeSigningEntry::initWithSerializedDictionary(serialized);
-        TarnErrorRef e;
-        if (codeSigningMappingDB_->addCodeSigningEntry(entry, identifier, &e)) {
+        TarnStatus added = codeSigningMappingDB_->addCodeSigningEntry(entry, identifier);
+        if (added.ok()) {
             ++migrated;
         } else {
             ++failed;
             TarnLog(kLogError, "_onQueue_migrateFromMappingFileToDBIfNecessary",
-                    "Failed to migrate code signing entry for %@ : %@", identifier, e);
+                    "Failed to migrate code signing entry for %@ : %@", identifier, added.error());
         }
     }
     TarnLog(kLogNotice, "_onQueue_migrateFromMappingFileToDBIfNecessary",
@@ -433,14 +424,14 @@ std::optional<PlistDict> TarnCodeSigningMapping::getCodeSigningInfoForIdentifier
     // in a bundle container gets imported.
     (void)entitlementsForIdentifier(identifier);
     std::optional<PlistDict> info;
-    runOnQueue([&] { info = _onQueue_codeSigningInfoForIdentifier(identifier, true); });
+    runOnQueue([&] { info = _onQueue_codeSigningInfoForIdentifier(identifier, /*externalRequest=*/true); });
     return info;
 }
 
-TarnCodeSigningEntryRef TarnCodeSigningMapping::codeSigningEntryForIdentifier(const std::string& identifier,
-                                                                              TarnErrorRef* withError) {
-    TarnCodeSigningEntryRef entry;
-    runOnQueue([&] { entry = _onQueue_codeSigningEntryForIdentifier(identifier, withError); });
+TarnResult<TarnCodeSigningEntryRef> TarnCodeSigningMapping::codeSigningEntryForIdentifier(
+    const std::string& identifier) {
+    TarnResult<TarnCodeSigningEntryRef> entry = TarnCodeSigningEntryRef();
+    runOnQueue([&] { entry = _onQueue_codeSigningEntryForIdentifier(identifier); });
     return entry;
 }
 
@@ -486,9 +477,9 @@ std::vector<std::string> TarnCodeSigningMapping::childBundleIdentifiersForParent
     return children;
 }
 
-std::set<std::string> TarnCodeSigningMapping::identifiersWithError(TarnErrorRef* error) {
-    std::set<std::string> identifiers;
-    runOnQueue([&] { identifiers = _onQueue_identifiersWithError(error); });
+TarnResult<std::set<std::string>> TarnCodeSigningMapping::identifiersWithError() {
+    TarnResult<std::set<std::string>> identifiers = std::set<std::string>();
+    runOnQueue([&] { identifiers = _onQueue_identifiersWithError(); });
     return identifiers;
 }
 
@@ -498,11 +489,10 @@ TarnCountedSet TarnCodeSigningMapping::copyReferenceCountSetOfType(TarnGroupType
     return counts;
 }
 
-bool TarnCodeSigningMapping::invalidateCodeSigningInfoForIdentifier(const std::string& identifier,
-                                                                    TarnErrorRef* withError) {
-    bool ok = false;
-    runOnQueue([&] { ok = _onQueue_invalidateCodeSigningInfoForIdentifier(identifier, withError); });
-    return ok;
+TarnStatus TarnCodeSigningMapping::invalidateCodeSigningInfoForIdentifier(const std::string& identifier) {
+    TarnStatus status;
+    runOnQueue([&] { status = _onQueue_invalidateCodeSigningInfoForIdentifier(identifier); });
+    return status;
 }
 
 void TarnCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChildren(
@@ -516,61 +506,56 @@ void TarnCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChi
         std::vector<std::string> identifiers = _onQueue_childBundleIdentifiersForParentIdentifier(identifier);
         identifiers.push_back(identifier);
         for (const std::string& each : identifiers) {
-            TarnErrorRef e;
             // An unreadable record is still deleted; only a missing one is skipped.
-            const bool stored = _onQueue_codeSigningEntryForIdentifier(each, &e) ||
-                                !(e && e->code() == TarnErrorDatabaseNotFound);
-            if (!stored) continue;
-            e = nullptr;
-            if (codeSigningMappingDB_->deleteCodeSigningEntryWithIdentifier(each, &e)) continue;
+            TarnResult<TarnCodeSigningEntryRef> stored = _onQueue_codeSigningEntryForIdentifier(each);
+            if (!stored.ok() && isNotFound(stored.error())) continue;
+            TarnStatus deleted = codeSigningMappingDB_->deleteCodeSigningEntryWithIdentifier(each);
+            if (deleted.ok()) continue;
             TarnLog(kLogError, "removeCodeSigningDictionariesForIdentifierAndItsChildren",
-                    "Failed to clear entitlements for %@ : %llu", each, TarnErrorCodeOf(e, TarnErrorDatabase));
+                    "Failed to clear entitlements for %@ : %llu", each, deleted.code(TarnErrorDatabase));
         }
     });
 }
 
-bool TarnCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
-                                                                                  TarnErrorRef* withError) {
-    bool ok = false;
-    runOnQueue([&] { ok = _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(identifier, withError); });
-    return ok;
+TarnStatus TarnCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(
+    const std::string& identifier) {
+    TarnStatus status;
+    runOnQueue([&] { status = _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(identifier); });
+    return status;
 }
 
-bool TarnCodeSigningMapping::removeAllAdvanceCopiesWithError(TarnErrorRef* error) {
-    bool ok = false;
-    runOnQueue([&] { ok = _onQueue_removeAllAdvanceCopiesWithError(error); });
-    return ok;
+TarnStatus TarnCodeSigningMapping::removeAllAdvanceCopiesWithError() {
+    TarnStatus status;
+    runOnQueue([&] { status = _onQueue_removeAllAdvanceCopiesWithError(); });
+    return status;
 }
 
-uint64_t TarnCodeSigningMapping::processCallerRegisteredEntitlements(const PlistDict& entitlements,
-                                                                     const std::string& forIdentifier,
-                                                                     TarnCommandQueue* commandQueue) {
-    return TarnSuccess;
+TarnStatus TarnCodeSigningMapping::processCallerRegisteredEntitlements(const PlistDict& entitlements,
+                                                                       const std::string& forIdentifier,
+                                                                       TarnCommandQueue* commandQueue) {
+    return {};
 }
 
 // ---- command 19 ----
 
+// What this handler throws is fenced by the request processor, as for every
+// other handler.
 void TarnHandleGetCodeSigningInfoCommand(const TarnRequestContext& context,
                                          const PlistValue& request, PlistValue& reply,
                                          TarnClientConnection* connection, uint64_t* error) {
-    try {
-        std::string identifier;
-        if (const PlistValue* value = request.find("Identifier")) {
-            if (const std::string* s = value->asString()) identifier = *s;
-        }
-        std::optional<PlistDict> info;
-        if (TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance()) {
-            info = mapping->getCodeSigningInfoForIdentifier(identifier);
-        }
-        if (!info) {
-            TarnSetError(error, TarnErrorNotFound);
-            return;
-        }
-        reply.set("ReplyInfoDictionary", std::move(*info));
-    } catch (const std::exception& ex) {
-        TarnErrorRef e = TARN_ERROR(TarnErrorException, nullptr, "Got exception: %@ : %@", ex.what(), "()");
-        TarnSetError(error, e->code());
+    std::string identifier;
+    if (const PlistValue* value = request.find("Identifier")) {
+        if (const std::string* s = value->asString()) identifier = *s;
     }
+    std::optional<PlistDict> info;
+    if (TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance()) {
+        info = mapping->getCodeSigningInfoForIdentifier(identifier);
+    }
+    if (!info) {
+        TarnSetError(error, TarnErrorNotFound);
+        return;
+    }
+    reply.set("ReplyInfoDictionary", std::move(*info));
 }
 
 }  // namespace tarn

@@ -16,6 +16,10 @@
 // Views: internal reads answer an entry's information whatever its flags;
 // external reads (answers that leave the daemon) answer nothing for a
 // placeholder, an advance copy or an invalidated entry.
+//
+// Errors: operations that can fail answer a TarnResult (Daemon/TarnResult.h)
+// carrying the store's error values unchanged (TarnSQLiteDB.h lists them).
+// Reads that answer a plain value treat a failure as "none" after logging it.
 #pragma once
 
 #include <cstdint>
@@ -31,6 +35,7 @@
 #include "Daemon/TarnCodeSigningEntry.h"
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnRequestContext.h"
+#include "Daemon/TarnResult.h"
 #include "Platform/Dispatch.h"
 #include "Platform/Path.h"
 #include "Platform/PropertyList.h"
@@ -100,9 +105,8 @@ public:
     std::optional<PlistDict> entitlementsForIdentifier(const std::string& identifier);
     // The code-signing info as a client may see it (external view); empty when none.
     std::optional<PlistDict> getCodeSigningInfoForIdentifier(const std::string& identifier);
-    // The stored entry; empty with 67 when there is none.
-    TarnCodeSigningEntryRef codeSigningEntryForIdentifier(const std::string& identifier,
-                                                          TarnErrorRef* withError);
+    // The stored entry (never empty), or 67 when there is none.
+    TarnResult<TarnCodeSigningEntryRef> codeSigningEntryForIdentifier(const std::string& identifier);
     std::optional<std::vector<std::string>> appGroupIdentifiersForIdentifier(const std::string& identifier);
     // Only identifiers with the "systemgroup." prefix.
     std::optional<std::vector<std::string>> systemGroupIdentifiersForIdentifier(const std::string& identifier);
@@ -113,28 +117,29 @@ public:
     // Empty when the identifier is nobody's child.
     std::string parentIdentifierForChildIdentifier(const std::string& identifier);
     std::vector<std::string> childBundleIdentifiersForParentIdentifier(const std::string& identifier);
-    std::set<std::string> identifiersWithError(TarnErrorRef* error);
+    TarnResult<std::set<std::string>> identifiersWithError();
     // How many stored entries (invalid, placeholder and advance copies included)
     // name each group of the type.
     TarnCountedSet copyReferenceCountSetOfType(TarnGroupType type);
 
     // ---- changes ----
 
-    bool invalidateCodeSigningInfoForIdentifier(const std::string& identifier, TarnErrorRef* withError);
-    bool invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
-                                                              TarnErrorRef* withError);
-    bool removeAllAdvanceCopiesWithError(TarnErrorRef* error);
+    TarnStatus invalidateCodeSigningInfoForIdentifier(const std::string& identifier);
+    TarnStatus invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier);
+    TarnStatus removeAllAdvanceCopiesWithError();
     // Deletes the stored records of the identifier's children, then of the
     // identifier itself; an identifier without a record is skipped. A failure
     // is logged and the others are still removed. `commandQueue` receives the
     // follow-up work of group clean-up.
     void removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier,
                                                                   TarnCommandQueue* commandQueue);
-    // A connecting client's own entitlements. Registration (with its group
-    // clean-up) is not done yet: this answers success without storing.
-    uint64_t processCallerRegisteredEntitlements(const PlistDict& entitlements,
-                                                 const std::string& forIdentifier,
-                                                 TarnCommandQueue* commandQueue);
+    // A connecting client's own entitlements, offered on every admitted
+    // request. Not built yet: registering them (and the group clean-up that
+    // follows) comes with the processing of code-signing information. Until
+    // then this answers success and stores nothing.
+    TarnStatus processCallerRegisteredEntitlements(const PlistDict& entitlements,
+                                                   const std::string& forIdentifier,
+                                                   TarnCommandQueue* commandQueue);
 
     // ---- helpers on entitlements (no store access) ----
 
@@ -153,8 +158,8 @@ public:
 
     // ---- on the queue ----
 
-    TarnCodeSigningEntryRef _onQueue_codeSigningEntryForIdentifier(const std::string& identifier,
-                                                                   TarnErrorRef* withError);
+    // Logs a failure other than 67 before answering it.
+    TarnResult<TarnCodeSigningEntryRef> _onQueue_codeSigningEntryForIdentifier(const std::string& identifier);
     std::optional<PlistDict> _onQueue_codeSigningInfoForIdentifier(const std::string& identifier,
                                                                    bool externalRequest);
     std::optional<PlistDict> _onQueue_entitlementsForIdentifier(const std::string& identifier);
@@ -162,11 +167,10 @@ public:
     bool _onQueue_identifierHasCallerRegisteredEntitlements(const std::string& identifier);
     std::string _onQueue_parentIdentifierForChildIdentifier(const std::string& identifier);
     std::vector<std::string> _onQueue_childBundleIdentifiersForParentIdentifier(const std::string& identifier);
-    std::set<std::string> _onQueue_identifiersWithError(TarnErrorRef* error);
-    bool _onQueue_invalidateCodeSigningInfoForIdentifier(const std::string& identifier, TarnErrorRef* error);
-    bool _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier,
-                                                                       TarnErrorRef* error);
-    bool _onQueue_removeAllAdvanceCopiesWithError(TarnErrorRef* error);
+    TarnResult<std::set<std::string>> _onQueue_identifiersWithError();
+    TarnStatus _onQueue_invalidateCodeSigningInfoForIdentifier(const std::string& identifier);
+    TarnStatus _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier);
+    TarnStatus _onQueue_removeAllAdvanceCopiesWithError();
     TarnCountedSet _onQueue_copyReferenceCountSetOfType(TarnGroupType type);
     // Calls `block` with every stored identifier and the group value under
     // `key` (or `fallBackKey` when that gives nothing or an empty list).
@@ -174,15 +178,15 @@ public:
     void _onQueue_iterateGroupIdsWithKey(const char* key, const char* fallBackKey,
                                          const GroupIdsBlock& forAllIdentifiersUsingBlock);
     // Writes each entry under its identifier, deleting where the entry has no
-    // info; a read failure ends the batch. 60 when the counts differ.
-    uint64_t _onQueue_setCodeSigningDictionaryValues(const std::vector<TarnCodeSigningEntryRef>& values,
-                                                     const std::vector<std::string>& forIdentifiers);
+    // info; a read failure ends the batch, and a failed write is logged and
+    // skipped (neither fails the batch). 60 when the counts differ.
+    TarnStatus _onQueue_setCodeSigningDictionaryValues(const std::vector<TarnCodeSigningEntryRef>& values,
+                                                       const std::vector<std::string>& forIdentifiers);
     // Imports "tarn_code_signing_info.plist" from the library directory.
     void _onQueue_migrateFromMappingFileToDBIfNecessary();
-    // The legacy mapping file: identifier -> serialised entry. Empty with the
-    // error when it cannot be read; a missing file is a POSIX ENOENT error.
-    static std::optional<PlistDict> _readCodeSigningMappingFromDiskAtURL(const FileURL& url,
-                                                                         TarnErrorRef* error);
+    // The legacy mapping file: identifier -> serialised entry, or the error
+    // when it cannot be read; a missing file is a POSIX ENOENT error.
+    static TarnResult<PlistDict> _readCodeSigningMappingFromDiskAtURL(const FileURL& url);
 
 private:
     // Runs `work` synchronously on the queue; must be called off it.

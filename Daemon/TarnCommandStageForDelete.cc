@@ -29,15 +29,16 @@ TarnMetadataRef cachedContainerForIdentity(TarnContainerCache& cache,
 // permanent bundle, if there is one; those records must stay.
 bool keepsCodeSigningRecords(TarnContainerCache& cache, const TarnMetadata& container) {
     if (!container.transient()) return false;
-    uint64_t code = TarnSuccess;
-    TarnContainerIdentityRef permanent = TarnContainerIdentity::containerIdentityWithIdentifier(
-        container.identifier(), container.containerClass(), &code);
-    if (!permanent) {
+    TarnResult<TarnContainerIdentityRef> made =
+        TarnContainerIdentity::containerIdentityWithIdentifier(container.identifier(),
+                                                               container.containerClass());
+    if (!made.ok()) {
         TarnLog(kLogError, "fromQueue",
                 "Could not construct container identity from %@ to check for permanent copy: %llu",
-                container.identifier(), code);
+                container.identifier(), made.code(TarnErrorInvalidArgument));
         return false;
     }
+    TarnContainerIdentityRef permanent = std::move(*made);
     TarnErrorRef lookupError;
     if (!cache.containerForContainerIdentity(permanent, false, false, &lookupError)) return false;
     PlatformLog("unspecified", PlatformLogType::Default,

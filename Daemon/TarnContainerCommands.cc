@@ -178,8 +178,11 @@ TarnContainerIdentityRef validatedContainerIdentity(const PlistValue& request,
     TarnUserIdentityRef user =
         userIdentityForContainerIdentifier(connection, identifier, containerClass, error);
     if (!user) return nullptr;
-    return TarnContainerIdentity::containerIdentityWithUserIdentity(
-        std::move(user), std::move(identifier), containerClass, error);
+    TarnResult<TarnContainerIdentityRef> identity =
+        TarnContainerIdentity::containerIdentityWithUserIdentity(
+            std::move(user), std::move(identifier), containerClass);
+    if (!TarnReport(identity, error, TarnErrorInvalidArgument)) return nullptr;
+    return std::move(*identity);
 }
 
 TarnConcreteContainerIdentityRef concreteContainerIdentity(const PlistValue& request,
@@ -201,8 +204,11 @@ TarnConcreteContainerIdentityRef concreteContainerIdentity(const PlistValue& req
     } else {
         user = clientUserIdentity(connection);
     }
-    return TarnConcreteContainerIdentity::containerIdentityWithUUID(
-        request.find(keys.uuid), user, identifier, containerClass, error);
+    TarnResult<TarnConcreteContainerIdentityRef> identity =
+        TarnConcreteContainerIdentity::containerIdentityWithUUID(request.find(keys.uuid), user,
+                                                                 identifier, containerClass);
+    if (!TarnReport(identity, error, TarnErrorInvalidArgument)) return nullptr;
+    return std::move(*identity);
 }
 
 const char* sandboxExtensionClassForContainer(TarnContainerClass containerClass,
@@ -339,10 +345,11 @@ void TarnHandleStageForDeleteCommand(const TarnRequestContext& context, const Pl
             return;
         }
         // A malformed entry is skipped; its code stays in the slot.
-        TarnConcreteContainerIdentityRef identity =
+        TarnResult<TarnConcreteContainerIdentityRef> identity =
             TarnConcreteContainerIdentity::containerIdentityWithUUID(
-                &(*uuids)[i], user, &(*identifiers)[i], containerClass, error);
-        if (identity) identities.push_back(std::move(identity));
+                &(*uuids)[i], user, &(*identifiers)[i], containerClass);
+        if (TarnReport(identity, error, TarnErrorInvalidArgument))
+            identities.push_back(std::move(*identity));
     }
     connection->commandQueue()->insertCommand(
         TarnCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(

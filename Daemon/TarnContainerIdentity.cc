@@ -24,81 +24,77 @@ TarnContainerIdentity::TarnContainerIdentity(PrivateTag, TarnUserIdentityRef use
       containerClass_(containerClass),
       userIdentity_(std::move(userIdentity)) {}
 
-bool TarnContainerIdentity::validateText(const TarnUserIdentityRef& userIdentity,
-                                         bool hasIdentifier, TarnContainerClass containerClass,
-                                         uint64_t* error) {
+TarnStatus TarnContainerIdentity::validateText(const TarnUserIdentityRef& userIdentity,
+                                               bool hasIdentifier,
+                                               TarnContainerClass containerClass) {
+    // The line above each refusal is its report: the error values are silent.
     if (!userIdentity) {
         TarnLog(kLogError, kInitTag, "Invalid object: no user identity");
-        TarnSetError(error, TarnErrorInvalidArgument);
-        return false;
+        return TARN_ERROR_CODE_IN(kInitTag, TarnErrorInvalidArgument, nullptr);
     }
     if (!hasIdentifier) {
         TarnLog(kLogError, kInitTag, "Invalid object: missing identifier");
-        TarnSetError(error, TarnErrorMissingIdentifier);
-        return false;
+        return TARN_ERROR_CODE_IN(kInitTag, TarnErrorMissingIdentifier, nullptr);
     }
     if (!TarnContainerClassIsValid(containerClass)) {
         TarnLog(kLogError, kInitTag, "Invalid object: container class = %llu", containerClass);
-        TarnSetError(error, TarnErrorInvalidArgument);
-        return false;
+        return TARN_ERROR_CODE_IN(kInitTag, TarnErrorInvalidArgument, nullptr);
     }
-    return true;
+    return {};
 }
 
-bool TarnContainerIdentity::validate(const TarnUserIdentityRef& userIdentity,
-                                     const PlistValue* identifier,
-                                     TarnContainerClass containerClass, std::string* identifierOut,
-                                     uint64_t* error) {
+TarnStatus TarnContainerIdentity::validate(const TarnUserIdentityRef& userIdentity,
+                                           const PlistValue* identifier,
+                                           TarnContainerClass containerClass,
+                                           std::string* identifierOut) {
     const bool present = identifier && !identifier->isNull();
-    if (!userIdentity || !present) return validateText(userIdentity, present, containerClass, error);
+    if (!userIdentity || !present) return validateText(userIdentity, present, containerClass);
     const std::string* text = identifier->asString();
     if (!text) {
         TarnLog(kLogError, kInitTag, "Invalid object: identifier = [%@]", *identifier);
-        TarnSetError(error, TarnErrorInvalidArgument);
-        return false;
+        return TARN_ERROR_CODE_IN(kInitTag, TarnErrorInvalidArgument, nullptr);
     }
-    if (!validateText(userIdentity, true, containerClass, error)) return false;
+    TARN_TRY(validateText(userIdentity, true, containerClass));
     *identifierOut = *text;
-    return true;
+    return {};
 }
 
-TarnContainerIdentityRef TarnContainerIdentity::containerIdentityWithUserIdentity(
+TarnResult<TarnContainerIdentityRef> TarnContainerIdentity::containerIdentityWithUserIdentity(
     TarnUserIdentityRef userIdentity, const PlistValue* identifier,
-    TarnContainerClass containerClass, uint64_t* error) {
+    TarnContainerClass containerClass) {
     std::string text;
-    if (!validate(userIdentity, identifier, containerClass, &text, error)) return nullptr;
-    return std::make_shared<const TarnContainerIdentity>(PrivateTag{}, std::move(userIdentity),
-                                                         std::move(text), containerClass);
+    TARN_TRY(validate(userIdentity, identifier, containerClass, &text));
+    return TarnContainerIdentityRef(std::make_shared<const TarnContainerIdentity>(
+        PrivateTag{}, std::move(userIdentity), std::move(text), containerClass));
 }
 
-TarnContainerIdentityRef TarnContainerIdentity::containerIdentityWithUserIdentity(
+TarnResult<TarnContainerIdentityRef> TarnContainerIdentity::containerIdentityWithUserIdentity(
     TarnUserIdentityRef userIdentity, std::optional<std::string> identifier,
-    TarnContainerClass containerClass, uint64_t* error) {
+    TarnContainerClass containerClass) {
     // Text already: checked and moved in without a property-list detour.
-    if (!validateText(userIdentity, identifier.has_value(), containerClass, error)) return nullptr;
-    return std::make_shared<const TarnContainerIdentity>(PrivateTag{}, std::move(userIdentity),
-                                                         std::move(*identifier), containerClass);
+    TARN_TRY(validateText(userIdentity, identifier.has_value(), containerClass));
+    return TarnContainerIdentityRef(std::make_shared<const TarnContainerIdentity>(
+        PrivateTag{}, std::move(userIdentity), std::move(*identifier), containerClass));
 }
 
-TarnContainerIdentityRef TarnContainerIdentity::initWithUserIdentity(
+TarnResult<TarnContainerIdentityRef> TarnContainerIdentity::initWithUserIdentity(
     TarnUserIdentityRef userIdentity, std::optional<std::string> identifier,
-    TarnContainerClass containerClass, uint64_t* error) {
+    TarnContainerClass containerClass) {
     return containerIdentityWithUserIdentity(std::move(userIdentity), std::move(identifier),
-                                             containerClass, error);
+                                             containerClass);
 }
 
-TarnContainerIdentityRef TarnContainerIdentity::containerIdentityWithIdentifier(
-    std::optional<std::string> identifier, TarnContainerClass containerClass, uint64_t* error) {
+TarnResult<TarnContainerIdentityRef> TarnContainerIdentity::containerIdentityWithIdentifier(
+    std::optional<std::string> identifier, TarnContainerClass containerClass) {
     if (TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
         PlatformLog("default", PlatformLogType::Fault,
                     "Attempt to create a container identity without a user identity when one is "
                     "required; identifier = [%@], class = %llu",
                     identifier, containerClass);
-        TarnSetError(error, TarnErrorInvalidArgument);
-        return nullptr;
+        return TARN_ERROR_CODE(TarnErrorInvalidArgument, nullptr);
     }
     return containerIdentityWithUserIdentity(TarnUserIdentityCache::defaultUserIdentity(),
-                                             std::move(identifier), containerClass, error);
+                                             std::move(identifier), containerClass);
 }
 
 bool TarnContainerIdentity::isEqualToContainerIdentity(const TarnContainerIdentity& other) const {
@@ -131,40 +127,38 @@ TarnConcreteContainerIdentity::TarnConcreteContainerIdentity(PrivateTag, Uuid uu
                             containerClass),
       uuid_(uuid) {}
 
-TarnConcreteContainerIdentityRef TarnConcreteContainerIdentity::containerIdentityWithUUID(
+TarnResult<TarnConcreteContainerIdentityRef> TarnConcreteContainerIdentity::containerIdentityWithUUID(
     const PlistValue* uuid, TarnUserIdentityRef userIdentity, const PlistValue* identifier,
-    TarnContainerClass containerClass, uint64_t* error) {
+    TarnContainerClass containerClass) {
     std::string text;
-    if (!validate(userIdentity, identifier, containerClass, &text, error)) return nullptr;
+    TARN_TRY(validate(userIdentity, identifier, containerClass, &text));
     // Only a UUID value will do: a string in UUID form is a caller's mistake.
     if (!uuid || !uuid->isUuid()) {
         TarnLog(kLogError, kConcreteInitTag, "Invalid object: uuid = [%@]",
                 uuid ? uuid->description() : std::string("(null)"));
-        TarnSetError(error, TarnErrorInvalidArgument);
-        return nullptr;
+        return TARN_ERROR_CODE_IN(kConcreteInitTag, TarnErrorInvalidArgument, nullptr);
     }
-    return std::make_shared<const TarnConcreteContainerIdentity>(
-        PrivateTag{}, *uuid->asUuid(), std::move(userIdentity), std::move(text), containerClass);
+    return TarnConcreteContainerIdentityRef(std::make_shared<const TarnConcreteContainerIdentity>(
+        PrivateTag{}, *uuid->asUuid(), std::move(userIdentity), std::move(text), containerClass));
 }
 
-TarnConcreteContainerIdentityRef TarnConcreteContainerIdentity::containerIdentityWithUUID(
+TarnResult<TarnConcreteContainerIdentityRef> TarnConcreteContainerIdentity::containerIdentityWithUUID(
     std::optional<Uuid> uuid, TarnUserIdentityRef userIdentity,
-    std::optional<std::string> identifier, TarnContainerClass containerClass, uint64_t* error) {
-    if (!validateText(userIdentity, identifier.has_value(), containerClass, error)) return nullptr;
+    std::optional<std::string> identifier, TarnContainerClass containerClass) {
+    TARN_TRY(validateText(userIdentity, identifier.has_value(), containerClass));
     if (!uuid) {
         TarnLog(kLogError, kConcreteInitTag, "Invalid object: uuid = [%@]", "(null)");
-        TarnSetError(error, TarnErrorInvalidArgument);
-        return nullptr;
+        return TARN_ERROR_CODE_IN(kConcreteInitTag, TarnErrorInvalidArgument, nullptr);
     }
-    return std::make_shared<const TarnConcreteContainerIdentity>(
-        PrivateTag{}, *uuid, std::move(userIdentity), std::move(*identifier), containerClass);
+    return TarnConcreteContainerIdentityRef(std::make_shared<const TarnConcreteContainerIdentity>(
+        PrivateTag{}, *uuid, std::move(userIdentity), std::move(*identifier), containerClass));
 }
 
-TarnConcreteContainerIdentityRef TarnConcreteContainerIdentity::initWithUUID(
+TarnResult<TarnConcreteContainerIdentityRef> TarnConcreteContainerIdentity::initWithUUID(
     std::optional<Uuid> uuid, TarnUserIdentityRef userIdentity,
-    std::optional<std::string> identifier, TarnContainerClass containerClass, uint64_t* error) {
+    std::optional<std::string> identifier, TarnContainerClass containerClass) {
     return containerIdentityWithUUID(uuid, std::move(userIdentity), std::move(identifier),
-                                     containerClass, error);
+                                     containerClass);
 }
 
 bool TarnConcreteContainerIdentity::isEqualToConcreteContainerIdentity(

@@ -3,11 +3,12 @@
 // UUID recorded in the container's metadata. Both are immutable once made and
 // shared freely between threads.
 //
-// Construction validates its arguments and reports a failure as nullptr plus
-// a TarnErrorDomain code in the optional `error` slot (written only on
-// failure): 18 for a missing identifier, 11 for every other bad argument.
-// The overloads taking `const PlistValue*` are for values decoded from a
-// request, whose type is not known yet; nullptr or a Null value is "missing".
+// Construction validates its arguments and answers the identity (never
+// empty) or a silent error value of TarnErrorDomain: 18 for a missing
+// identifier, 11 for every other bad argument. The refusal itself is logged
+// once, by the constructor. The overloads taking `const PlistValue*` are for
+// values decoded from a request, whose type is not known yet; nullptr or a
+// Null value is "missing".
 //
 // Equality is deliberately asymmetric: a plain identity equals a concrete one
 // with the same three fields, but a concrete identity equals only another
@@ -23,6 +24,7 @@
 #include <unordered_set>
 
 #include "Daemon/TarnContainerClass.h"
+#include "Daemon/TarnResult.h"
 #include "Daemon/TarnUserIdentity.h"
 #include "Platform/PropertyList.h"
 
@@ -41,20 +43,19 @@ protected:
     };
 
 public:
-    static TarnContainerIdentityRef containerIdentityWithUserIdentity(
+    static TarnResult<TarnContainerIdentityRef> containerIdentityWithUserIdentity(
         TarnUserIdentityRef userIdentity, std::optional<std::string> identifier,
-        TarnContainerClass containerClass, uint64_t* error);
-    static TarnContainerIdentityRef containerIdentityWithUserIdentity(
+        TarnContainerClass containerClass);
+    static TarnResult<TarnContainerIdentityRef> containerIdentityWithUserIdentity(
         TarnUserIdentityRef userIdentity, const PlistValue* identifier,
-        TarnContainerClass containerClass, uint64_t* error);
-    static TarnContainerIdentityRef initWithUserIdentity(TarnUserIdentityRef userIdentity,
-                                                         std::optional<std::string> identifier,
-                                                         TarnContainerClass containerClass,
-                                                         uint64_t* error);
+        TarnContainerClass containerClass);
+    static TarnResult<TarnContainerIdentityRef> initWithUserIdentity(
+        TarnUserIdentityRef userIdentity, std::optional<std::string> identifier,
+        TarnContainerClass containerClass);
     // For callers without a user identity: allowed only for global classes,
     // which get the default user identity; other classes fail with 11.
-    static TarnContainerIdentityRef containerIdentityWithIdentifier(
-        std::optional<std::string> identifier, TarnContainerClass containerClass, uint64_t* error);
+    static TarnResult<TarnContainerIdentityRef> containerIdentityWithIdentifier(
+        std::optional<std::string> identifier, TarnContainerClass containerClass);
 
     virtual ~TarnContainerIdentity() = default;
 
@@ -75,12 +76,11 @@ public:
 
 protected:
     // The checks of validate() for an identifier that is text or absent.
-    static bool validateText(const TarnUserIdentityRef& userIdentity, bool hasIdentifier,
-                             TarnContainerClass containerClass, uint64_t* error);
-    // Runs the checks of the base identity; on success fills the outputs.
-    static bool validate(const TarnUserIdentityRef& userIdentity, const PlistValue* identifier,
-                         TarnContainerClass containerClass, std::string* identifierOut,
-                         uint64_t* error);
+    static TarnStatus validateText(const TarnUserIdentityRef& userIdentity, bool hasIdentifier,
+                                   TarnContainerClass containerClass);
+    // Runs the checks of the base identity; on success fills `identifierOut`.
+    static TarnStatus validate(const TarnUserIdentityRef& userIdentity, const PlistValue* identifier,
+                               TarnContainerClass containerClass, std::string* identifierOut);
 
 private:
     const std::string identifier_;
@@ -90,18 +90,16 @@ private:
 
 class TarnConcreteContainerIdentity : public TarnContainerIdentity {
 public:
-    static TarnConcreteContainerIdentityRef containerIdentityWithUUID(
+    static TarnResult<TarnConcreteContainerIdentityRef> containerIdentityWithUUID(
         std::optional<Uuid> uuid, TarnUserIdentityRef userIdentity,
-        std::optional<std::string> identifier, TarnContainerClass containerClass, uint64_t* error);
+        std::optional<std::string> identifier, TarnContainerClass containerClass);
     // `uuid` must hold a Uuid value; a string, even in UUID form, is refused.
-    static TarnConcreteContainerIdentityRef containerIdentityWithUUID(
+    static TarnResult<TarnConcreteContainerIdentityRef> containerIdentityWithUUID(
         const PlistValue* uuid, TarnUserIdentityRef userIdentity, const PlistValue* identifier,
-        TarnContainerClass containerClass, uint64_t* error);
-    static TarnConcreteContainerIdentityRef initWithUUID(std::optional<Uuid> uuid,
-                                                         TarnUserIdentityRef userIdentity,
-                                                         std::optional<std::string> identifier,
-                                                         TarnContainerClass containerClass,
-                                                         uint64_t* error);
+        TarnContainerClass containerClass);
+    static TarnResult<TarnConcreteContainerIdentityRef> initWithUUID(
+        std::optional<Uuid> uuid, TarnUserIdentityRef userIdentity,
+        std::optional<std::string> identifier, TarnContainerClass containerClass);
 
     const Uuid& uuid() const { return uuid_; }
 

@@ -86,9 +86,10 @@ TarnMutableMetadataRef TarnMetadata::initWithContainerIdentity(
 }
 
 TarnConcreteContainerIdentityRef TarnMetadata::containerIdentity() const {
-    return TarnConcreteContainerIdentity::containerIdentityWithUUID(uuid_, userIdentity_,
-                                                                    identifier_, containerClass_,
-                                                                    nullptr);
+    TarnResult<TarnConcreteContainerIdentityRef> identity =
+        TarnConcreteContainerIdentity::containerIdentityWithUUID(uuid_, userIdentity_, identifier_,
+                                                                 containerClass_);
+    return identity.ok() ? std::move(*identity) : nullptr;
 }
 
 PlistValue TarnMetadata::dictionaryRepresentation() const {
@@ -340,9 +341,12 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
             uint64_t code = TarnSuccess;
             PlistValue scratch;
             if (!fields.identityInlined(stored) ||
-                !TarnUserIdentity::userIdentityWithEntries(*fields.identity, cache, &owner))
-                owner = TarnUserIdentity::userIdentityWithPlist(*fields.storedIdentity(&scratch),
-                                                                cache, &code);
+                !TarnUserIdentity::userIdentityWithEntries(*fields.identity, cache, &owner)) {
+                TarnResult<TarnUserIdentityRef> read = TarnUserIdentity::userIdentityWithPlist(
+                    *fields.storedIdentity(&scratch), cache);
+                code = read.code(TarnErrorInvalidUserIdentityData);
+                if (read.ok()) owner = std::move(*read);
+            }
             if (!owner) {
                 return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                        "Invalid metadata User Identity: %@ for %@ at %@: %llu",
@@ -398,9 +402,9 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
     // fail the identity; the factory then reports it (log line and code) as
     // ever. A good file needs no identity object, only its fields.
     if (!owner) {
-        uint64_t code = TarnSuccess;
-        (void)TarnConcreteContainerIdentity::containerIdentityWithUUID(
-            *uuid, owner, std::move(identifier), containerClass, &code);
+        const uint64_t code = TarnConcreteContainerIdentity::containerIdentityWithUUID(
+                                  *uuid, owner, std::move(identifier), containerClass)
+                                  .code(TarnErrorInvalidArgument);
         return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
                                "Could not create user identity from %@: %llu", fileURL(), code));
     }

@@ -73,12 +73,12 @@ std::shared_ptr<TarnClientConnection> admitClient(const std::shared_ptr<conduit:
     // to register; the request itself still goes ahead.
     TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance();
     if (identity && mapping) {
-        uint64_t result = mapping->processCallerRegisteredEntitlements(
+        TarnStatus registered = mapping->processCallerRegisteredEntitlements(
             *identity->entitlements().asDict(), identity->bundleIdentifier(),
             context.commandQueue.get());
-        if (result != TarnSuccess)
+        if (!registered.ok())
             TarnLog(kLogError, kGateTag, "Error processing entitlements for %@ : %llu",
-                    identity->bundleIdentifier(), result);
+                    identity->bundleIdentifier(), registered.code(TarnErrorDatabase));
     }
     return TarnClientConnection::initWithClientIdentity(
         identity, gate.entitled, gate.allowOtherIdLookup, gate.unrestricted, gate.lookup,

@@ -4,11 +4,8 @@
 
 #include <cstdio>
 #include <cstdlib>
-#include <exception>
-#include <typeinfo>
 
-#include "Daemon/TarnGlobalConfiguration.h"
-#include "Daemon/TarnRequestProcessor.h"
+#include "Daemon/TarnExceptionFence.h"
 #include "Platform/PlatformLog.h"
 
 namespace tarn {
@@ -77,8 +74,6 @@ constexpr const char* kDeleteAdvanceCopies = "DELETE FROM code_signing_info WHER
 constexpr int kPlaceholderBit = 1;
 constexpr int kAdvanceCopyBit = 2;
 
-bool isInternalBuild() { return TarnGlobalConfiguration::sharedInstance().isInternalImage(); }
-
 // The daemon cannot run without its database: open failures end the process.
 [[noreturn]] void stopDaemon(const char* message) {
     TarnLog(kLogError, "openDBWithURL", "%s", message);
@@ -91,6 +86,10 @@ bool isInternalBuild() { return TarnGlobalConfiguration::sharedInstance().isInte
 const char* textOrEmpty(const unsigned char* text) {
     return text ? reinterpret_cast<const char*>(text) : "";
 }
+
+TarnStatus statusOf(TarnErrorRef e) { return e ? TarnStatus(std::move(e)) : TarnStatus(); }
+
+bool isNotFound(const TarnErrorRef& e) { return e && e->code() == TarnErrorDatabaseNotFound; }
 
 }  // namespace
 
@@ -155,31 +154,28 @@ void TarnSQLiteDB::runStoreStepHook(const char* step) {
 
 // ---- exec and parameterised queries ----
 
-bool TarnSQLiteDB::_sqliteExec(const char* statement, TarnErrorRef* error) {
+TarnStatus TarnSQLiteDB::_sqliteExec(const char* statement) {
     char* message = nullptr;
     // A closed handle is refused here because sqlite3_exec does not check for it.
     int rc = db_ ? sqlite3_exec(db_, statement, nullptr, nullptr, &message) : SQLITE_MISUSE;
-    if (rc == SQLITE_OK) return true;
+    if (rc == SQLITE_OK) return {};
     TarnErrorRef e = TARN_ERROR(TarnErrorDatabase, nullptr, "%@ on %@ failed: %s", statement, url_,
                                 message ? message : errmsg());
     sqlite3_free(message);
-    if (error) *error = e;
-    return false;
+    return e;
 }
 
-bool TarnSQLiteDB::_performSingleParameterQuery(const char* query, const std::string& withTextInput,
-                                                TarnErrorRef* error) {
-    return _performTwoParameterQuery(query, withTextInput, nullptr, -1, error);
+TarnStatus TarnSQLiteDB::_performSingleParameterQuery(const char* query, const std::string& withTextInput) {
+    return _performTwoParameterQuery(query, withTextInput, nullptr, -1);
 }
 
-bool TarnSQLiteDB::_performSingleParameterQuery(const char* query, const std::string& withTextInput,
-                                                int expectedChanges, TarnErrorRef* error) {
-    return _performTwoParameterQuery(query, withTextInput, nullptr, expectedChanges, error);
+TarnStatus TarnSQLiteDB::_performSingleParameterQuery(const char* query, const std::string& withTextInput,
+                                                      int expectedChanges) {
+    return _performTwoParameterQuery(query, withTextInput, nullptr, expectedChanges);
 }
 
-bool TarnSQLiteDB::_performTwoParameterQuery(const char* query, const std::string& withTextInputOne,
-                                             const std::string* andTextInputTwo, int expectedChanges,
-                                             TarnErrorRef* error) {
+TarnStatus TarnSQLiteDB::_performTwoParameterQuery(const char* query, const std::string& withTextInputOne,
+                                                   const std::string* andTextInputTwo, int expectedChanges) {
     TarnErrorRef e;
     sqlite3_stmt* statement = nullptr;
     if (!db_ || sqlite3_prepare_v2(db_, query, -1, &statement, nullptr) != SQLITE_OK) {
@@ -205,16 +201,14 @@ bool TarnSQLiteDB::_performTwoParameterQuery(const char* query, const std::strin
         }
     }
     if (statement) finalize(statement);
-    if (e && error) *error = e;
-    return !e;
+    return statusOf(std::move(e));
 }
 
 // ---- store ----
 
-bool TarnSQLiteDB::_performInsertOrUpdateQuery(const char* query,
-                                               const TarnCodeSigningEntry& withCodeSigningEntry,
-                                               const std::string& forIdentifier, bool isUpdate,
-                                               TarnErrorRef* error) {
+TarnStatus TarnSQLiteDB::_performInsertOrUpdateQuery(const char* query,
+                                                     const TarnCodeSigningEntry& withCodeSigningEntry,
+                                                     const std::string& forIdentifier, bool isUpdate) {
     const TarnCodeSigningEntry& entry = withCodeSigningEntry;
     const int invalid = entry.invalid() ? 1 : 0;
     const int flags = (entry.placeholder() ? kPlaceholderBit : 0) | (entry.advanceCopy() ? kAdvanceCopyBit : 0);
@@ -256,41 +250,31 @@ bool TarnSQLiteDB::_performInsertOrUpdateQuery(const char* query,
         }
     }
     if (statement) finalize(statement);
-    if (e && error) *error = e;
-    return !e;
+    return statusOf(std::move(e));
 }
 
-bool TarnSQLiteDB::_insertCodeSigningInfo(const TarnCodeSigningEntry& info, const std::string& forIdentifier,
-                                          TarnErrorRef* error) {
-    TarnErrorRef updateError;
-    if (_performInsertOrUpdateQuery(kUpdateFlags, info, forIdentifier, true, &updateError)) return true;
-    if (updateError->code() != TarnErrorDatabaseUnexpectedChanges) {
-        if (error) {
-            *error = TARN_ERROR(TarnErrorDatabase, updateError, "Error performing UPDATE operation for %@",
-                                forIdentifier);
-        }
-        return false;
+TarnStatus TarnSQLiteDB::_insertCodeSigningInfo(const TarnCodeSigningEntry& info,
+                                                const std::string& forIdentifier) {
+    TarnStatus updated = _performInsertOrUpdateQuery(kUpdateFlags, info, forIdentifier, /*isUpdate=*/true);
+    if (updated.ok()) return {};
+    if (updated.error()->code() != TarnErrorDatabaseUnexpectedChanges) {
+        return TARN_ERROR(TarnErrorDatabase, updated.error(), "Error performing UPDATE operation for %@",
+                          forIdentifier);
     }
-    TarnErrorRef insertError;
-    if (_performInsertOrUpdateQuery(kInsertFlags, info, forIdentifier, false, &insertError)) return true;
-    if (error) {
-        *error = TARN_ERROR(TarnErrorDatabase, insertError, "Error performing INSERT operation for %@",
-                            forIdentifier);
-    }
-    return false;
+    TarnStatus inserted = _performInsertOrUpdateQuery(kInsertFlags, info, forIdentifier, /*isUpdate=*/false);
+    if (inserted.ok()) return {};
+    return TARN_ERROR(TarnErrorDatabase, inserted.error(), "Error performing INSERT operation for %@",
+                      forIdentifier);
 }
 
-bool TarnSQLiteDB::_insertCodeSigningData(const TarnCodeSigningEntry& data, const std::string& forIdentifier,
-                                          TarnErrorRef* error) {
+TarnStatus TarnSQLiteDB::_insertCodeSigningData(const TarnCodeSigningEntry& data,
+                                                const std::string& forIdentifier) {
     std::vector<uint8_t> blob;
     if (data.codeSigningInfo()) blob = PlistValue(*data.codeSigningInfo()).toBinary();
     if (blob.empty()) {
         std::optional<PlistValue> info;
         if (data.codeSigningInfo()) info = PlistValue(*data.codeSigningInfo());
-        TarnErrorRef e = TARN_ERROR(TarnErrorDatabase, nullptr, "Error creating data from code signing info: %@",
-                                    info);
-        if (error) *error = e;
-        return false;
+        return TARN_ERROR(TarnErrorDatabase, nullptr, "Error creating data from code signing info: %@", info);
     }
 
     TarnErrorRef e;
@@ -310,113 +294,91 @@ bool TarnSQLiteDB::_insertCodeSigningData(const TarnCodeSigningEntry& data, cons
         e = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_step for %@ failed: %s", url_, errmsg());
     }
     if (statement) finalize(statement);
-    if (e && error) *error = e;
-    return !e;
+    return statusOf(std::move(e));
 }
 
-bool TarnSQLiteDB::_insertChildIdentifier(const std::string& childIdentifier,
-                                          const std::string& forParentIdentifier, TarnErrorRef* error) {
-    TarnErrorRef e;
-    if (_performTwoParameterQuery(kAddChild, childIdentifier, &forParentIdentifier, -1, &e)) return true;
-    if (error) {
-        *error = TARN_ERROR(TarnErrorDatabase, e, "Error performing INSERT operation for child %@",
-                            childIdentifier);
-    }
-    return false;
+TarnStatus TarnSQLiteDB::_insertChildIdentifier(const std::string& childIdentifier,
+                                                const std::string& forParentIdentifier) {
+    TarnStatus added = _performTwoParameterQuery(kAddChild, childIdentifier, &forParentIdentifier, -1);
+    if (added.ok()) return {};
+    return TARN_ERROR(TarnErrorDatabase, added.error(), "Error performing INSERT operation for child %@",
+                      childIdentifier);
 }
 
 TarnErrorRef TarnSQLiteDB::rollbackAfter(TarnErrorRef cause) {
-    TarnErrorRef rollbackError;
-    if (_sqliteExec("ROLLBACK;", &rollbackError)) return cause;
+    if (_sqliteExec("ROLLBACK;").ok()) return cause;
     return TARN_ERROR(TarnErrorDatabase, cause, "failed _sqliteExec rollback");
 }
 
-TarnErrorRef TarnSQLiteDB::commitTransaction() {
-    TarnErrorRef execError;
-    if (_sqliteExec("COMMIT;", &execError)) return nullptr;
-    TarnErrorRef e = TARN_ERROR(TarnErrorDatabase, execError, "failed _sqliteExec commit");
+TarnStatus TarnSQLiteDB::commitTransaction() {
+    TarnStatus committed = _sqliteExec("COMMIT;");
+    if (committed.ok()) return {};
+    TarnErrorRef e = TARN_ERROR(TarnErrorDatabase, committed.error(), "failed _sqliteExec commit");
     // A failed COMMIT can leave the transaction open; close it so the next
     // BEGIN does not fail too.
     if (db_ && !sqlite3_get_autocommit(db_)) e = rollbackAfter(e);
     return e;
 }
 
-TarnErrorRef TarnSQLiteDB::handleTransactionException(const char* operation,
-                                                      const std::exception* exception) {
-    // The daemon's own report on internal builds, with its crash message slot.
-    if (isInternalBuild()) TarnFatalExceptionReport(exception);
-    TarnErrorRef e = TARN_ERROR_IN(operation, TarnErrorException, nullptr, "Got exception: %@ : %@",
-                                   exception ? typeid(*exception).name() : "unknown exception",
-                                   exception ? exception->what() : "");
-    // Only an open transaction can be rolled back; the failure may have hit
-    // before BEGIN took effect or after COMMIT.
-    if (db_ && !sqlite3_get_autocommit(db_)) {
-        TarnErrorRef rollbackError;
+template <class Body>
+TarnStatus TarnSQLiteDB::inTransaction(const char* operation, Body&& body) {
+    if (TarnStatus begun = _sqliteExec("BEGIN;"); !begun.ok())
+        return TARN_ERROR_IN(operation, TarnErrorDatabase, begun.error(), "failed _sqliteExec begin");
+    bool ended = false;  // the transaction was committed or rolled back without an exception
+    TarnStatus status = TarnFenceExceptions(operation, [&]() -> TarnStatus {
+        TarnStatus done = body();
+        if (!done.ok()) {
+            TarnErrorRef e = rollbackAfter(done.error());
+            ended = true;
+            return e;
+        }
+        runStoreStepHook("commit");
+        TarnStatus committed = commitTransaction();
+        ended = true;
+        return committed;
+    });
+    // Only an open transaction can be rolled back; the exception may have hit
+    // after COMMIT or a ROLLBACK took effect.
+    if (!ended && db_ && !sqlite3_get_autocommit(db_)) {
         // The operation fails with 40 either way; the exec already logged.
-        (void)_sqliteExec("ROLLBACK;", &rollbackError);
+        (void)_sqliteExec("ROLLBACK;");
     }
-    return e;
+    return status;
 }
 
-bool TarnSQLiteDB::addCodeSigningEntry(const TarnCodeSigningEntryRef& codeSigningEntry,
-                                       const std::string& withIdentifier, TarnErrorRef* error) {
+TarnStatus TarnSQLiteDB::addCodeSigningEntry(const TarnCodeSigningEntryRef& codeSigningEntry,
+                                             const std::string& withIdentifier) {
     if (!codeSigningEntry || withIdentifier.empty()) {
-        TarnErrorRef e = TARN_ERROR(TarnErrorBadInput, nullptr, "codeSigningEntry %@ and identifier %@ cannot be nil",
-                                    codeSigningEntry, withIdentifier.empty() ? "(null)" : withIdentifier);
-        if (error) *error = e;
-        return false;
+        return TARN_ERROR(TarnErrorBadInput, nullptr, "codeSigningEntry %@ and identifier %@ cannot be nil",
+                          codeSigningEntry, withIdentifier.empty() ? "(null)" : withIdentifier);
     }
-    TarnErrorRef execError;
-    if (!_sqliteExec("BEGIN;", &execError)) {
-        TarnErrorRef e = TARN_ERROR(TarnErrorDatabase, execError, "failed _sqliteExec begin");
-        if (error) *error = e;
-        return false;
-    }
-
-    TarnErrorRef e;
-    try {
+    return inTransaction("addCodeSigningEntry", [&]() -> TarnStatus {
         runStoreStepHook("info");
-        if (!_insertCodeSigningInfo(*codeSigningEntry, withIdentifier, &e)) {
-            e = rollbackAfter(e);
-        } else {
-            runStoreStepHook("data");
-            if (!_insertCodeSigningData(*codeSigningEntry, withIdentifier, &e)) {
-                e = rollbackAfter(e);
-            } else {
-                runStoreStepHook("children");
-                for (const std::string& child : codeSigningEntry->childBundleIdentifiers()) {
-                    TarnErrorRef childError;
-                    // A child that cannot be recorded must not cost the parent its entry.
-                    (void)_insertChildIdentifier(child, withIdentifier, &childError);
-                }
-                runStoreStepHook("commit");
-                e = commitTransaction();
-            }
+        TARN_TRY(_insertCodeSigningInfo(*codeSigningEntry, withIdentifier));
+        runStoreStepHook("data");
+        TARN_TRY(_insertCodeSigningData(*codeSigningEntry, withIdentifier));
+        runStoreStepHook("children");
+        for (const std::string& child : codeSigningEntry->childBundleIdentifiers()) {
+            // A child that cannot be recorded must not cost the parent its entry.
+            (void)_insertChildIdentifier(child, withIdentifier);
         }
-    } catch (const std::exception& ex) {
-        e = handleTransactionException("addCodeSigningEntry", &ex);
-    } catch (...) {
-        e = handleTransactionException("addCodeSigningEntry", nullptr);
-    }
-    if (e && error) *error = e;
-    return !e;
+        return {};
+    });
 }
 
 // ---- reads ----
 
-std::shared_ptr<TarnCodeSigningEntry> TarnSQLiteDB::_codeSigningEntryFromStatementRow(sqlite3_stmt* statement,
-                                                                                      TarnErrorRef* error) {
+TarnResult<std::shared_ptr<TarnCodeSigningEntry>> TarnSQLiteDB::_codeSigningEntryFromStatementRow(
+    sqlite3_stmt* statement) {
     const void* blob = sqlite3_column_blob(statement, 0);
     const int length = sqlite3_column_bytes(statement, 0);
     if (!blob || length <= 0) {
-        if (error) *error = TARN_ERROR(TarnErrorDatabase, nullptr, "Failed to create code signing entry from statement row");
-        return nullptr;
+        return TARN_ERROR(TarnErrorDatabase, nullptr, "Failed to create code signing entry from statement row");
     }
     std::optional<PlistValue> parsed;
     if (static_cast<size_t>(length) <= kMaxPlistBytes) parsed = PlistValue::fromBytes(blob, static_cast<size_t>(length));
     if (!parsed || !parsed->isDict()) {
-        if (error) *error = TARN_ERROR(TarnErrorDatabase, nullptr, "Error formatting info data from DB");
-        return nullptr;
+        return TARN_ERROR(TarnErrorDatabase, nullptr, "Error formatting info data from DB");
     }
     auto entry = std::make_shared<TarnCodeSigningEntry>(std::move(*parsed->asDict()));
     entry->setInvalid(sqlite3_column_int(statement, 1) != 0);
@@ -428,8 +390,8 @@ std::shared_ptr<TarnCodeSigningEntry> TarnSQLiteDB::_codeSigningEntryFromStateme
     return entry;
 }
 
-std::shared_ptr<TarnCodeSigningEntry> TarnSQLiteDB::_selectCodeSigningEntryWithIdentifier(
-    const std::string& identifier, TarnErrorRef* error) {
+TarnResult<std::shared_ptr<TarnCodeSigningEntry>> TarnSQLiteDB::_selectCodeSigningEntryWithIdentifier(
+    const std::string& identifier) {
     TarnErrorRef e;
     std::shared_ptr<TarnCodeSigningEntry> entry;
     // Every request that checks entitlements asks this: the statement is
@@ -447,7 +409,12 @@ std::shared_ptr<TarnCodeSigningEntry> TarnSQLiteDB::_selectCodeSigningEntryWithI
     } else {
         int rc = sqlite3_step(statement);
         if (rc == SQLITE_ROW) {
-            entry = _codeSigningEntryFromStatementRow(statement, &e);
+            TarnResult<std::shared_ptr<TarnCodeSigningEntry>> decoded =
+                _codeSigningEntryFromStatementRow(statement);
+            if (decoded.ok())
+                entry = std::move(*decoded);
+            else
+                e = decoded.error();
         } else if (rc != SQLITE_DONE) {
             e = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_step for %@ failed: %s", url_, errmsg());
         }
@@ -457,38 +424,36 @@ std::shared_ptr<TarnCodeSigningEntry> TarnSQLiteDB::_selectCodeSigningEntryWithI
         sqlite3_reset(statement);
         sqlite3_clear_bindings(statement);
     }
-    if (e && error) *error = e;
+    if (e) return e;
     return entry;
 }
 
-TarnCodeSigningEntryRef TarnSQLiteDB::codeSigningEntryWithIdentifier(const std::string& identifier,
-                                                                     TarnErrorRef* error) {
-    TarnErrorRef e;
-    std::shared_ptr<TarnCodeSigningEntry> entry = _selectCodeSigningEntryWithIdentifier(identifier, &e);
+TarnResult<TarnCodeSigningEntryRef> TarnSQLiteDB::codeSigningEntryWithIdentifier(const std::string& identifier) {
+    TarnResult<std::shared_ptr<TarnCodeSigningEntry>> selected =
+        _selectCodeSigningEntryWithIdentifier(identifier);
+    if (!selected.ok()) {
+        TarnLog(kLogError, "codeSigningEntryWithIdentifier", "Error retrieving code signing entry: %@",
+                selected.error());
+        return selected.error();
+    }
+    std::shared_ptr<TarnCodeSigningEntry>& entry = *selected;
     if (!entry) {
-        if (!e) {
-            // Silent: a missing entry is an everyday answer, not a fault.
-            e = TARN_ERROR_SILENT(TarnErrorDatabaseNotFound, nullptr, "Identifier: \"%@\" Not Found in DB",
-                                  identifier);
-        } else {
-            TarnLog(kLogError, "codeSigningEntryWithIdentifier", "Error retrieving code signing entry: %@", e);
-        }
-        if (error) *error = e;
-        return nullptr;
+        // Silent: a missing entry is an everyday answer, not a fault.
+        return TARN_ERROR_SILENT(TarnErrorDatabaseNotFound, nullptr, "Identifier: \"%@\" Not Found in DB",
+                                 identifier);
     }
-    TarnErrorRef childError;
-    std::vector<std::string> children = childIdentifiersForParentIdentifier(identifier, &childError);
-    if (!children.empty()) {
-        entry->setChildBundleIdentifiers(std::move(children));
-    } else if (childError && childError->code() != TarnErrorDatabaseNotFound) {
-        TarnLog(kLogError, "codeSigningEntryWithIdentifier", "Error retrieving childBundleIds: %@", childError);
-        if (error) *error = childError;
-        return nullptr;
+    TarnResult<std::vector<std::string>> children = childIdentifiersForParentIdentifier(identifier);
+    if (children.ok()) {
+        entry->setChildBundleIdentifiers(std::move(*children));
+    } else if (!isNotFound(children.error())) {
+        TarnLog(kLogError, "codeSigningEntryWithIdentifier", "Error retrieving childBundleIds: %@",
+                children.error());
+        return children.error();
     }
-    return entry;
+    return TarnCodeSigningEntryRef(std::move(entry));
 }
 
-TarnErrorRef TarnSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(const EntryBlock& block) {
+TarnStatus TarnSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(const EntryBlock& block) {
     TarnErrorRef lastError;
     sqlite3_stmt* statement = nullptr;
     if (!db_ || sqlite3_prepare_v2(db_, kSelectAllEntries, -1, &statement, nullptr) != SQLITE_OK) {
@@ -506,33 +471,33 @@ TarnErrorRef TarnSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(cons
         }
         // Everything made for this row lives in this scope only, so memory
         // stays flat however many rows there are.
-        TarnErrorRef rowError;
-        std::shared_ptr<TarnCodeSigningEntry> entry = _codeSigningEntryFromStatementRow(statement, &rowError);
-        if (!entry) {
-            lastError = rowError;
+        TarnResult<std::shared_ptr<TarnCodeSigningEntry>> decoded = _codeSigningEntryFromStatementRow(statement);
+        if (!decoded.ok()) {
+            lastError = decoded.error();
             continue;
         }
+        std::shared_ptr<TarnCodeSigningEntry>& entry = *decoded;
         const unsigned char* text = sqlite3_column_text(statement, 5);
         if (!text) {
             lastError = TARN_ERROR(TarnErrorDatabase, nullptr, "Error retrieving code_signing_id_text from DB");
             continue;
         }
         std::string identifier(textOrEmpty(text));
-        TarnErrorRef childError;
-        std::vector<std::string> children = childIdentifiersForParentIdentifier(identifier, &childError);
-        if (!children.empty()) {
-            entry->setChildBundleIdentifiers(std::move(children));
-        } else if (childError && childError->code() != TarnErrorDatabaseNotFound) {
-            lastError = TARN_ERROR(TarnErrorDatabase, childError, "Error retrieving childBundleIds: %@", childError);
+        TarnResult<std::vector<std::string>> children = childIdentifiersForParentIdentifier(identifier);
+        if (children.ok()) {
+            entry->setChildBundleIdentifiers(std::move(*children));
+        } else if (!isNotFound(children.error())) {
+            lastError = TARN_ERROR(TarnErrorDatabase, children.error(), "Error retrieving childBundleIds: %@",
+                                   children.error());
             continue;
         }
         block(identifier, entry);
     }
     finalize(statement);
-    return lastError;
+    return statusOf(std::move(lastError));
 }
 
-std::set<std::string> TarnSQLiteDB::identifiersWithError(TarnErrorRef* error) {
+TarnResult<std::set<std::string>> TarnSQLiteDB::identifiersWithError() {
     std::set<std::string> identifiers;
     TarnErrorRef lastError;
     sqlite3_stmt* statement = nullptr;
@@ -556,12 +521,12 @@ std::set<std::string> TarnSQLiteDB::identifiersWithError(TarnErrorRef* error) {
         }
     }
     if (statement) finalize(statement);
-    if (identifiers.empty() && lastError && error) *error = lastError;
+    if (identifiers.empty() && lastError) return lastError;
     return identifiers;
 }
 
-std::vector<std::string> TarnSQLiteDB::childIdentifiersForParentIdentifier(const std::string& identifier,
-                                                                          TarnErrorRef* error) {
+TarnResult<std::vector<std::string>> TarnSQLiteDB::childIdentifiersForParentIdentifier(
+    const std::string& identifier) {
     std::vector<std::string> children;
     TarnErrorRef e;
     sqlite3_stmt* statement = nullptr;
@@ -589,11 +554,11 @@ std::vector<std::string> TarnSQLiteDB::childIdentifiersForParentIdentifier(const
         }
     }
     if (statement) finalize(statement);
-    if (e && error) *error = e;
+    if (e) return e;
     return children;
 }
 
-std::string TarnSQLiteDB::parentIdentifierForChildIdentifier(const std::string& identifier, TarnErrorRef* error) {
+TarnResult<std::string> TarnSQLiteDB::parentIdentifierForChildIdentifier(const std::string& identifier) {
     std::string parent;
     bool found = false;
     TarnErrorRef e;
@@ -624,82 +589,59 @@ std::string TarnSQLiteDB::parentIdentifierForChildIdentifier(const std::string& 
         }
     }
     if (statement) finalize(statement);
-    if (e) {
-        parent.clear();
-        if (error) *error = e;
-    }
+    if (e) return e;
     return parent;
 }
 
 // ---- invalidation and deletion ----
 
-bool TarnSQLiteDB::invalidateCodeSigningWithIdentifier(const std::string& identifier, TarnErrorRef* error) {
-    TarnErrorRef e;
-    if (_performSingleParameterQuery(kInvalidate, identifier, &e)) return true;
-    if (error) *error = TARN_ERROR(TarnErrorDatabase, e, "failed to invalidate identifier %@", identifier);
-    return false;
+TarnStatus TarnSQLiteDB::invalidateCodeSigningWithIdentifier(const std::string& identifier) {
+    TarnStatus updated = _performSingleParameterQuery(kInvalidate, identifier);
+    if (updated.ok()) return {};
+    return TARN_ERROR(TarnErrorDatabase, updated.error(), "failed to invalidate identifier %@", identifier);
 }
 
-bool TarnSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier,
-                                                                    TarnErrorRef* error) {
-    TarnErrorRef childError;
-    std::vector<std::string> identifiers = childIdentifiersForParentIdentifier(identifier, &childError);
-    if (identifiers.empty() && childError && childError->code() != TarnErrorDatabaseNotFound) {
-        TarnErrorRef e = TARN_ERROR(TarnErrorDatabase, childError,
-                                    "Error retrieving child bundles ids from DB with identifier %@ : %@",
-                                    identifier, childError);
-        if (error) *error = e;
-        return false;
+TarnStatus TarnSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier) {
+    TarnResult<std::vector<std::string>> children = childIdentifiersForParentIdentifier(identifier);
+    if (!children.ok() && !isNotFound(children.error())) {
+        return TARN_ERROR(TarnErrorDatabase, children.error(),
+                          "Error retrieving child bundles ids from DB with identifier %@ : %@", identifier,
+                          children.error());
     }
+    std::vector<std::string> identifiers;
+    if (children.ok()) identifiers = std::move(*children);
     identifiers.insert(identifiers.begin(), identifier);
 
-    TarnErrorRef execError;
-    if (!_sqliteExec("BEGIN;", &execError)) {
-        TarnErrorRef e = TARN_ERROR(TarnErrorDatabase, execError, "failed _sqliteExec begin");
-        if (error) *error = e;
-        return false;
-    }
-    TarnErrorRef e;
-    try {
+    return inTransaction("invalidateCodeSigningForIdentifierAndAllChildren", [&]() -> TarnStatus {
         for (const std::string& child : identifiers) {
-            TarnErrorRef invalidateError;
-            if (!invalidateCodeSigningWithIdentifier(child, &invalidateError)) {
+            TarnStatus invalidated = invalidateCodeSigningWithIdentifier(child);
+            if (!invalidated.ok()) {
                 TarnLog(kLogError, "invalidateCodeSigningForIdentifierAndAllChildren",
                         "Failed to invalidate code signing info for %@ child %@ : %@", identifier, child,
-                        invalidateError);
+                        invalidated.error());
             } else {
                 TarnLog(kLogDebug, "invalidateCodeSigningForIdentifierAndAllChildren",
                         "Invalidating code signing info for %@ child: %@", identifier, child);
             }
         }
-        runStoreStepHook("commit");
-        e = commitTransaction();
-    } catch (const std::exception& ex) {
-        e = handleTransactionException("invalidateCodeSigningForIdentifierAndAllChildren", &ex);
-    } catch (...) {
-        e = handleTransactionException("invalidateCodeSigningForIdentifierAndAllChildren", nullptr);
-    }
-    if (e && error) *error = e;
-    return !e;
+        return {};
+    });
 }
 
-bool TarnSQLiteDB::_deleteCodeSigningWithIdentifier(const std::string& identifier, TarnErrorRef* error) {
-    return _performSingleParameterQuery(kDeleteEntry, identifier, 1, error);
+TarnStatus TarnSQLiteDB::_deleteCodeSigningWithIdentifier(const std::string& identifier) {
+    return _performSingleParameterQuery(kDeleteEntry, identifier, 1);
 }
 
-bool TarnSQLiteDB::deleteCodeSigningEntryWithIdentifier(const std::string& identifier, TarnErrorRef* error) {
+TarnStatus TarnSQLiteDB::deleteCodeSigningEntryWithIdentifier(const std::string& identifier) {
     if (identifier.empty()) {
-        TarnErrorRef e = TARN_ERROR(TarnErrorBadInput, nullptr, "identifier %@ cannot be nil", "(null)");
-        if (error) *error = e;
-        return false;
+        return TARN_ERROR(TarnErrorBadInput, nullptr, "identifier %@ cannot be nil", "(null)");
     }
-    TarnErrorRef e;
-    if (_deleteCodeSigningWithIdentifier(identifier, &e)) return true;
-    if (error) *error = TARN_ERROR(TarnErrorDatabase, e, "failed to delete from code_signing_info");
-    return false;
+    TarnStatus deleted = _deleteCodeSigningWithIdentifier(identifier);
+    if (deleted.ok()) return {};
+    return TARN_ERROR(TarnErrorDatabase, deleted.error(), "failed to delete from code_signing_info");
 }
 
-bool TarnSQLiteDB::deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(TarnErrorRef* error) {
+TarnStatus TarnSQLiteDB::deleteAllAdvanceCopiesOfCodeSigningEntriesWithError() {
     TarnErrorRef e;
     sqlite3_stmt* statement = nullptr;
     if (!db_ || sqlite3_prepare_v2(db_, kDeleteAdvanceCopies, -1, &statement, nullptr) != SQLITE_OK) {
@@ -714,8 +656,7 @@ bool TarnSQLiteDB::deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(TarnError
                 "Deleted %d advance copies of code signing info.", deleted);
     }
     if (statement) finalize(statement);
-    if (e && error) *error = e;
-    return !e;
+    return statusOf(std::move(e));
 }
 
 }  // namespace tarn

@@ -45,18 +45,18 @@ std::optional<uint32_t> storedUInt32(const PlistValue* v) {
     return static_cast<uint32_t>(*u);
 }
 
-bool readNumber(const PlistValue& plist, const char* key, uint32_t* out, uint64_t* error) {
+// The lines of the readers below are their reports: the error values are
+// silent, so that nothing is logged twice.
+TarnResult<uint32_t> readNumber(const PlistValue& plist, const char* key) {
     const PlistValue* v = plist.find(key);
     auto n = storedUInt32(v);
     if (!n) {
         TarnLog(kLogError, "initWithPlist",
                 "Invalid user identity plist data. Expected number for %@, got %@. Data: %@", key,
                 valueKindName(v), plist);
-        TarnSetError(error, TarnErrorInvalidUserIdentityData);
-        return false;
+        return TARN_ERROR_CODE_IN("initWithPlist", TarnErrorInvalidUserIdentityData, nullptr);
     }
-    *out = *n;
-    return true;
+    return *n;
 }
 
 }  // namespace
@@ -139,10 +139,9 @@ PlistValue TarnUserIdentity::plist() const {
     return PlistValue(std::move(d));
 }
 
-TarnUserIdentityRef TarnUserIdentity::userIdentityWithPlist(const PlistValue& plist,
-                                                            TarnUserIdentityCache& cache,
-                                                            uint64_t* error) {
-    return initWithPlist(plist, cache, error);
+TarnResult<TarnUserIdentityRef> TarnUserIdentity::userIdentityWithPlist(const PlistValue& plist,
+                                                                        TarnUserIdentityCache& cache) {
+    return initWithPlist(plist, cache);
 }
 
 bool TarnUserIdentity::userIdentityWithEntries(const PlistEntries& entries,
@@ -166,39 +165,34 @@ bool TarnUserIdentity::userIdentityWithEntries(const PlistEntries& entries,
     return true;
 }
 
-TarnUserIdentityRef TarnUserIdentity::initWithPlist(const PlistValue& plist,
-                                                    TarnUserIdentityCache& cache, uint64_t* error) {
+TarnResult<TarnUserIdentityRef> TarnUserIdentity::initWithPlist(const PlistValue& plist,
+                                                                TarnUserIdentityCache& cache) {
     const PlistValue* version = plist.isDict() ? plist.find("version") : nullptr;
     const std::string* versionString = version ? version->asString() : nullptr;
     if (versionString && *versionString == "2") {
-        return initWithVersion2PlistDictionary(plist, cache, error);
+        return initWithVersion2PlistDictionary(plist, cache);
     }
     if (versionString && *versionString == "1") {
-        return initWithVersion1PlistDictionary(plist, cache, error);
+        return initWithVersion1PlistDictionary(plist, cache);
     }
     // Neither reader applies (not a dictionary, or an unknown or non-string
     // version): the data is not a stored identity we can trust.
     TarnLog(kLogError, "initWithPlist",
             "Invalid user identity plist data. Unknown version %@. Data: %@",
             valueDescription(version), plist);
-    TarnSetError(error, TarnErrorInvalidUserIdentityData);
-    return nullptr;
+    return TARN_ERROR_CODE(TarnErrorInvalidUserIdentityData, nullptr);
 }
 
-TarnUserIdentityRef TarnUserIdentity::initWithVersion2PlistDictionary(const PlistValue& plist,
-                                                                      TarnUserIdentityCache& cache,
-                                                                      uint64_t* error) {
-    uint32_t uid = 0, gid = 0, type = 0;
-    if (!readNumber(plist, "posixUID", &uid, error) || !readNumber(plist, "posixGID", &gid, error) ||
-        !readNumber(plist, "type", &type, error)) {
-        return nullptr;
-    }
+TarnResult<TarnUserIdentityRef> TarnUserIdentity::initWithVersion2PlistDictionary(
+    const PlistValue& plist, TarnUserIdentityCache& cache) {
+    const uint32_t uid = TARN_TRY(readNumber(plist, "posixUID"));
+    const uint32_t gid = TARN_TRY(readNumber(plist, "posixGID"));
+    const uint32_t type = TARN_TRY(readNumber(plist, "type"));
     if (type > TarnPersonaTypeUnspecific) {
         TarnLog(kLogError, "initWithVersion2PlistDictionary",
                 "Invalid user identity plist data. Expected persona type for %@, got %@. Data: %@",
                 "type", valueDescription(plist.find("type")), plist);
-        TarnSetError(error, TarnErrorInvalidUserIdentityData);
-        return nullptr;
+        return TARN_ERROR_CODE(TarnErrorInvalidUserIdentityData, nullptr);
     }
     const PlistValue* unique = plist.find("personaUniqueString");
     const std::string* uniqueString = unique ? unique->asString() : nullptr;
@@ -214,23 +208,20 @@ TarnUserIdentityRef TarnUserIdentity::initWithVersion2PlistDictionary(const Plis
     } else {
         result = cache.userIdentityForPersonalPersonaWithUID(uid, gid);
     }
-    if (!result) TarnSetError(error, TarnSuccess);
+    // Empty when the cache knows no such identity: no failure of the data.
     return result;
 }
 
-TarnUserIdentityRef TarnUserIdentity::initWithVersion1PlistDictionary(const PlistValue& plist,
-                                                                      TarnUserIdentityCache& cache,
-                                                                      uint64_t* error) {
-    uint32_t uid = 0, gid = 0;
-    if (!readNumber(plist, "posixUID", &uid, error) || !readNumber(plist, "posixGID", &gid, error)) {
-        return nullptr;
-    }
+TarnResult<TarnUserIdentityRef> TarnUserIdentity::initWithVersion1PlistDictionary(
+    const PlistValue& plist, TarnUserIdentityCache& cache) {
+    const uint32_t uid = TARN_TRY(readNumber(plist, "posixUID"));
+    const uint32_t gid = TARN_TRY(readNumber(plist, "posixGID"));
     const PlistValue* persona = plist.find("personaIdentifier");
     const std::string* personaString = persona ? persona->asString() : nullptr;
     TarnUserIdentityRef result;
     if (personaString) result = cache.userIdentityForPersonaUniqueString(*personaString, uid, gid);
     if (!result) result = cache.userIdentityForPersonalPersonaWithUID(uid, gid);
-    if (!result) TarnSetError(error, TarnSuccess);
+    // Empty when the cache knows no such identity: no failure of the data.
     return result;
 }
 

@@ -22,6 +22,7 @@
 #include <unordered_set>
 
 #include "Daemon/TarnContainerClass.h"
+#include "Daemon/TarnResult.h"
 #include "Platform/Path.h"
 #include "Platform/PropertyList.h"
 
@@ -66,27 +67,25 @@ public:
     static TarnUserIdentityRef init();
 
     // Reads a stored identity against `cache` (versions "1" and "2").
-    // nullptr with *error = 75 for malformed data; nullptr with *error left at
-    // TarnSuccess (1) when well-formed data names no identity the cache knows.
-    static TarnUserIdentityRef userIdentityWithPlist(const PlistValue& plist,
-                                                     TarnUserIdentityCache& cache,
-                                                     uint64_t* error);
+    // Malformed data fails with 75 (the line saying why is logged, the error
+    // value is silent); well-formed data that names no identity the cache
+    // knows is a success holding an empty ref.
+    static TarnResult<TarnUserIdentityRef> userIdentityWithPlist(const PlistValue& plist,
+                                                                 TarnUserIdentityCache& cache);
     // The common case of userIdentityWithPlist() for a stored identity whose
     // entries were decoded as a list (a metadata rebuild): a well-formed
     // version-2 identity that is not enterprise, answered as that would
-    // (nullptr when the cache knows none; its code would be TarnSuccess).
+    // (nullptr when the cache knows none, which is no failure there either).
     // False, with *identity untouched, for anything else: the caller then
     // asks userIdentityWithPlist(), which reads or reports it.
     static bool userIdentityWithEntries(const PlistEntries& entries, TarnUserIdentityCache& cache,
                                         TarnUserIdentityRef* identity);
-    static TarnUserIdentityRef initWithPlist(const PlistValue& plist, TarnUserIdentityCache& cache,
-                                             uint64_t* error);
-    static TarnUserIdentityRef initWithVersion1PlistDictionary(const PlistValue& plist,
-                                                               TarnUserIdentityCache& cache,
-                                                               uint64_t* error);
-    static TarnUserIdentityRef initWithVersion2PlistDictionary(const PlistValue& plist,
-                                                               TarnUserIdentityCache& cache,
-                                                               uint64_t* error);
+    static TarnResult<TarnUserIdentityRef> initWithPlist(const PlistValue& plist,
+                                                         TarnUserIdentityCache& cache);
+    static TarnResult<TarnUserIdentityRef> initWithVersion1PlistDictionary(
+        const PlistValue& plist, TarnUserIdentityCache& cache);
+    static TarnResult<TarnUserIdentityRef> initWithVersion2PlistDictionary(
+        const PlistValue& plist, TarnUserIdentityCache& cache);
 
     // Version-2 dictionary: "posixUID", "posixGID", "type", "version" = "2",
     // and "personaUniqueString" when present.

@@ -68,18 +68,19 @@ Result runStore(const fs::path& path, const std::vector<tarn::TarnCodeSigningEnt
     tarn::TarnSQLiteDB db(path.string());
     auto start = Clock::now();
     for (size_t i = 0; i < entries.size(); ++i) {
-        tarn::TarnErrorRef e;
-        if (!db.addCodeSigningEntry(entries[i], identifier(i), &e)) {
-            std::fprintf(stderr, "store failed: %s\n", e->description().c_str());
+        tarn::TarnStatus stored = db.addCodeSigningEntry(entries[i], identifier(i));
+        if (!stored.ok()) {
+            std::fprintf(stderr, "store failed: %s\n", stored.error()->description().c_str());
             std::exit(1);
         }
     }
     r.upsertOps = opsPerSecond(entries.size(), Clock::now() - start);
     start = Clock::now();
     for (size_t i = 0; i < entries.size(); ++i) {
-        tarn::TarnErrorRef e;
-        if (!db.codeSigningEntryWithIdentifier(identifier(i), &e)) {
-            std::fprintf(stderr, "read failed: %s\n", e->description().c_str());
+        tarn::TarnResult<tarn::TarnCodeSigningEntryRef> read =
+            db.codeSigningEntryWithIdentifier(identifier(i));
+        if (!read.ok()) {
+            std::fprintf(stderr, "read failed: %s\n", read.error()->description().c_str());
             std::exit(1);
         }
     }

@@ -101,7 +101,8 @@ int main(int argc, char** argv) {
         stdfs::create_directories(dir);
         std::string identifier = "com.bench.app" + std::to_string(i);
         auto identity = tarn::TarnConcreteContainerIdentity::containerIdentityWithUUID(
-            uuid, user, identifier, 2, nullptr);
+                            uuid, user, identifier, 2)
+                            .value();
         auto m = tarn::TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir,
                                                                std::nullopt);
         if (!m->writeMetadataToDiskWithError(nullptr)) return 1;
@@ -112,8 +113,9 @@ int main(int argc, char** argv) {
     tarn::FileSandboxUserState state(tarn::FileSandboxUserState::defaultDirectory());
     auto& identities = tarn::TarnUserIdentitySharedCache::sharedInstance();
     auto probe = [&](tarn::TarnContainerCache& cache, size_t i) {
-        auto identity = tarn::TarnContainerIdentity::containerIdentityWithUserIdentity(
-            user, identifiers[i], 2, nullptr);
+        auto identity =
+            tarn::TarnContainerIdentity::containerIdentityWithUserIdentity(user, identifiers[i], 2)
+                .value();
         tarn::TarnErrorRef error;
         // No kernel read-back: this measures the scan.
         return cache.containerForContainerIdentity(identity, false, true, false, &error);
@@ -143,8 +145,9 @@ int main(int argc, char** argv) {
     for (int i = 0; i < containers; ++i) bareMap[identifiers[i]] = metadataFiles[i];
     std::vector<tarn::TarnContainerIdentityRef> probes;
     for (int i = 0; i < containers; ++i)
-        probes.push_back(tarn::TarnContainerIdentity::containerIdentityWithUserIdentity(
-            user, identifiers[i], 2, nullptr));
+        probes.push_back(
+            tarn::TarnContainerIdentity::containerIdentityWithUserIdentity(user, identifiers[i], 2)
+                .value());
     const int chunk = 10000;
     std::vector<double> lookupNs, bareNs;
     size_t hits = 0, bareHits = 0;

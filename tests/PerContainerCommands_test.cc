@@ -47,8 +47,9 @@ class PerContainerCommandsTest : public test::ScratchRootTest {
                                                                                             false),
             name);
         fs::create_directories(made.url);
-        auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-            made.uuid, user, identifier, c, nullptr);
+        auto identity =
+            TarnConcreteContainerIdentity::containerIdentityWithUUID(made.uuid, user, identifier, c)
+                .value();
         TarnErrorRef error;
         EXPECT_TRUE(
             TarnMetadata::initWithContainerIdentity(identity, std::nullopt, made.url, std::nullopt)

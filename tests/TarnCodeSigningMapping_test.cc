@@ -42,10 +42,16 @@ protected:
     }
 
     void store(const std::string& id, const TarnCodeSigningEntryRef& entry) {
-        bool ok = false;
-        TarnErrorRef e;
-        mapping().queue()->sync([&] { ok = mapping().codeSigningMappingDB()->addCodeSigningEntry(entry, id, &e); });
-        ASSERT_TRUE(ok) << (e ? e->description() : "");
+        TarnStatus stored;
+        mapping().queue()->sync(
+            [&] { stored = mapping().codeSigningMappingDB()->addCodeSigningEntry(entry, id); });
+        ASSERT_TRUE(stored.ok()) << stored.error()->description();
+    }
+
+    std::set<std::string> identifiers() { return mapping().identifiersWithError().value(); }
+    // The stored entry; empty when the read failed.
+    TarnCodeSigningEntryRef storedEntry(const std::string& id) {
+        return mapping().codeSigningEntryForIdentifier(id).valueOr(nullptr);
     }
 
     std::unique_ptr<TarnCodeSigningMapping> mapping_;
@@ -120,11 +126,9 @@ TEST_F(TarnCodeSigningMappingTest, FlagsClassParentsAndChildren) {
               (std::vector<std::string>{"com.app.ext1", "com.app.ext2"}));
     EXPECT_TRUE(mapping().childBundleIdentifiersForParentIdentifier("com.app.ext1").empty());
 
-    TarnErrorRef e;
-    EXPECT_EQ(mapping().identifiersWithError(&e), (std::set<std::string>{"com.app", "com.app.ext1"}));
-    EXPECT_FALSE(mapping().codeSigningEntryForIdentifier("com.unknown", &e));
-    ASSERT_TRUE(e);
-    EXPECT_EQ(e->code(), TarnErrorDatabaseNotFound);
+    EXPECT_EQ(identifiers(), (std::set<std::string>{"com.app", "com.app.ext1"}));
+    EXPECT_EQ(mapping().codeSigningEntryForIdentifier("com.unknown").code(TarnSuccess),
+              TarnErrorDatabaseNotFound);
 }
 
 TEST_F(TarnCodeSigningMappingTest, InvalidationAndAdvanceCopies) {
@@ -134,18 +138,17 @@ TEST_F(TarnCodeSigningMappingTest, InvalidationAndAdvanceCopies) {
     store("com.q.kid", entryWith({}, 4));
     store("com.adv", entryWith({}, 2, [](auto& e) { e.setAdvanceCopy(true); }));
 
-    TarnErrorRef e;
-    ASSERT_TRUE(mapping().invalidateCodeSigningInfoForIdentifier("com.q", &e));
-    EXPECT_TRUE(mapping().codeSigningEntryForIdentifier("com.q", &e)->invalid());
-    EXPECT_FALSE(mapping().codeSigningEntryForIdentifier("com.q.kid", &e)->invalid());
-    ASSERT_TRUE(mapping().invalidateCodeSigningInfoForIdentifierAndItsChildren("com.p", &e));
-    EXPECT_TRUE(mapping().codeSigningEntryForIdentifier("com.p", &e)->invalid());
-    EXPECT_TRUE(mapping().codeSigningEntryForIdentifier("com.p.kid", &e)->invalid());
-    EXPECT_TRUE(mapping().invalidateCodeSigningInfoForIdentifier("com.unknown", &e));
+    ASSERT_TRUE(mapping().invalidateCodeSigningInfoForIdentifier("com.q").ok());
+    EXPECT_TRUE(storedEntry("com.q")->invalid());
+    EXPECT_FALSE(storedEntry("com.q.kid")->invalid());
+    ASSERT_TRUE(mapping().invalidateCodeSigningInfoForIdentifierAndItsChildren("com.p").ok());
+    EXPECT_TRUE(storedEntry("com.p")->invalid());
+    EXPECT_TRUE(storedEntry("com.p.kid")->invalid());
+    EXPECT_TRUE(mapping().invalidateCodeSigningInfoForIdentifier("com.unknown").ok());
 
-    ASSERT_TRUE(mapping().removeAllAdvanceCopiesWithError(&e));
-    EXPECT_EQ(mapping().identifiersWithError(&e).count("com.adv"), 0u);
-    EXPECT_EQ(mapping().identifiersWithError(&e).size(), 4u);
+    ASSERT_TRUE(mapping().removeAllAdvanceCopiesWithError().ok());
+    EXPECT_EQ(identifiers().count("com.adv"), 0u);
+    EXPECT_EQ(identifiers().size(), 4u);
 }
 
 TEST_F(TarnCodeSigningMappingTest, ReferenceCountsCoverEveryStoredEntry) {
@@ -182,8 +185,7 @@ TEST_F(TarnCodeSigningMappingTest, ReferenceCountsCoverEveryStoredEntry) {
 TEST_F(TarnCodeSigningMappingTest, LegacyMappingFileIsImportedOnce) {
     // Missing file: nothing happens.
     mapping_ = makeMapping();
-    TarnErrorRef e;
-    EXPECT_TRUE(mapping().identifiersWithError(&e).empty());
+    EXPECT_TRUE(identifiers().empty());
     mapping_.reset();
 
     const std::string file = std::string(kLibrary) + "/tarn_code_signing_info.plist";
@@ -200,10 +202,10 @@ TEST_F(TarnCodeSigningMappingTest, LegacyMappingFileIsImportedOnce) {
         return std::string(bytes.begin(), bytes.end());
     }());
     mapping_ = makeMapping();
-    TarnCodeSigningEntryRef back = mapping().codeSigningEntryForIdentifier("com.good", &e);
+    TarnCodeSigningEntryRef back = storedEntry("com.good");
     ASSERT_TRUE(back);
     EXPECT_EQ(*back, good);
-    EXPECT_EQ(mapping().identifiersWithError(&e), std::set<std::string>{"com.good"});
+    EXPECT_EQ(identifiers(), std::set<std::string>{"com.good"});
     EXPECT_FALSE(std::filesystem::exists(root_.at(file)));
     mapping_.reset();
 
@@ -220,7 +222,7 @@ TEST_F(TarnCodeSigningMappingTest, LegacyMappingFileIsImportedOnce) {
     root_.writeFile(file, "garbage");
     mapping_ = makeMapping();
     EXPECT_TRUE(std::filesystem::exists(root_.at(file)));
-    EXPECT_TRUE(mapping().codeSigningEntryForIdentifier("com.good", &e));
+    EXPECT_TRUE(storedEntry("com.good"));
 }
 
 TEST_F(TarnCodeSigningMappingTest, GetCodeSigningInfoCommand) {
@@ -257,19 +259,19 @@ TEST_F(TarnCodeSigningMappingTest, GetCodeSigningInfoCommand) {
 TEST_F(TarnCodeSigningMappingTest, BatchWriteDeletesStoresAndChecksCounts) {
     store("com.gone", entryWith({}));
     auto kept = entryWith({{"k", "v"}});
-    uint64_t code = 0;
+    TarnStatus written;
     mapping().queue()->sync([&] {
-        code = mapping()._onQueue_setCodeSigningDictionaryValues({kept}, {"com.a", "com.b"});
+        written = mapping()._onQueue_setCodeSigningDictionaryValues({kept}, {"com.a", "com.b"});
     });
-    EXPECT_EQ(code, TarnErrorMismatchedInput);
+    EXPECT_EQ(written.code(TarnSuccess), TarnErrorMismatchedInput);
     mapping().queue()->sync([&] {
-        code = mapping()._onQueue_setCodeSigningDictionaryValues(
-            {std::make_shared<TarnCodeSigningEntry>(), kept, std::make_shared<TarnCodeSigningEntry>()},
+        written = mapping()._onQueue_setCodeSigningDictionaryValues(
+            {std::make_shared<TarnCodeSigningEntry>(), kept,
+             std::make_shared<TarnCodeSigningEntry>()},
             {"com.gone", "com.kept", "com.never"});
     });
-    EXPECT_EQ(code, TarnSuccess);
-    TarnErrorRef e;
-    EXPECT_EQ(mapping().identifiersWithError(&e), std::set<std::string>{"com.kept"});
+    EXPECT_TRUE(written.ok());
+    EXPECT_EQ(identifiers(), std::set<std::string>{"com.kept"});
 }
 
 // Misuse of the queue is a programming error, caught in every build.

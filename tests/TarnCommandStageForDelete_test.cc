@@ -62,9 +62,9 @@ class TarnCommandStageForDeleteTest : public test::ScratchRootTest {
 
     static TarnContainerIdentityRef identity(const std::string& identifier,
                                              TarnContainerClass containerClass) {
-        uint64_t code = TarnSuccess;
         return TarnContainerIdentity::containerIdentityWithUserIdentity(
-            TarnUserIdentityCache::defaultUserIdentity(), identifier, containerClass, &code);
+                   TarnUserIdentityCache::defaultUserIdentity(), identifier, containerClass)
+            .value();
     }
     TarnMetadataRef create(const std::string& identifier, TarnContainerClass containerClass,
                            bool transient = false) {
@@ -95,16 +95,13 @@ class TarnCommandStageForDeleteTest : public test::ScratchRootTest {
             PlistDict{{kTarnEntitlementsKey, PlistDict{}}}, 3);
         entry->setChildBundleIdentifiers(std::move(children));
         auto* mapping = TarnCodeSigningMapping::sharedInstance();
-        TarnErrorRef e;
-        bool ok = false;
+        TarnStatus added;
         mapping->queue()->sync(
-            [&] { ok = mapping->codeSigningMappingDB()->addCodeSigningEntry(entry, id, &e); });
-        ASSERT_TRUE(ok) << (e ? e->description() : "");
+            [&] { added = mapping->codeSigningMappingDB()->addCodeSigningEntry(entry, id); });
+        ASSERT_TRUE(added.ok()) << added.error()->description();
     }
     static bool stored(const std::string& id) {
-        TarnErrorRef e;
-        return TarnCodeSigningMapping::sharedInstance()->codeSigningEntryForIdentifier(id, &e) !=
-               nullptr;
+        return TarnCodeSigningMapping::sharedInstance()->codeSigningEntryForIdentifier(id).ok();
     }
 
     TarnClientConnection connection_;
@@ -140,10 +137,10 @@ TEST_F(TarnCommandStageForDeleteTest, ContainersAlreadyGoneAreSkippedWithoutFail
     auto kept = create("com.example.kept", 2);
     ASSERT_TRUE(vanished && kept);
     fs::remove_all(vanished->url());  // behind the cache's back
-    uint64_t unknownCode = TarnSuccess;
-    auto neverMade = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-        Uuid::generate(), TarnUserIdentityCache::defaultUserIdentity(), "com.example.never", 2,
-        &unknownCode);
+    auto neverMade =
+        TarnConcreteContainerIdentity::containerIdentityWithUUID(
+            Uuid::generate(), TarnUserIdentityCache::defaultUserIdentity(), "com.example.never", 2)
+            .value();
 
     bool called = false;
     auto command =

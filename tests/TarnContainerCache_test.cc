@@ -87,7 +87,8 @@ class TarnContainerCacheTest : public test::ScratchRootTest {
         FileURL dir = PathJoin(base(c, transient, user), name);
         std::filesystem::create_directories(dir);
         auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-            uuid, user ? user : mobile(), identifier, c, nullptr);
+                            uuid, user ? user : mobile(), identifier, c)
+                            .value();
         auto m = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir, std::nullopt);
         TarnErrorRef error;
         EXPECT_TRUE(m->writeMetadataToDiskWithError(&error)) << (error ? error->description() : "");
@@ -97,7 +98,8 @@ class TarnContainerCacheTest : public test::ScratchRootTest {
     TarnContainerIdentityRef identity(TarnContainerClass c, const std::string& identifier,
                                       const TarnUserIdentityRef& user = nullptr) {
         return TarnContainerIdentity::containerIdentityWithUserIdentity(user ? user : mobile(),
-                                                                        identifier, c, nullptr);
+                                                                        identifier, c)
+            .value();
     }
 
     TarnMetadataRef lookup(TarnContainerClass c, const std::string& identifier, uint64_t* code,
@@ -366,7 +368,8 @@ TEST_F(TarnContainerCacheTest, ConcreteLookupMatchesTheUUIDAndMarksTransience) {
     auto transient = makeContainer(2, "com.ostrea.c", true);
     auto concrete = [&](const TarnMetadataRef& m) {
         return TarnConcreteContainerIdentity::containerIdentityWithUUID(m->uuid(), mobile(),
-                                                                        "com.ostrea.c", 2, nullptr);
+                                                                        "com.ostrea.c", 2)
+            .value();
     };
     auto a = cache_->containerForContainerIdentity(concrete(live));
     ASSERT_TRUE(a);
@@ -376,7 +379,8 @@ TEST_F(TarnContainerCacheTest, ConcreteLookupMatchesTheUUIDAndMarksTransience) {
     EXPECT_TRUE(b->transient());
     EXPECT_EQ(b->url(), transient->url());
     auto other = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-        Uuid::generate(), mobile(), "com.ostrea.c", 2, nullptr);
+                     Uuid::generate(), mobile(), "com.ostrea.c", 2)
+                     .value();
     EXPECT_FALSE(cache_->containerForContainerIdentity(other));
 }
 
@@ -488,7 +492,8 @@ TEST_F(TarnContainerCacheRegistrationTest, EnterpriseGroupIsPushedUnderItsPerson
                  Uuid::generate().string());
     std::filesystem::create_directories(dir);
     auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-        Uuid::generate(), enterprise_, "group.corp", 7, nullptr);
+                        Uuid::generate(), enterprise_, "group.corp", 7)
+                        .value();
     auto m = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir, std::nullopt);
     TarnErrorRef error;
     ASSERT_TRUE(cache_->addContainerMetadata(m, dir, false, true, &error))

@@ -217,9 +217,10 @@ TEST_F(ContainerCommandsDecodingTest, IdentitiesFromRequests) {
 
 TEST_F(ContainerCommandsDecodingTest, TokensOnlyForSandboxedCallersOfEnterpriseContainers) {
     auto container = [](TarnUserIdentityRef user, TarnContainerClass containerClass) {
-        uint64_t error = TarnSuccess;
-        auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-            Uuid::generate(), std::move(user), std::string("com.caller"), containerClass, &error);
+        auto identity =
+            TarnConcreteContainerIdentity::containerIdentityWithUUID(
+                Uuid::generate(), std::move(user), std::string("com.caller"), containerClass)
+                .value();
         return TarnMetadata::initWithContainerIdentity(
             identity, std::nullopt, "/private/var/c/" + identity->uuid().string(), std::nullopt);
     };

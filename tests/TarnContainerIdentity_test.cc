@@ -2,8 +2,12 @@
 
 #include <gtest/gtest.h>
 
+#include <fstream>
+#include <sstream>
+
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnUserIdentityCache.h"
+#include "Platform/PlatformLog.h"
 #include "support/ScratchRoot.h"
 
 namespace tarn {
@@ -21,97 +25,129 @@ protected:
     }
 };
 
-TEST_F(TarnContainerIdentityTest, ValidationCodesInOrder) {
-    uint64_t error = TarnSuccess;
-    EXPECT_FALSE(TarnContainerIdentity::containerIdentityWithUserIdentity(nullptr, std::nullopt, 0,
-                                                                          &error));
-    EXPECT_EQ(error, TarnErrorInvalidArgument) << "no user identity is checked first";
+// The code of a construction's refusal; TarnSuccess when it made an identity.
+template <class Ref>
+uint64_t refusal(const TarnResult<Ref>& made) {
+    if (made.ok()) EXPECT_TRUE(*made) << "a made identity is never empty";
+    return made.code(TarnSuccess);
+}
 
-    error = TarnSuccess;
-    EXPECT_FALSE(TarnContainerIdentity::containerIdentityWithUserIdentity(user(501), std::nullopt,
-                                                                          99, &error));
-    EXPECT_EQ(error, TarnErrorMissingIdentifier) << "missing identifier before the class";
+TEST_F(TarnContainerIdentityTest, ValidationCodesInOrder) {
+    EXPECT_EQ(
+        refusal(TarnContainerIdentity::containerIdentityWithUserIdentity(nullptr, std::nullopt, 0)),
+        TarnErrorInvalidArgument)
+        << "no user identity is checked first";
+    EXPECT_EQ(refusal(TarnContainerIdentity::containerIdentityWithUserIdentity(user(501),
+                                                                               std::nullopt, 99)),
+              TarnErrorMissingIdentifier)
+        << "missing identifier before the class";
 
     PlistValue number(uint64_t{7});
-    error = TarnSuccess;
-    EXPECT_FALSE(
-        TarnContainerIdentity::containerIdentityWithUserIdentity(user(501), &number, 2, &error));
-    EXPECT_EQ(error, TarnErrorInvalidArgument);
-
+    EXPECT_EQ(
+        refusal(TarnContainerIdentity::containerIdentityWithUserIdentity(user(501), &number, 2)),
+        TarnErrorInvalidArgument);
     PlistValue null;
-    error = TarnSuccess;
-    EXPECT_FALSE(TarnContainerIdentity::containerIdentityWithUserIdentity(user(501), &null, 2, &error));
-    EXPECT_EQ(error, TarnErrorMissingIdentifier);
+    EXPECT_EQ(
+        refusal(TarnContainerIdentity::containerIdentityWithUserIdentity(user(501), &null, 2)),
+        TarnErrorMissingIdentifier);
 
     for (TarnContainerClass bad : {TarnContainerClass{0}, TarnContainerClass{14},
                                    TarnContainerClass{1000}}) {
-        error = TarnSuccess;
-        EXPECT_FALSE(TarnContainerIdentity::containerIdentityWithUserIdentity(user(501), "a", bad,
-                                                                              &error));
-        EXPECT_EQ(error, TarnErrorInvalidArgument) << bad;
+        EXPECT_EQ(
+            refusal(TarnContainerIdentity::containerIdentityWithUserIdentity(user(501), "a", bad)),
+            TarnErrorInvalidArgument)
+            << bad;
     }
     for (TarnContainerClass good : {TarnContainerClass{1}, TarnContainerClass{13}}) {
-        error = TarnSuccess;
-        auto id = TarnContainerIdentity::containerIdentityWithUserIdentity(user(501), "", good, &error);
-        ASSERT_TRUE(id) << "an empty identifier passes";
-        EXPECT_EQ(error, TarnSuccess) << "the slot is written only on failure";
+        EXPECT_EQ(
+            refusal(TarnContainerIdentity::containerIdentityWithUserIdentity(user(501), "", good)),
+            TarnSuccess)
+            << "an empty identifier passes";
     }
-    // A null slot is allowed.
-    EXPECT_FALSE(TarnContainerIdentity::containerIdentityWithUserIdentity(user(501), "a", 0, nullptr));
+}
+
+// A refusal is reported once, by the line that says why; the error value
+// handed back is silent, so that callers passing it on log nothing twice.
+TEST_F(TarnContainerIdentityTest, ARefusalIsLoggedOnce) {
+    PlatformLogSetQuiet(true);
+    const FileURL logPath = root_.at("/platform.log");
+    PlatformLogSetFile(logPath);
+    auto refused = TarnConcreteContainerIdentity::containerIdentityWithUUID(std::nullopt, user(501),
+                                                                            "com.x", 2);
+    auto missing =
+        TarnContainerIdentity::containerIdentityWithUserIdentity(user(501), std::nullopt, 2);
+    auto global = TarnContainerIdentity::containerIdentityWithIdentifier("com.x", 2);
+    PlatformLogSetFile("");
+    std::stringstream log;
+    log << std::ifstream(logPath).rdbuf();
+    const std::string text = log.str();
+    auto count = [&](const std::string& needle) {
+        size_t n = 0;
+        for (size_t at = text.find(needle); at != std::string::npos; at = text.find(needle, at + 1))
+            ++n;
+        return n;
+    };
+    EXPECT_EQ(count("Invalid object: uuid = [(null)]"), 1u) << text;
+    EXPECT_EQ(count("Invalid object: missing identifier"), 1u) << text;
+    EXPECT_EQ(count("Attempt to create a container identity without a user identity"), 1u) << text;
+    EXPECT_EQ(count("\n"), 3u) << text;
+    for (const TarnErrorRef& e : {refused.error(), missing.error(), global.error()}) {
+        ASSERT_TRUE(e);
+        EXPECT_FALSE(e->localizedDescription()) << e->description();
+    }
 }
 
 TEST_F(TarnContainerIdentityTest, WithoutUserIdentityOnlyForGlobalClasses) {
-    uint64_t error = TarnSuccess;
-    EXPECT_FALSE(TarnContainerIdentity::containerIdentityWithIdentifier("com.x", 2, &error));
-    EXPECT_EQ(error, TarnErrorInvalidArgument);
+    EXPECT_EQ(refusal(TarnContainerIdentity::containerIdentityWithIdentifier("com.x", 2)),
+              TarnErrorInvalidArgument);
     for (TarnContainerClass c : {TarnContainerClass{1}, TarnContainerClass{12}}) {
-        auto id = TarnContainerIdentity::containerIdentityWithIdentifier("com.x", c, &error);
-        ASSERT_TRUE(id);
+        auto id = TarnContainerIdentity::containerIdentityWithIdentifier("com.x", c).value();
         EXPECT_TRUE(id->userIdentity()->isEqual(*TarnUserIdentityCache::defaultUserIdentity()));
         EXPECT_EQ(id->userIdentity()->posixUID(), 501u);
     }
 }
 
 TEST_F(TarnContainerIdentityTest, ConcreteRefusesAStringUUID) {
-    uint64_t error = TarnSuccess;
     PlistValue text(Uuid::generate().string());
     PlistValue identifier("com.x");
-    EXPECT_FALSE(TarnConcreteContainerIdentity::containerIdentityWithUUID(&text, user(501), &identifier,
-                                                                          2, &error));
-    EXPECT_EQ(error, TarnErrorInvalidArgument);
-
-    error = TarnSuccess;
-    EXPECT_FALSE(TarnConcreteContainerIdentity::containerIdentityWithUUID(std::nullopt, user(501),
-                                                                          "com.x", 2, &error));
-    EXPECT_EQ(error, TarnErrorInvalidArgument);
-
+    EXPECT_EQ(refusal(TarnConcreteContainerIdentity::containerIdentityWithUUID(&text, user(501),
+                                                                               &identifier, 2)),
+              TarnErrorInvalidArgument);
+    EXPECT_EQ(refusal(TarnConcreteContainerIdentity::containerIdentityWithUUID(
+                  std::nullopt, user(501), "com.x", 2)),
+              TarnErrorInvalidArgument);
     // Base checks come first and pass their code through.
-    error = TarnSuccess;
-    EXPECT_FALSE(TarnConcreteContainerIdentity::containerIdentityWithUUID(&text, user(501), nullptr, 2,
-                                                                          &error));
-    EXPECT_EQ(error, TarnErrorMissingIdentifier);
+    EXPECT_EQ(refusal(TarnConcreteContainerIdentity::containerIdentityWithUUID(&text, user(501),
+                                                                               nullptr, 2)),
+              TarnErrorMissingIdentifier);
 }
 
 TEST_F(TarnContainerIdentityTest, EqualityIsByUserIdentifierAndAsymmetricForConcrete) {
+    auto plain = [](TarnUserIdentityRef u) {
+        return TarnContainerIdentity::containerIdentityWithUserIdentity(std::move(u), "com.x", 2)
+            .value();
+    };
+    auto concreteWith = [](Uuid uuid, TarnUserIdentityRef u) {
+        return TarnConcreteContainerIdentity::containerIdentityWithUUID(uuid, std::move(u), "com.x",
+                                                                        2)
+            .value();
+    };
     auto personal = user(501);
     auto unspecific = user(501, TarnPersonaTypeUnspecific);
-    auto a = TarnContainerIdentity::containerIdentityWithUserIdentity(personal, "com.x", 2, nullptr);
-    auto b = TarnContainerIdentity::containerIdentityWithUserIdentity(unspecific, "com.x", 2, nullptr);
-    ASSERT_TRUE(a && b);
+    auto a = plain(personal);
+    auto b = plain(unspecific);
     EXPECT_TRUE(a->isEqual(*b));
     EXPECT_EQ(a->hash(), b->hash());
 
-    auto other = TarnContainerIdentity::containerIdentityWithUserIdentity(user(502), "com.x", 2, nullptr);
+    auto other = plain(user(502));
     EXPECT_FALSE(a->isEqual(*other));
-    auto enterprise = user(501, TarnPersonaTypeEnterprise, "ENT-1");
-    auto e = TarnContainerIdentity::containerIdentityWithUserIdentity(enterprise, "com.x", 2, nullptr);
+    auto e = plain(user(501, TarnPersonaTypeEnterprise, "ENT-1"));
     EXPECT_FALSE(a->isEqual(*e)) << "an enterprise persona is keyed by its unique string";
 
     Uuid uuid = Uuid::generate();
-    auto c1 = TarnConcreteContainerIdentity::containerIdentityWithUUID(uuid, personal, "com.x", 2, nullptr);
-    auto c2 = TarnConcreteContainerIdentity::containerIdentityWithUUID(uuid, unspecific, "com.x", 2, nullptr);
-    auto c3 = TarnConcreteContainerIdentity::containerIdentityWithUUID(Uuid::generate(), personal,
-                                                                       "com.x", 2, nullptr);
+    auto c1 = concreteWith(uuid, personal);
+    auto c2 = concreteWith(uuid, unspecific);
+    auto c3 = concreteWith(Uuid::generate(), personal);
     EXPECT_TRUE(a->isEqual(*c1)) << "plain equals concrete with the same fields";
     EXPECT_FALSE(c1->isEqual(*a)) << "but not the other way round";
     EXPECT_TRUE(c1->isEqual(*c2));

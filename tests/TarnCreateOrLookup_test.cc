@@ -50,11 +50,10 @@ class TarnCreateOrLookupTest : public test::ScratchRootTest {
 
     static TarnContainerIdentityRef identity(const std::string& identifier,
                                              TarnContainerClass containerClass) {
-        uint64_t code = TarnSuccess;
         auto made = TarnContainerIdentity::containerIdentityWithUserIdentity(
-            TarnUserIdentityCache::defaultUserIdentity(), identifier, containerClass, &code);
-        EXPECT_TRUE(made) << code;
-        return made;
+            TarnUserIdentityCache::defaultUserIdentity(), identifier, containerClass);
+        EXPECT_TRUE(made.ok()) << made.code(TarnSuccess);
+        return made.valueOr(nullptr);
     }
 
     TarnMetadataRef create(const TarnContainerIdentityRef& id, bool transient = false,
@@ -339,10 +338,10 @@ TEST_F(TarnCreateOrLookupTest, RecordedClassThenEntitlementsDecideTheSubdirector
     EXPECT_EQ(M::dataProtectionClassForEntitlements({{"DataProtectionClass", "bogus"}}), 0);
 
     auto metadataOf = [](TarnContainerClass c, std::optional<PlistValue> info) {
-        uint64_t code = TarnSuccess;
-        auto concrete = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-            Uuid::generate(), TarnUserIdentityCache::defaultUserIdentity(), "com.example.dp", c,
-            &code);
+        auto concrete =
+            TarnConcreteContainerIdentity::containerIdentityWithUUID(
+                Uuid::generate(), TarnUserIdentityCache::defaultUserIdentity(), "com.example.dp", c)
+                .value();
         return TarnMetadataRef(
             TarnMetadata::initWithContainerIdentity(concrete, std::move(info), "/", std::nullopt));
     };

@@ -36,7 +36,8 @@ protected:
                                 std::optional<PlistValue> info = std::nullopt) {
         Uuid uuid = Uuid::generate();
         auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-            uuid, mobile(), "com.ostrea.app", containerClass, nullptr);
+                            uuid, mobile(), "com.ostrea.app", containerClass)
+                            .value();
         return TarnMetadata::initWithContainerIdentity(identity, std::move(info),
                                                        containerDir(containerClass, uuid), "Assets");
     }
@@ -251,8 +252,9 @@ TEST_F(TarnMetadataTest, StoredIdentityMustMatchTheExpectedOne) {
 
 TEST_F(TarnMetadataTest, ClassPathMustMatchTheClassDirectory) {
     Uuid uuid = Uuid::generate();
-    auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(uuid, mobile(), "com.b", 1,
-                                                                             nullptr);
+    auto identity =
+        TarnConcreteContainerIdentity::containerIdentityWithUUID(uuid, mobile(), "com.b", 1)
+            .value();
     // A bundle container found below the user's Data/Application.
     FileURL misplaced = containerDir(2, uuid);
     auto m = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, misplaced, std::nullopt);

@@ -89,8 +89,9 @@ class TarnPerContainerOpsTest : public test::ScratchRootTest {
                 mobile(), c, false),
             name);
         fs::create_directories(dir);
-        auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-            uuid, mobile(), identifier, c, nullptr);
+        auto identity =
+            TarnConcreteContainerIdentity::containerIdentityWithUUID(uuid, mobile(), identifier, c)
+                .value();
         auto m = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir, std::nullopt);
         TarnErrorRef error;
         EXPECT_TRUE(m->writeMetadataToDiskWithError(&error)) << (error ? error->description() : "");
@@ -102,7 +103,8 @@ class TarnPerContainerOpsTest : public test::ScratchRootTest {
 
     TarnConcreteContainerIdentityRef missing(TarnContainerClass c = 2) {
         return TarnConcreteContainerIdentity::containerIdentityWithUUID(
-            Uuid::generate(), mobile(), std::string("com.ostrea.nowhere"), c, nullptr);
+                   Uuid::generate(), mobile(), std::string("com.ostrea.nowhere"), c)
+            .value();
     }
 
     FileURL urlOf(const TarnConcreteContainerIdentityRef& identity) {
@@ -197,7 +199,8 @@ TEST_F(TarnPerContainerOpsTest, BadKeysMissingContainersAndFailedWrites) {
     EXPECT_NE(log().find("No Container with user identity:"), std::string::npos);
     // Same identifier and class but another UUID is another container.
     auto sameNameOtherUUID = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-        Uuid::generate(), mobile(), std::string("com.ostrea.notes"), 2, nullptr);
+                                 Uuid::generate(), mobile(), std::string("com.ostrea.notes"), 2)
+                                 .value();
     error = TarnSuccess;
     EXPECT_FALSE(connection_.metadataWithContainerIdentity(sameNameOtherUUID, &error));
     EXPECT_EQ(error, TarnErrorNotFound);

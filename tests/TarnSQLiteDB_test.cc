@@ -69,13 +69,19 @@ protected:
     }
 
     void store(const std::string& id, const TarnCodeSigningEntryRef& entry) {
-        TarnErrorRef e;
-        ASSERT_TRUE(db_->addCodeSigningEntry(entry, id, &e)) << (e ? e->description() : "");
+        TarnStatus stored = db_->addCodeSigningEntry(entry, id);
+        ASSERT_TRUE(stored.ok()) << stored.error()->description();
     }
 
-    TarnCodeSigningEntryRef read(const std::string& id, TarnErrorRef* e = nullptr) {
-        return db_->codeSigningEntryWithIdentifier(id, e);
+    // The stored entry; empty when the read failed.
+    TarnCodeSigningEntryRef read(const std::string& id) {
+        return db_->codeSigningEntryWithIdentifier(id).valueOr(nullptr);
     }
+    // The code a read fails with; TarnSuccess when it succeeds.
+    uint64_t readFailure(const std::string& id) {
+        return db_->codeSigningEntryWithIdentifier(id).code(TarnSuccess);
+    }
+    std::set<std::string> identifiers() { return db_->identifiersWithError().value(); }
 
     std::string path_;
     std::unique_ptr<TarnSQLiteDB> db_;
@@ -113,59 +119,50 @@ TEST_F(TarnSQLiteDBTest, StoreInsertsThenUpdatesInPlace) {
 TEST_F(TarnSQLiteDBTest, DeleteCascadesAndUnknownIdentifierIs68WrappedAs66) {
     store("com.p", makeEntry("p", {"com.p.c1", "com.p.c2"}));
     store("com.q", makeEntry("q", {"com.q.c"}));
-    TarnErrorRef e;
-    ASSERT_TRUE(db_->deleteCodeSigningEntryWithIdentifier("com.p", &e));
-    EXPECT_FALSE(read("com.p", &e));
-    ASSERT_TRUE(e);
-    EXPECT_EQ(e->code(), TarnErrorDatabaseNotFound);
+    ASSERT_TRUE(db_->deleteCodeSigningEntryWithIdentifier("com.p").ok());
+    EXPECT_EQ(readFailure("com.p"), TarnErrorDatabaseNotFound);
     EXPECT_EQ(queryInt(db_->db(), "SELECT count(*) FROM code_signing_data;"), 1);
     EXPECT_EQ(queryInt(db_->db(), "SELECT count(*) FROM child_bundles;"), 1);
-    EXPECT_TRUE(db_->parentIdentifierForChildIdentifier("com.p.c1", &e).empty());
-    EXPECT_EQ(e->code(), TarnErrorDatabaseNotFound);
+    EXPECT_EQ(db_->parentIdentifierForChildIdentifier("com.p.c1").code(TarnSuccess),
+              TarnErrorDatabaseNotFound);
 
-    e = nullptr;
-    EXPECT_FALSE(db_->deleteCodeSigningEntryWithIdentifier("com.unknown", &e));
-    ASSERT_TRUE(e);
-    EXPECT_EQ(e->code(), TarnErrorDatabase);
-    ASSERT_TRUE(e->underlyingError());
-    EXPECT_EQ(e->underlyingError()->code(), TarnErrorDatabaseUnexpectedChanges);
+    TarnStatus unknown = db_->deleteCodeSigningEntryWithIdentifier("com.unknown");
+    ASSERT_FALSE(unknown.ok());
+    ASSERT_TRUE(unknown.error());
+    EXPECT_EQ(unknown.error()->code(), TarnErrorDatabase);
+    ASSERT_TRUE(unknown.error()->underlyingError());
+    EXPECT_EQ(unknown.error()->underlyingError()->code(), TarnErrorDatabaseUnexpectedChanges);
 
-    EXPECT_FALSE(db_->deleteCodeSigningEntryWithIdentifier("", &e));
-    EXPECT_EQ(e->code(), TarnErrorBadInput);
-    EXPECT_FALSE(db_->addCodeSigningEntry(nullptr, "com.x", &e));
-    EXPECT_EQ(e->code(), TarnErrorBadInput);
-    EXPECT_FALSE(db_->addCodeSigningEntry(makeEntry("x"), "", &e));
-    EXPECT_EQ(e->code(), TarnErrorBadInput);
+    EXPECT_EQ(db_->deleteCodeSigningEntryWithIdentifier("").code(TarnSuccess), TarnErrorBadInput);
+    EXPECT_EQ(db_->addCodeSigningEntry(nullptr, "com.x").code(TarnSuccess), TarnErrorBadInput);
+    EXPECT_EQ(db_->addCodeSigningEntry(makeEntry("x"), "").code(TarnSuccess), TarnErrorBadInput);
 }
 
 TEST_F(TarnSQLiteDBTest, ChildMovesToSecondParent) {
     store("com.first", makeEntry("1", {"com.child", "com.other"}));
     store("com.second", makeEntry("2", {"com.child"}));
-    TarnErrorRef e;
-    EXPECT_EQ(db_->parentIdentifierForChildIdentifier("com.child", &e), "com.second");
-    EXPECT_EQ(db_->childIdentifiersForParentIdentifier("com.first", &e), std::vector<std::string>{"com.other"});
+    EXPECT_EQ(db_->parentIdentifierForChildIdentifier("com.child").valueOr(""), "com.second");
+    EXPECT_EQ(db_->childIdentifiersForParentIdentifier("com.first").valueOr({}),
+              std::vector<std::string>{"com.other"});
     EXPECT_EQ(read("com.second")->childBundleIdentifiers(), std::vector<std::string>{"com.child"});
-    e = nullptr;
-    EXPECT_TRUE(db_->childIdentifiersForParentIdentifier("com.nobody", &e).empty());
-    ASSERT_TRUE(e);
-    EXPECT_EQ(e->code(), TarnErrorDatabaseNotFound);
+    EXPECT_EQ(db_->childIdentifiersForParentIdentifier("com.nobody").code(TarnSuccess),
+              TarnErrorDatabaseNotFound);
 }
 
 TEST_F(TarnSQLiteDBTest, Invalidation) {
-    TarnErrorRef e;
-    EXPECT_TRUE(db_->invalidateCodeSigningWithIdentifier("com.unknown", &e));
+    EXPECT_TRUE(db_->invalidateCodeSigningWithIdentifier("com.unknown").ok());
     EXPECT_EQ(queryInt(db_->db(), "SELECT count(*) FROM code_signing_info;"), 0);
 
     store("com.p", makeEntry("p", {"com.p.c1", "com.p.c2"}));
     store("com.p.c1", makeEntry("c1"));
     store("com.lone", makeEntry("lone"));
     // com.p.c2 has no entry of its own: invalidating it changes nothing and is no failure.
-    ASSERT_TRUE(db_->invalidateCodeSigningForIdentifierAndAllChildren("com.p", &e));
+    ASSERT_TRUE(db_->invalidateCodeSigningForIdentifierAndAllChildren("com.p").ok());
     EXPECT_TRUE(read("com.p")->invalid());
     EXPECT_TRUE(read("com.p.c1")->invalid());
     EXPECT_FALSE(read("com.lone")->invalid());
     // Without children only the identifier itself.
-    ASSERT_TRUE(db_->invalidateCodeSigningForIdentifierAndAllChildren("com.lone", &e));
+    ASSERT_TRUE(db_->invalidateCodeSigningForIdentifierAndAllChildren("com.lone").ok());
     EXPECT_TRUE(read("com.lone")->invalid());
     // Re-storing an invalidated entry makes it valid again.
     store("com.lone", makeEntry("lone"));
@@ -173,12 +170,12 @@ TEST_F(TarnSQLiteDBTest, Invalidation) {
 }
 
 TEST_F(TarnSQLiteDBTest, IdentifiersOfEmptyDatabaseAreEmptyWithoutError) {
-    TarnErrorRef e;
-    EXPECT_TRUE(db_->identifiersWithError(&e).empty());
-    EXPECT_FALSE(e);
+    TarnResult<std::set<std::string>> none = db_->identifiersWithError();
+    ASSERT_TRUE(none.ok());
+    EXPECT_TRUE(none->empty());
     store("b", makeEntry("b"));
     store("a", makeEntry("a"));
-    EXPECT_EQ(db_->identifiersWithError(&e), (std::set<std::string>{"a", "b"}));
+    EXPECT_EQ(identifiers(), (std::set<std::string>{"a", "b"}));
 }
 
 TEST_F(TarnSQLiteDBTest, AdvanceCopyDeletionTakesOnlyFlag2) {
@@ -196,12 +193,11 @@ TEST_F(TarnSQLiteDBTest, AdvanceCopyDeletionTakesOnlyFlag2) {
     EXPECT_TRUE(back->placeholder());
     EXPECT_TRUE(back->advanceCopy());
 
-    TarnErrorRef e;
-    ASSERT_TRUE(db_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(&e));
-    EXPECT_EQ(db_->identifiersWithError(&e), (std::set<std::string>{"com.placeholder", "com.plain"}));
+    ASSERT_TRUE(db_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError().ok());
+    EXPECT_EQ(identifiers(), (std::set<std::string>{"com.placeholder", "com.plain"}));
     EXPECT_EQ(queryInt(db_->db(), "SELECT count(*) FROM child_bundles;"), 0);
     // Nothing left to delete is still success.
-    EXPECT_TRUE(db_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(&e));
+    EXPECT_TRUE(db_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError().ok());
 }
 
 TEST_F(TarnSQLiteDBTest, UndecodableBlobFailsReadAndIsSkippedByEnumeration) {
@@ -225,34 +221,26 @@ TEST_F(TarnSQLiteDBTest, UndecodableBlobFailsReadAndIsSkippedByEnumeration) {
     ASSERT_EQ(sqlite3_step(st), SQLITE_DONE);
     sqlite3_finalize(st);
 
-    for (const char* id : {"com.bad", "com.array"}) {
-        TarnErrorRef e;
-        EXPECT_FALSE(read(id, &e)) << id;
-        ASSERT_TRUE(e);
-        EXPECT_EQ(e->code(), TarnErrorDatabase) << id;
-    }
+    for (const char* id : {"com.bad", "com.array"})
+        EXPECT_EQ(readFailure(id), TarnErrorDatabase) << id;
 
     std::vector<std::string> seen;
-    TarnErrorRef e = db_->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+    TarnStatus enumerated = db_->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
         [&](const std::string& id, const TarnCodeSigningEntryRef& entry) {
             seen.push_back(id);
             EXPECT_EQ(entry->childBundleIdentifiers(), std::vector<std::string>{"com.good.child"});
         });
     EXPECT_EQ(seen, std::vector<std::string>{"com.good"});
-    ASSERT_TRUE(e);
-    EXPECT_EQ(e->code(), TarnErrorDatabase);
+    EXPECT_EQ(enumerated.code(TarnSuccess), TarnErrorDatabase);
     // The identifiers themselves are still listed.
-    EXPECT_EQ(db_->identifiersWithError(&e).size(), 3u);
+    EXPECT_EQ(identifiers().size(), 3u);
 }
 
 TEST_F(TarnSQLiteDBTest, FailedStoreRollsBackTheFlagsRow) {
     // No info: the data row cannot be made after the flags row was inserted.
     auto noInfo = std::make_shared<const TarnCodeSigningEntry>();
-    TarnErrorRef e;
-    EXPECT_FALSE(db_->addCodeSigningEntry(noInfo, "com.new", &e));
-    ASSERT_TRUE(e);
-    EXPECT_EQ(e->code(), TarnErrorDatabase);
-    EXPECT_TRUE(db_->identifiersWithError(&e).empty());
+    EXPECT_EQ(db_->addCodeSigningEntry(noInfo, "com.new").code(TarnSuccess), TarnErrorDatabase);
+    EXPECT_TRUE(identifiers().empty());
     // The connection is usable afterwards: no transaction was left open.
     store("com.new", makeEntry("ok"));
     EXPECT_TRUE(read("com.new"));
@@ -264,10 +252,8 @@ TEST_F(TarnSQLiteDBTest, ExceptionInsideStoreIs40AndRollsBack) {
         db_->TEST_storeStepHook = [step](const char* at) {
             if (std::string(at) == step) throw std::runtime_error("injected");
         };
-        TarnErrorRef e;
-        EXPECT_FALSE(db_->addCodeSigningEntry(makeEntry("after", {"com.a.new"}, 6), "com.a", &e)) << step;
-        ASSERT_TRUE(e) << step;
-        EXPECT_EQ(e->code(), TarnErrorException) << step;
+        TarnStatus added = db_->addCodeSigningEntry(makeEntry("after", {"com.a.new"}, 6), "com.a");
+        EXPECT_EQ(added.code(TarnSuccess), TarnErrorException) << step;
         db_->TEST_storeStepHook = nullptr;
         TarnCodeSigningEntryRef back = read("com.a");
         ASSERT_TRUE(back) << step;
@@ -280,18 +266,19 @@ TEST_F(TarnSQLiteDBTest, ExceptionInsideStoreIs40AndRollsBack) {
     GTEST_FLAG_SET(death_test_style, "threadsafe");
     TarnGlobalConfiguration::sharedInstance().setIsInternalImage(true);
     db_->TEST_storeStepHook = [](const char*) { throw std::runtime_error("injected"); };
-    EXPECT_DEATH(db_->addCodeSigningEntry(makeEntry("x"), "com.a", nullptr), "INTERNAL ERROR: Uncaught Exception");
+    EXPECT_DEATH((void)db_->addCodeSigningEntry(makeEntry("x"), "com.a"),
+                 "INTERNAL ERROR: Uncaught Exception");
 }
 
 TEST_F(TarnSQLiteDBTest, ClosedStoreFailsWith66) {
     db_->closeDB();
     EXPECT_EQ(db_->db(), nullptr);
-    TarnErrorRef e;
-    EXPECT_FALSE(db_->addCodeSigningEntry(makeEntry("x"), "com.x", &e));
-    EXPECT_EQ(e->code(), TarnErrorDatabase);
-    EXPECT_FALSE(read("com.x", &e));
-    EXPECT_EQ(e->code(), TarnErrorDatabase);
-    EXPECT_TRUE(db_->enumerateIdentifiersAndCodeSigningInfoUsingBlock([](auto&, auto&) { FAIL(); }));
+    EXPECT_EQ(db_->addCodeSigningEntry(makeEntry("x"), "com.x").code(TarnSuccess),
+              TarnErrorDatabase);
+    EXPECT_EQ(readFailure("com.x"), TarnErrorDatabase);
+    EXPECT_EQ(db_->enumerateIdentifiersAndCodeSigningInfoUsingBlock([](auto&, auto&) { FAIL(); })
+                  .code(TarnSuccess),
+              TarnErrorDatabase);
 }
 
 TEST_F(TarnSQLiteDBTest, SchemaAsAnotherClientSeesIt) {
@@ -355,8 +342,7 @@ TEST(TarnSQLiteDBCrashWriter, StoreUntilKilled) {
         auto entry = std::make_shared<TarnCodeSigningEntry>(
             PlistDict{{"Generation", n}, {"Payload", payloadFor(n)}, {"Id", id}}, 2);
         entry->setChildBundleIdentifiers(children);
-        TarnErrorRef e;
-        if (!db.addCodeSigningEntry(entry, id, &e)) std::_Exit(3);
+        if (!db.addCodeSigningEntry(entry, id).ok()) std::_Exit(3);
         char byte = 1;
         if (::write(kProgressFd, &byte, 1) != 1) std::_Exit(4);
     }
@@ -404,12 +390,11 @@ TEST_F(TarnSQLiteDBTest, KilledWriterLeavesWholeEntries) {
         ::close(fds[0]);
 
         TarnSQLiteDB db(path_);
-        TarnErrorRef e;
-        const std::set<std::string> ids = db.identifiersWithError(&e);
+        const std::set<std::string> ids = db.identifiersWithError().value();
         // Every commit the writer reported is there (ids cycle through 200).
         EXPECT_GE(ids.size(), std::min<size_t>(200, static_cast<size_t>(committed))) << "round " << round;
         size_t seen = 0;
-        TarnErrorRef enumError = db.enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+        TarnStatus enumerated = db.enumerateIdentifiersAndCodeSigningInfoUsingBlock(
             [&](const std::string& id, const TarnCodeSigningEntryRef& entry) {
                 ++seen;
                 const PlistDict& info = *entry->codeSigningInfo();
@@ -418,7 +403,7 @@ TEST_F(TarnSQLiteDBTest, KilledWriterLeavesWholeEntries) {
                 EXPECT_EQ(*info.at("Payload").asString(), payloadFor(generation));
                 EXPECT_EQ(entry->childBundleIdentifiers().size(), static_cast<size_t>(kChildrenPerEntry)) << id;
             });
-        EXPECT_FALSE(enumError) << enumError->description();
+        EXPECT_TRUE(enumerated.ok()) << enumerated.error()->description();
         // No flags row without its data row: each store is all or nothing.
         EXPECT_EQ(seen, ids.size());
     }

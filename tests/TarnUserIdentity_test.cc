@@ -92,8 +92,7 @@ TEST_F(TarnUserIdentityCacheTest, StoredIdentitiesVersionsAndMalformedData) {
     auto v2 = TarnUserIdentity::initWithUID(501, 501, "/h", std::nullopt, 0, 501)->plist();
     EXPECT_EQ(*v2.find("version")->asString(), "2");
     EXPECT_EQ(v2.find("personaUniqueString"), nullptr);
-    uint64_t error = TarnSuccess;
-    auto read = TarnUserIdentity::userIdentityWithPlist(v2, *cache, &error);
+    auto read = TarnUserIdentity::userIdentityWithPlist(v2, *cache).value();
     ASSERT_TRUE(read);
     EXPECT_EQ(read->identifier(), "501");
     EXPECT_EQ(read->homeDirectoryURL(), root_.at("/private/var/mobile"))
@@ -103,14 +102,14 @@ TEST_F(TarnUserIdentityCacheTest, StoredIdentitiesVersionsAndMalformedData) {
                  {"posixGID", PlistValue(uint64_t{502})},
                  {"version", PlistValue("1")},
                  {"personaIdentifier", PlistValue("whatever")}};
-    read = TarnUserIdentity::userIdentityWithPlist(PlistValue(v1), *cache, &error);
+    read = TarnUserIdentity::userIdentityWithPlist(PlistValue(v1), *cache).value();
     ASSERT_TRUE(read);
     EXPECT_EQ(read->posixUID(), 502u);
 
     auto expectMalformed = [&](PlistValue value, const char* why) {
-        uint64_t code = TarnSuccess;
-        EXPECT_FALSE(TarnUserIdentity::userIdentityWithPlist(value, *cache, &code)) << why;
-        EXPECT_EQ(code, TarnErrorInvalidUserIdentityData) << why;
+        EXPECT_EQ(TarnUserIdentity::userIdentityWithPlist(value, *cache).code(TarnSuccess),
+                  TarnErrorInvalidUserIdentityData)
+            << why;
     };
     PlistValue numberVersion = v2;
     numberVersion.set("version", PlistValue(uint64_t{2}));
@@ -141,22 +140,22 @@ TEST_F(TarnUserIdentityCacheTest, StoredEnterpriseIdentityResolvesThroughTheCach
                      {"type", PlistValue(uint64_t{1})},
                      {"version", PlistValue("2")},
                      {"personaUniqueString", PlistValue("E-1")}};
-    uint64_t error = TarnSuccess;
-    auto e = TarnUserIdentity::userIdentityWithPlist(PlistValue(stored), *cache, &error);
+    auto e = TarnUserIdentity::userIdentityWithPlist(PlistValue(stored), *cache).value();
     ASSERT_TRUE(e);
     EXPECT_TRUE(e->isEnterprise());
     EXPECT_EQ(e->homeDirectoryURL(), root_.at("/private/var/ent1"));
     EXPECT_EQ(e->kernelPersonaID(), 1002u);
 
-    // Unknown persona: nothing, and no specific error.
+    // Unknown persona: nothing, and no failure of the data.
     stored["personaUniqueString"] = PlistValue("gone");
-    error = 99;
-    EXPECT_FALSE(TarnUserIdentity::userIdentityWithPlist(PlistValue(stored), *cache, &error));
-    EXPECT_EQ(error, TarnSuccess);
+    TarnResult<TarnUserIdentityRef> gone =
+        TarnUserIdentity::userIdentityWithPlist(PlistValue(stored), *cache);
+    ASSERT_TRUE(gone.ok());
+    EXPECT_FALSE(*gone);
 
     // A type-1 record whose persona is now universal is used all the same.
     stored["personaUniqueString"] = PlistValue("U-1");
-    auto u = TarnUserIdentity::userIdentityWithPlist(PlistValue(stored), *cache, &error);
+    auto u = TarnUserIdentity::userIdentityWithPlist(PlistValue(stored), *cache).value();
     ASSERT_TRUE(u);
     EXPECT_TRUE(u->isNoSpecificPersona());
 }
