@@ -182,25 +182,25 @@ bool TarnClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, bool isD
     // the rename lands; the item is then still here and needs a new slot.
     constexpr int kAttempts = 3;
     for (int attempt = 1;; ++attempt) {
-        TarnErrorRef underlying;
         // A directory of its own keeps two items of the same name from colliding.
         auto unique = fm.createTemporaryDirectoryInDirectoryURL(
-            TarnGlobalConfiguration::sharedInstance().deathrowDirectory(), &underlying);
-        if (!unique) {
+            TarnGlobalConfiguration::sharedInstance().deathrowDirectory());
+        if (!unique.ok()) {
             if (error)
-                *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, underlying,
+                *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, unique.error(),
                                     "Failed to create unique directory at: %@", url);
             return false;
         }
         const FileURL destination = PathJoin(*unique, PathLastComponent(url));
-        if (fm.moveItemAtURL(url, destination, &underlying)) break;
-        if (underlying && underlying->posixCode() == ENOENT) {
+        const TarnStatus moved = fm.moveItemAtURL(url, destination);
+        if (moved.ok()) break;
+        if (moved.error() && moved.error()->posixCode() == ENOENT) {
             // Already gone; the empty slot goes with the next pass.
             if (fm.itemDoesNotExistAtURL(url)) return true;
             if (attempt < kAttempts) continue;
         }
         if (error)
-            *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, underlying,
+            *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, moved.error(),
                                 "Failed to move item at: %@ to: %@", url, destination);
         return false;
     }
@@ -216,10 +216,9 @@ void TarnClientConnection::deleteContainersOnDeathRowWithCompletion(
         uint64_t result = TarnSuccess;
         try {
             const FileURL deathRow = TarnGlobalConfiguration::sharedInstance().deathrowDirectory();
-            TarnErrorRef listError;
-            auto items =
-                TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow, &listError);
-            if (!items) {
+            auto items = TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow);
+            if (!items.ok()) {
+                const TarnErrorRef listError = items.error();
                 if (!(listError && listError->posixCode() == ENOENT)) {
                     TarnErrorRef e = TARN_ERROR_IN(kOperation, TarnErrorDeleteFailed, listError,
                                                    "Failed to get items for deletion: %@ : %@",
@@ -247,27 +246,25 @@ void TarnClientConnection::deleteContainersOnDeathRowWithCompletion(
 
 bool TarnClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& url, TarnErrorRef* error) {
     auto& fm = TarnFileManager::defaultManager();
-    TarnErrorRef removeError;
-    if (fm.removeItemAtURL(url, &removeError) ||
-        (removeError && removeError->posixCode() == ENOENT))
-        return true;
+    const TarnStatus removed = fm.removeItemAtURL(url);
+    if (removed.ok() || (removed.error() && removed.error()->posixCode() == ENOENT)) return true;
     TarnLog(kLogDebug, __func__, "Couldn't remove, so moving item to /tmp: %@ : %@", url,
-            removeError);
+            removed.error());
 
     const FileURL tmp = RootPath("/tmp");
-    TarnErrorRef moveError;
+    // The move reports any failure.
     if (fm.itemDoesNotExistAtURL(tmp))
-        (void)fm.createDirectoryAtURL(tmp, true, 01777,
-                                      &moveError);  // the move reports any failure
+        (void)fm.createDirectoryAtURL(tmp, /*withIntermediateDirectories=*/true, 01777);
     FileURL destination = PathJoin(tmp, PathLastComponent(url));
     // Never replace something already in /tmp: a taken name goes into a fresh directory.
     if (!fm.itemDoesNotExistAtURL(destination)) {
-        auto unique = fm.createTemporaryDirectoryInDirectoryURL(tmp, "tarnkeeperd.", &moveError);
-        if (unique) destination = PathJoin(*unique, PathLastComponent(url));
+        auto unique = fm.createTemporaryDirectoryInDirectoryURL(tmp, "tarnkeeperd.");
+        if (unique.ok()) destination = PathJoin(*unique, PathLastComponent(url));
     }
     // A rename only: where /tmp is another volume a copy would fail to remove
     // its source for the same reason, and every pass would leave one more copy.
-    if (!fm.renameItemAtURL(url, destination, &moveError)) {
+    if (const TarnStatus renamed = fm.renameItemAtURL(url, destination); !renamed.ok()) {
+        const TarnErrorRef& moveError = renamed.error();
         // Gone meanwhile is done; a missing /tmp is not.
         if (moveError && moveError->posixCode() == ENOENT && fm.itemDoesNotExistAtURL(url))
             return true;
@@ -315,8 +312,11 @@ bool TarnClientConnection::_createTopLevelContainerDirectory(const FileURL& url,
     uint32_t topLevelOwner = owner;
     if (TarnContainerClassIsBundle(containerClass)) topLevelOwner = CONTAINER_INSTALLATION_UID;
     if (TarnContainerClassIsSystem(containerClass)) topLevelOwner = 0;
-    return TarnFileManager::defaultManager().createDirectoryAtURL(
-        url, true, 0755, topLevelOwner, kTarnDataProtectionClassNone, error);
+    const TarnStatus created = TarnFileManager::defaultManager().createDirectoryAtURL(
+        url, /*withIntermediateDirectories=*/true, 0755, topLevelOwner,
+        kTarnDataProtectionClassNone);
+    if (!created.ok() && error) *error = created.error();
+    return created.ok();
 }
 
 bool TarnClientConnection::_createSubDirectories(const FileURL& url,
@@ -348,12 +348,12 @@ bool TarnClientConnection::_createSubDirectories(const FileURL& url,
         if (TarnContainerClassIsPerUser(containerClass) &&
             std::find(excluded.begin(), excluded.end(), name) != excluded.end())
             subdirectoryClass = kTarnDataProtectionClassNone;
-        TarnErrorRef underlying;
-        if (!fm.createDirectoryAtURL(subdirectory, true, mode, owner,
-                                     static_cast<TarnDataProtectionClass>(subdirectoryClass),
-                                     &underlying)) {
+        if (const TarnStatus created = fm.createDirectoryAtURL(
+                subdirectory, /*withIntermediateDirectories=*/true, mode, owner,
+                static_cast<TarnDataProtectionClass>(subdirectoryClass));
+            !created.ok()) {
             TarnErrorRef e =
-                TARN_ERROR(TarnErrorCreateDirectoryFailed, underlying,
+                TARN_ERROR(TarnErrorCreateDirectoryFailed, created.error(),
                            "Failed to create sub-dir for %@ at %@ (protClass: %d)",
                            containerMetadata->identifier(), subdirectory, subdirectoryClass);
             if (error) *error = e;
@@ -479,20 +479,26 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
                                                            std::nullopt);
         metadata->setTransient(transient);
         if (!metadata->writeMetadataToDiskWithError(&failure)) return;
-        if (TarnContainerClassIsSystem(containerClass) &&
-            !fm.setTopLevelSystemContainerACLAtURL(stagingURL, &failure))
-            return;
+        if (TarnContainerClassIsSystem(containerClass)) {
+            if (const TarnStatus acl = fm.setTopLevelSystemContainerACLAtURL(stagingURL);
+                !acl.ok()) {
+                failure = acl.error();
+                return;
+            }
+        }
         if (!connection._createSubDirectories(stagingURL, metadata, &failure)) return;
 
         std::optional<FileURL> liveParent = configuration.containerDirectoryURLForUserIdentity(
             userIdentity, containerClass, transient);
         liveURL = PathJoin(liveParent.value_or(FileURL()),
                            liveDirectoryName(identifier, containerClass, directoryName));
-        TarnErrorRef moveError;
-        if (!liveParent || !fm.moveItemAtURL(stagingURL, liveURL, &moveError))
-            failure =
-                TARN_ERROR_IN(kCreateOrLookup, TarnErrorMoveStagingFailed, moveError,
-                           "Failed to move staging dir: %@ to live dir: %@", stagingURL, liveURL);
+        // No live directory fails the move with no underlying error.
+        const TarnStatus moved =
+            liveParent ? fm.moveItemAtURL(stagingURL, liveURL) : TarnStatus(TarnErrorRef());
+        if (!moved.ok())
+            failure = TARN_ERROR_IN(kCreateOrLookup, TarnErrorMoveStagingFailed, moved.error(),
+                                    "Failed to move staging dir: %@ to live dir: %@", stagingURL,
+                                    liveURL);
     }();
 
     if (failure) {

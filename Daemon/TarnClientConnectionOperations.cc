@@ -285,10 +285,12 @@ void TarnClientConnection::recreateDefaultStructureWithContainerIdentity(
         }
         // New subdirectories of a system container need the system-users ACL
         // that the rest of the tree carries.
-        if (TarnContainerClassIsSystem(metadata->containerClass()) &&
-            !TarnFileManager::defaultManager().standardizeACLsForSystemContainerAtURL(
-                metadata->url(), &failure)) {
-            setErrorFrom(error, failure, TarnErrorACLFailed);
+        if (TarnContainerClassIsSystem(metadata->containerClass())) {
+            if (const TarnStatus standardized =
+                    TarnFileManager::defaultManager().standardizeACLsForSystemContainerAtURL(
+                        metadata->url());
+                !standardized.ok())
+                setErrorFrom(error, standardized.error(), TarnErrorACLFailed);
         }
     });
 }
@@ -322,11 +324,12 @@ void TarnClientConnection::regenerateDirectoryUUIDWithContainerIdentity(
             return;
         }
         const FileURL newURL = PathJoin(PathParent(oldURL), Uuid::generate().string());
-        TarnErrorRef moveError;
-        if (!TarnFileManager::defaultManager().moveItemAtURL(oldURL, newURL, &moveError)) {
-            setErrorFrom(error,
-                         TARN_ERROR_IN(operation, TarnErrorUUIDMoveFailed, moveError,
-                                    "Failed to move dir: %@ to new UUID dir: %@", oldURL, newURL));
+        if (const TarnStatus moved =
+                TarnFileManager::defaultManager().moveItemAtURL(oldURL, newURL);
+            !moved.ok()) {
+            setErrorFrom(
+                error, TARN_ERROR_IN(operation, TarnErrorUUIDMoveFailed, moved.error(),
+                                     "Failed to move dir: %@ to new UUID dir: %@", oldURL, newURL));
             return;
         }
         TarnErrorRef cacheError;

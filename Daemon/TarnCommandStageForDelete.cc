@@ -108,15 +108,13 @@ bool TarnCommandStageForDelete::stageAll(TarnCommandQueue* queue, uint64_t* erro
                     container->identifier(), queue);
         }
 
-        TarnErrorRef moveError;
-        if (!fm.moveItemAtURL(url, deathRowURL, &moveError)) {
+        if (const TarnStatus moved = fm.moveItemAtURL(url, deathRowURL); !moved.ok()) {
             TarnLog(kLogDebug, "fromQueue", "Couldn't stage for deletion from %@ to %@: %@", url,
-                    deathRowURL, moveError);
-            TarnErrorRef removeError;
-            if (!fm.removeItemAtURL(url, &removeError)) {
+                    deathRowURL, moved.error());
+            if (const TarnStatus removed = fm.removeItemAtURL(url); !removed.ok()) {
                 // Logged only: the container stays live and cached, the others go on.
-                (void)TARN_ERROR_IN("fromQueue", TarnErrorDeleteFailed, removeError,
-                                    "Failed to delete container at %@: %@", url, removeError);
+                (void)TARN_ERROR_IN("fromQueue", TarnErrorDeleteFailed, removed.error(),
+                                    "Failed to delete container at %@: %@", url, removed.error());
                 continue;
             }
         }

@@ -263,10 +263,9 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
         }
     }
     if (!classDirectory) {
-        TarnErrorRef listError;
-        auto listed = fileManager.urlsForItemsInDirectoryAtURL(*directory, &listError);
-        if (!listed) {
-            if (error) *error = listError;
+        auto listed = fileManager.urlsForItemsInDirectoryAtURL(*directory);
+        if (!listed.ok()) {
+            if (error) *error = listed.error();
             return nullptr;
         }
         for (FileURL& entry : *listed)

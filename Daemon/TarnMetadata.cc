@@ -133,11 +133,12 @@ bool TarnMetadata::writeMetadataToFileURL(const FileURL& fileURL, TarnErrorRef* 
         if (error) *error = std::move(e);
         return false;
     }
-    if (!TarnFileManager::defaultManager().moveItemAtURL(temp, fileURL, &underlying)) {
-        auto e = TARN_ERROR(TarnErrorWriteFailed, underlying,
+    if (TarnStatus moved = TarnFileManager::defaultManager().moveItemAtURL(temp, fileURL);
+        !moved.ok()) {
+        auto e = TARN_ERROR(TarnErrorWriteFailed, moved.error(),
                             "Failed to move metadata from staging: %@ to final: %@", temp, fileURL);
         // The old file is still in place; the stray temporary one is only litter.
-        (void)TarnFileManager::defaultManager().removeItemAtURL(temp, nullptr);
+        (void)TarnFileManager::defaultManager().removeItemAtURL(temp);
         if (error) *error = std::move(e);
         return false;
     }
@@ -159,9 +160,10 @@ TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtFileUrl(
     const FileURL& fileURL, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
     TarnErrorRef* error) {
     std::string bytes;
-    auto data = TarnFileManager::defaultManager().readDataAtURL(fileURL, kMaxPlistBytes, nullptr);
-    if (data) bytes = std::move(*data);
-    return validate(data ? 0 : EIO, bytes, MetadataLocation{PathParent(fileURL), &fileURL},
+    // Why the read failed makes no difference: the file is unreadable either way.
+    auto data = TarnFileManager::defaultManager().readDataAtURL(fileURL, kMaxPlistBytes);
+    if (data.ok()) bytes = std::move(data).value();
+    return validate(data.ok() ? 0 : EIO, bytes, MetadataLocation{PathParent(fileURL), &fileURL},
                     forUserIdentity, checkClassPath, error);
 }
 

@@ -22,15 +22,19 @@ bool Tarn_writeToURL(const PlistValue& dictionary, const FileURL& url, uint64_t 
         if (error) *error = formatError(__func__, __LINE__, "Property list could not be serialised");
         return false;
     }
-    return TarnFileManager::defaultManager().writeData(
-        std::string(reinterpret_cast<const char*>(bytes.data()), bytes.size()), url, withOptions,
-        error);
+    const TarnStatus written = TarnFileManager::defaultManager().writeData(
+        std::string(reinterpret_cast<const char*>(bytes.data()), bytes.size()), url, withOptions);
+    if (!written.ok() && error) *error = written.error();
+    return written.ok();
 }
 
 std::optional<PlistValue> Tarn_dictionaryWithContentsOfURL(const FileURL& url, uint64_t options,
                                                            TarnErrorRef* error) {
-    auto bytes = TarnFileManager::defaultManager().readDataAtURL(url, kMaxPlistBytes, error);
-    if (!bytes) return std::nullopt;
+    auto bytes = TarnFileManager::defaultManager().readDataAtURL(url, kMaxPlistBytes);
+    if (!bytes.ok()) {
+        if (error) *error = bytes.error();
+        return std::nullopt;
+    }
     std::string why;
     auto value = PlistValue::fromBytes(bytes->data(), bytes->size(), &why);
     if (!value) {

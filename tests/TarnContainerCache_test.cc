@@ -161,8 +161,8 @@ TEST_F(TarnContainerCacheTest, KeyPartsHashAndCompareLikeTheKeyText) {
 TEST_F(TarnContainerCacheTest, RebuildKeepsTheLastOfTwoDirectoriesClaimingOneIdentifier) {
     makeContainer(2, "com.ostrea.twice");
     makeContainer(2, "com.ostrea.twice");
-    auto listing = TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(base(2), nullptr);
-    ASSERT_TRUE(listing && listing->size() == 2);
+    auto listing = TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(base(2));
+    ASSERT_TRUE(listing.ok() && listing->size() == 2);
     uint64_t code = 0;
     auto found = lookup(2, "com.ostrea.twice", &code);
     ASSERT_TRUE(found) << code;
