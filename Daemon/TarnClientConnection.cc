@@ -478,7 +478,10 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
         metadata = TarnMetadata::initWithContainerIdentity(concrete, std::nullopt, stagingURL,
                                                            std::nullopt);
         metadata->setTransient(transient);
-        if (!metadata->writeMetadataToDiskWithError(&failure)) return;
+        if (const TarnStatus written = metadata->writeMetadataToDiskWithError(); !written.ok()) {
+            failure = written.error();
+            return;
+        }
         if (TarnContainerClassIsSystem(containerClass)) {
             if (const TarnStatus acl = fm.setTopLevelSystemContainerACLAtURL(stagingURL);
                 !acl.ok()) {

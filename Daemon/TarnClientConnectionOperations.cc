@@ -191,9 +191,8 @@ void TarnClientConnection::setInfoValue(const std::optional<PlistValue>& value,
 
         TarnMutableMetadataRef changed = metadata->copy();
         changed->setInfo(std::move(info));
-        TarnErrorRef writeError;
-        if (!changed->writeMetadataToDiskWithError(&writeError)) {
-            setErrorFrom(error, writeError, TarnErrorWriteFailed);
+        if (const TarnStatus written = changed->writeMetadataToDiskWithError(); !written.ok()) {
+            setErrorFrom(error, written.error(), TarnErrorWriteFailed);
             return;
         }
         TarnErrorRef cacheError;

@@ -223,12 +223,15 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
     auto take = [&](FileURL entry) {
         cacheLock_.assertHeld();  // called only from this function, lock held
         // Not a container of ours when unreadable: the error is of no use here.
-        TarnMetadataRef metadata =
-            classDirectory
-                ? TarnMetadata::readAndValidateMetadataInClassDirectory(
-                      classDirectory, std::move(entry), userIdentity, true, nullptr)
-                : TarnMetadata::readAndValidateMetadataAtUrl(entry, userIdentity, true, nullptr);
-        if (!metadata) return;
+        TarnResult<TarnMutableMetadataRef> read =
+            classDirectory ? TarnMetadata::readAndValidateMetadataInClassDirectory(
+                                 classDirectory, std::move(entry), userIdentity,
+                                 /*checkClassPath=*/true, TarnMetadataUnreadable::kQuiet)
+                           : TarnMetadata::readAndValidateMetadataAtUrl(
+                                 entry, userIdentity,
+                                 /*checkClassPath=*/true, TarnMetadataUnreadable::kQuiet);
+        if (!read.ok()) return;
+        TarnMetadataRef metadata = std::move(read).value();
         const std::string& identifier = metadata->identifier();
         if (populateSandboxCache && !transient &&
             _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier,
@@ -474,14 +477,14 @@ TarnMetadataRef TarnContainerCache::_lock_metadataFromSandboxForContainerIdentit
         endInterval();
         return nullptr;
     }
-    TarnErrorRef readError;
-    TarnMetadataRef metadata =
-        TarnMetadata::readAndValidateMetadataAtUrl(*foundPath, userIdentity, true, &readError);
+    TarnResult<TarnMutableMetadataRef> read = TarnMetadata::readAndValidateMetadataAtUrl(
+        *foundPath, userIdentity, /*checkClassPath=*/true);
+    TarnMetadataRef metadata = read.ok() ? std::move(read).value() : TarnMetadataRef();
     TarnMetadataRef answer;
     if (!metadata) {
         TarnLog(kLogError, __func__,
                 "Could not validate container from Sandbox-provided path [%@]; error = %@",
-                *foundPath, readError);
+                *foundPath, read.error());
     } else if (metadata->containerClass() != containerClass || metadata->identifier() != wanted) {
         TarnLog(
             kLogError, __func__,

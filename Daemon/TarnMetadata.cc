@@ -107,11 +107,11 @@ PlistValue TarnMetadata::dictionaryRepresentation() const {
     return PlistValue(std::move(d));
 }
 
-bool TarnMetadata::writeMetadataToDiskWithError(TarnErrorRef* error) const {
-    return writeMetadataToFileURL(PathJoin(url_, kTarnMetadataFileName), error);
+TarnStatus TarnMetadata::writeMetadataToDiskWithError() const {
+    return writeMetadataToFileURL(PathJoin(url_, kTarnMetadataFileName));
 }
 
-bool TarnMetadata::writeMetadataToFileURL(const FileURL& fileURL, TarnErrorRef* error) const {
+TarnStatus TarnMetadata::writeMetadataToFileURL(const FileURL& fileURL) const {
     const PlistValue dictionary = dictionaryRepresentation();
     // Staged on the container's own volume so that the final move is one rename.
     const FileURL temp = PathJoin(
@@ -123,53 +123,52 @@ bool TarnMetadata::writeMetadataToFileURL(const FileURL& fileURL, TarnErrorRef* 
 
     // Atomic as well as unprotected: the bytes are fsynced before any rename,
     // so a power cut cannot leave an empty metadata file behind the final move.
-    TarnErrorRef underlying;
-    if (!Tarn_writeToURL(dictionary, temp, kTarnWriteAtomic | kTarnWriteNoFileProtection,
-                         &underlying)) {
-        auto e = TARN_ERROR(TarnErrorWriteFailed, underlying,
-                            "Failed to write metadata dictionary to URL %@ : %@:%ld", temp,
-                            underlying ? underlying->domain() : std::string("(null)"),
-                            underlying ? static_cast<long>(underlying->code()) : 0L);
-        if (error) *error = std::move(e);
-        return false;
+    if (TarnStatus written =
+            Tarn_writeToURL(dictionary, temp, kTarnWriteAtomic | kTarnWriteNoFileProtection);
+        !written.ok()) {
+        const TarnErrorRef& underlying = written.error();
+        return TARN_ERROR(TarnErrorWriteFailed, underlying,
+                          "Failed to write metadata dictionary to URL %@ : %@:%ld", temp,
+                          underlying ? underlying->domain() : std::string("(null)"),
+                          underlying ? static_cast<long>(underlying->code()) : 0L);
     }
     if (TarnStatus moved = TarnFileManager::defaultManager().moveItemAtURL(temp, fileURL);
         !moved.ok()) {
-        auto e = TARN_ERROR(TarnErrorWriteFailed, moved.error(),
-                            "Failed to move metadata from staging: %@ to final: %@", temp, fileURL);
+        TarnErrorRef e =
+            TARN_ERROR(TarnErrorWriteFailed, moved.error(),
+                       "Failed to move metadata from staging: %@ to final: %@", temp, fileURL);
         // The old file is still in place; the stray temporary one is only litter.
         (void)TarnFileManager::defaultManager().removeItemAtURL(temp);
-        if (error) *error = std::move(e);
-        return false;
+        return e;
     }
-    return true;
+    return {};
 }
 
 FileURL TarnMetadata::MetadataLocation::fileURL() const {
     return file ? *file : PathJoin(container, kTarnMetadataFileName);
 }
 
-TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtUrl(
+TarnResult<TarnMutableMetadataRef> TarnMetadata::readAndValidateMetadataAtUrl(
     const FileURL& url, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
-    TarnErrorRef* error) {
+    TarnMetadataUnreadable unreadable) {
     return readAndValidateMetadataAtFileUrl(PathJoin(url, kTarnMetadataFileName), forUserIdentity,
-                                            checkClassPath, error);
+                                            checkClassPath, unreadable);
 }
 
-TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtFileUrl(
+TarnResult<TarnMutableMetadataRef> TarnMetadata::readAndValidateMetadataAtFileUrl(
     const FileURL& fileURL, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
-    TarnErrorRef* error) {
+    TarnMetadataUnreadable unreadable) {
     std::string bytes;
     // Why the read failed makes no difference: the file is unreadable either way.
     auto data = TarnFileManager::defaultManager().readDataAtURL(fileURL, kMaxPlistBytes);
     if (data.ok()) bytes = std::move(data).value();
     return validate(data.ok() ? 0 : EIO, bytes, MetadataLocation{PathParent(fileURL), &fileURL},
-                    forUserIdentity, checkClassPath, error);
+                    forUserIdentity, checkClassPath, unreadable);
 }
 
-TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataInClassDirectory(
+TarnResult<TarnMutableMetadataRef> TarnMetadata::readAndValidateMetadataInClassDirectory(
     const FsFd& classDirectory, FileURL url, const TarnUserIdentityRef& forUserIdentity,
-    bool checkClassPath, TarnErrorRef* error) {
+    bool checkClassPath, TarnMetadataUnreadable unreadable) {
     // A rebuild calls this once per container on one thread: the name and the
     // bytes reuse this thread's buffers instead of allocating per file.
     thread_local std::string relative;
@@ -178,7 +177,7 @@ TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataInClassDirectory(
     int err = TarnFileManager::defaultManager().readDataInDirectory(classDirectory, relative,
                                                                     kMaxPlistBytes, &bytes);
     auto metadata = validate(err, bytes, MetadataLocation{std::move(url), nullptr}, forUserIdentity,
-                             checkClassPath, error);
+                             checkClassPath, unreadable);
     // One odd large file must not keep its size for the thread's lifetime.
     if (bytes.capacity() > 64 * 1024) std::string().swap(bytes);
     return metadata;
@@ -219,10 +218,10 @@ struct TarnMetadata::ParsedFields {
     }
 };
 
-TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& bytes,
-                                              MetadataLocation where,
-                                              const TarnUserIdentityRef& forUserIdentity,
-                                              bool checkClassPath, TarnErrorRef* error) {
+TarnResult<TarnMutableMetadataRef> TarnMetadata::validate(
+    int readError, const std::string& bytes, MetadataLocation where,
+    const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
+    TarnMetadataUnreadable unreadable) {
     // A rebuild reads thousands of these files: their few entries are decoded
     // into this thread's reused list, without a dictionary. Anything that
     // reader leaves alone (and the debug line, which shows the whole
@@ -235,8 +234,7 @@ TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& 
         PlistBinaryRootEntries(bytes.data(), bytes.size(), &entries, kTarnMetadataUserIdentityKey,
                                &identity)) {
         ParsedFields fields{&entries, nullptr, &identity};
-        auto metadata = validateFields(fields, std::move(where), forUserIdentity, checkClassPath,
-                                       error);
+        auto metadata = validateFields(fields, std::move(where), forUserIdentity, checkClassPath);
         // The keys point into `bytes`.
         entries.clear();
         identity.clear();
@@ -246,22 +244,17 @@ TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& 
     std::optional<PlistValue> dictionary;
     if (readError == 0) dictionary = PlistValue::fromBytes(bytes.data(), bytes.size());
     if (!dictionary || !dictionary->isDict()) {
-        if (error)
-            *error = TARN_ERROR(TarnErrorReadFailed, nullptr, "Failed to read metadata at URL %@",
-                                where.fileURL());
-        return nullptr;
+        if (unreadable == TarnMetadataUnreadable::kQuiet) return TarnErrorRef();
+        return TARN_ERROR(TarnErrorReadFailed, nullptr, "Failed to read metadata at URL %@",
+                          where.fileURL());
     }
     ParsedFields fields{nullptr, &*dictionary};
-    return validateFields(fields, std::move(where), forUserIdentity, checkClassPath, error);
+    return validateFields(fields, std::move(where), forUserIdentity, checkClassPath);
 }
 
-TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, MetadataLocation where,
-                                                    const TarnUserIdentityRef& forUserIdentity,
-                                                    bool checkClassPath, TarnErrorRef* error) {
-    auto fail = [error](TarnErrorRef e) -> TarnMutableMetadataRef {
-        if (error) *error = std::move(e);
-        return nullptr;
-    };
+TarnResult<TarnMutableMetadataRef> TarnMetadata::validateFields(
+    ParsedFields& fields, MetadataLocation where, const TarnUserIdentityRef& forUserIdentity,
+    bool checkClassPath) {
     // Only a failure names the file, so only a failure pays for its path.
     auto fileURL = [&where] { return where.fileURL(); };
     // The debug lines show the whole dictionary, when there is one.
@@ -269,39 +262,37 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
 
     const PlistValue* identifierValue = fields.find(kTarnMetadataIdentifierKey);
     if (!identifierValue || !identifierValue->isString()) {
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Invalid metadata Identifier: %@ at %@", describe(identifierValue),
-                               fileURL()));
+        return TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                          "Invalid metadata Identifier: %@ at %@", describe(identifierValue),
+                          fileURL());
     }
     // The parsed tree is ours and not shared: take the identifier out of it
     // unless the debug line at the end is going to show the whole dictionary.
-    std::string identifier = showDictionary
-                                 ? *identifierValue->asString()
-                                 : std::move(const_cast<std::string&>(*identifierValue->asString()));
+    std::string identifier =
+        showDictionary ? *identifierValue->asString()
+                       : std::move(const_cast<std::string&>(*identifierValue->asString()));
 
     const PlistValue* uuidValue = fields.find(kTarnMetadataUUIDKey);
     if (!uuidValue || !uuidValue->isString()) {
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Invalid metadata UUID String: %@ at %@", describe(uuidValue),
-                               fileURL()));
+        return TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                          "Invalid metadata UUID String: %@ at %@", describe(uuidValue), fileURL());
     }
     std::optional<Uuid> uuid = Uuid::parse(*uuidValue->asString());
     if (!uuid) {
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata UUID: %@ at %@",
-                               *uuidValue->asString(), fileURL()));
+        return TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata UUID: %@ at %@",
+                          *uuidValue->asString(), fileURL());
     }
 
     const PlistValue* classValue = fields.find(kTarnMetadataContentClassKey);
     if (!classValue || !classValue->isNumber()) {
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Invalid metadata Class: %@ at %@", describe(classValue),
-                               fileURL()));
+        return TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata Class: %@ at %@",
+                          describe(classValue), fileURL());
     }
     auto classNumber = integralValue(*classValue);
     if (!classNumber || !TarnContainerClassIsValid(*classNumber)) {
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Invalid metadata Content Class: %ld at %@",
-                               static_cast<long>(classNumber.value_or(-1)), fileURL()));
+        return TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                          "Invalid metadata Content Class: %ld at %@",
+                          static_cast<long>(classNumber.value_or(-1)), fileURL());
     }
     const TarnContainerClass containerClass = static_cast<TarnContainerClass>(*classNumber);
 
@@ -312,10 +303,10 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
     } else {
         if (!forUserIdentity) {
             PlistValue scratch;
-            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                   "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
-                                   describe(fields.storedIdentity(&scratch)), "(null)",
-                                   identifier, fileURL(), uint64_t{TarnSuccess}));
+            return TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                              "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
+                              describe(fields.storedIdentity(&scratch)), "(null)", identifier,
+                              fileURL(), uint64_t{TarnSuccess});
         }
         const uint32_t expectedUID = forUserIdentity->posixUIDForContainerClass(containerClass);
         const PlistValue* persona = fields.find(kTarnMetadataPersonaKey);
@@ -323,11 +314,12 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
             if (!persona) {
                 // Absent means the expected user (see below); only the debug
                 // line needs to show it filled in.
-                if (showDictionary) fields.dict->set(kTarnMetadataPersonaKey, PlistValue(expectedUID));
+                if (showDictionary)
+                    fields.dict->set(kTarnMetadataPersonaKey, PlistValue(expectedUID));
             } else if (integralValue(*persona) != std::optional<int64_t>(expectedUID)) {
-                return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                       "Incorrect UserId: %@, expecting: %u for %@ at %@",
-                                       persona->description(), expectedUID, identifier, fileURL()));
+                return TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                                  "Incorrect UserId: %@, expecting: %u for %@ at %@",
+                                  persona->description(), expectedUID, identifier, fileURL());
             }
         }
         const PlistValue* stored = fields.find(kTarnMetadataUserIdentityKey);
@@ -346,16 +338,14 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
                 owner = TarnUserIdentity::userIdentityWithPlist(*fields.storedIdentity(&scratch),
                                                                 cache, &code);
             if (!owner) {
-                return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                       "Invalid metadata User Identity: %@ for %@ at %@: %llu",
-                                       *fields.storedIdentity(&scratch), identifier, fileURL(),
-                                       code));
+                return TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                                  "Invalid metadata User Identity: %@ for %@ at %@: %llu",
+                                  *fields.storedIdentity(&scratch), identifier, fileURL(), code);
             }
             if (!owner->isEqualToUserIdentity(*forUserIdentity)) {
-                return fail(
-                    TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
-                               owner, forUserIdentity, identifier, fileURL(), code));
+                return TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                                  "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
+                                  owner, forUserIdentity, identifier, fileURL(), code);
             }
         }
     }
@@ -363,8 +353,8 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
     std::optional<PlistValue> info;
     if (const PlistValue* infoValue = fields.find(kTarnMetadataInfoKey)) {
         if (!infoValue->isDict()) {
-            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                   "Invalid metadata Info: %@ at %@", *infoValue, fileURL()));
+            return TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata Info: %@ at %@",
+                              *infoValue, fileURL());
         }
         // The parsed tree is ours: move the info out unless the debug line below
         // is going to show the whole dictionary.
@@ -377,9 +367,9 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
     std::optional<std::string> userManagedAssetsDirName;
     if (const PlistValue* name = fields.find(kTarnMetadataUserManagedAssetsDirNameKey)) {
         if (!name->isString()) {
-            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                   "Invalid metadata User Managed Dir Name String: %@ at %@", *name,
-                                   fileURL()));
+            return TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                              "Invalid metadata User Managed Dir Name String: %@ at %@", *name,
+                              fileURL());
         }
         userManagedAssetsDirName = *name->asString();
     }
@@ -390,9 +380,8 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
             const FileURL classDirectory = PathParent(where.container);
             const FileURL expected =
                 PathJoin(PathParent(PathParent(classDirectory)), relative ? relative : "");
-            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                   "Invalid metadata-URLs should match: %@ : %@", fileURL(),
-                                   expected));
+            return TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                              "Invalid metadata-URLs should match: %@ : %@", fileURL(), expected);
         }
     }
 
@@ -403,8 +392,8 @@ TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, Metada
         uint64_t code = TarnSuccess;
         (void)TarnConcreteContainerIdentity::containerIdentityWithUUID(
             *uuid, owner, std::move(identifier), containerClass, &code);
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Could not create user identity from %@: %llu", fileURL(), code));
+        return TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
+                          "Could not create user identity from %@: %llu", fileURL(), code);
     }
     auto metadata = std::make_shared<TarnMetadata>(
         FieldsTag{}, containerClass, std::move(owner), std::move(identifier), *uuid,

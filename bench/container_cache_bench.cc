@@ -104,7 +104,7 @@ int main(int argc, char** argv) {
             uuid, user, identifier, 2, nullptr);
         auto m = tarn::TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir,
                                                                std::nullopt);
-        if (!m->writeMetadataToDiskWithError(nullptr)) return 1;
+        if (!m->writeMetadataToDiskWithError().ok()) return 1;
         identifiers.push_back(identifier);
         metadataFiles.push_back(dir + "/" + tarn::kTarnMetadataFileName);
     }
@@ -182,9 +182,12 @@ int main(int argc, char** argv) {
             return 1;
         auto t1 = Clock::now();
         std::vector<tarn::TarnMetadataRef> read;
-        for (const auto& url : urls)
-            read.push_back(tarn::TarnMetadata::readAndValidateMetadataInClassDirectory(
-                directory, url, user, true, nullptr));
+        for (const auto& url : urls) {
+            auto m = tarn::TarnMetadata::readAndValidateMetadataInClassDirectory(
+                directory, url, user, /*checkClassPath=*/true,
+                tarn::TarnMetadataUnreadable::kQuiet);
+            read.push_back(m.ok() ? std::move(m).value() : nullptr);
+        }
         auto t2 = Clock::now();
         size_t yes = 0;
         for (const auto& m : read)

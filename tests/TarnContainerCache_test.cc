@@ -89,8 +89,8 @@ class TarnContainerCacheTest : public test::ScratchRootTest {
         auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
             uuid, user ? user : mobile(), identifier, c, nullptr);
         auto m = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir, std::nullopt);
-        TarnErrorRef error;
-        EXPECT_TRUE(m->writeMetadataToDiskWithError(&error)) << (error ? error->description() : "");
+        TarnStatus written = m->writeMetadataToDiskWithError();
+        EXPECT_TRUE(written.ok()) << (written.error() ? written.error()->description() : "");
         return m;
     }
 
