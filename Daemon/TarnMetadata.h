@@ -137,7 +137,10 @@ private:
                                                      bool checkClassPath,
                                                      TarnMetadataUnreadable unreadable);
   struct ParsedFields;
-  // The checks of validate() on the decoded entries; takes values out of them.
+  // One validator per field, each taking what it checks out of the entries.
+  struct FieldValidator;
+  // The checks of validate() on the decoded entries, one field after
+  // another; takes values out of them.
   static TarnResult<TarnMutableMetadataRef> validateFields(
       ParsedFields& fields, MetadataLocation where, const TarnUserIdentityRef& forUserIdentity,
       bool checkClassPath);

@@ -60,6 +60,10 @@ protected:
         }
         EXPECT_EQ(error->code(), code);
         EXPECT_TRUE(error->isTarn());
+        // The error and its line name the step that refused the file, as they
+        // always have: log readers search for these names.
+        EXPECT_EQ(error->functionName(),
+                  code == TarnErrorReadFailed ? "validate" : "validateFields");
         return error->localizedDescription().value_or("");
     }
 };
