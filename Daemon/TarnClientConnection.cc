@@ -518,12 +518,12 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
 
     metadata->setUrl(liveURL);
     metadata->setExisted(false);
-    TarnErrorRef cacheError;
-    if (!TarnContainerCache::sharedInstance().addContainerMetadata(metadata, liveURL, transient,
-                                                                   true, &cacheError)) {
-        *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorCacheAddFailed, cacheError,
-                            "Failed to add to cache : %@, url: %@, transient: %d",
-                            metadata->description(), liveURL, transient);
+    if (const TarnStatus added = TarnContainerCache::sharedInstance().addContainerMetadata(
+            metadata, liveURL, transient, /*updateSandbox=*/true);
+        !added.ok()) {
+        *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorCacheAddFailed, added.error(),
+                               "Failed to add to cache : %@, url: %@, transient: %d",
+                               metadata->description(), liveURL, transient);
         return nullptr;
     }
     return metadata;
@@ -561,13 +561,12 @@ TarnMetadataRef createOrLookup(TarnClientConnection& connection,
         !(connection.clientIdentity() && connection.clientIdentity()->isKernel());
     if (!transient) {
         if (useLocking) globalLock.readLock();
-        TarnErrorRef lookupError;
-        TarnMetadataRef cached = cache.containerForContainerIdentity(
-            identity, false, true, allowKernelLookup, &lookupError);
+        const TarnResult<TarnMetadataRef> cached = cache.containerForContainerIdentity(
+            identity, /*transient=*/false, /*updateSandbox=*/true, allowKernelLookup);
         globalLock.release();
-        if (cached) return foundContainer(cached);
-        if (!isNotFound(lookupError)) {
-            *error = lookupError;
+        if (cached.ok()) return foundContainer(*cached);
+        if (!isNotFound(cached.error())) {
+            *error = cached.error();
             return nullptr;
         }
     }
@@ -581,20 +580,21 @@ TarnMetadataRef createOrLookup(TarnClientConnection& connection,
     // Look again under the write lock: another request may have created it
     // since the read lock was let go.
     if (useLocking) globalLock.writeLock();
-    TarnErrorRef lookupError;
-    TarnMetadataRef cached = cache.containerForContainerIdentity(identity, transient, true,
-                                                                 allowKernelLookup, &lookupError);
-    if (cached && !transient) return foundContainer(cached);
-    if (cached) {
+    const TarnResult<TarnMetadataRef> cached = cache.containerForContainerIdentity(
+        identity, transient, /*updateSandbox=*/true, allowKernelLookup);
+    if (cached.ok() && !transient) return foundContainer(*cached);
+    if (cached.ok()) {
         // A transient container is made anew on every request.
+        const FileURL& cachedURL = (*cached)->url();
         TarnErrorRef moveError;
-        if (!connection._moveItemAtURLToDeathRow(cached->url(), true, true, &moveError)) {
+        if (!connection._moveItemAtURLToDeathRow(cachedURL, /*isDir=*/true,
+                                                 /*startDeletionThread=*/true, &moveError)) {
             *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorRemoveTransientFailed, moveError,
-                                "Failed to remove transient container at %@", cached->url());
+                                   "Failed to remove transient container at %@", cachedURL);
             return nullptr;
         }
-    } else if (!isNotFound(lookupError)) {
-        *error = lookupError;
+    } else if (!isNotFound(cached.error())) {
+        *error = cached.error();
         return nullptr;
     }
     return createContainer(connection, identity, transient, error);
@@ -640,12 +640,14 @@ std::optional<std::vector<TarnMetadataRef>> TarnClientConnection::containersWith
             clientIdentity_ ? clientIdentity_->userIdentity() : nullptr;
         if (!userIdentity) userIdentity = TarnUserIdentityCache::defaultUserIdentity();
         globalLock.readLock();
-        TarnErrorRef cacheError;
         auto containers = TarnContainerCache::sharedInstance().allContainersForUserIdentity(
-            userIdentity, containerClass, transient, &cacheError);
+            userIdentity, containerClass, transient);
         globalLock.release();
-        if (!containers) TarnSetError(error, TarnErrorCodeOf(cacheError, TarnErrorInvalidArgument));
-        return containers;
+        if (!containers.ok()) {
+            TarnSetError(error, containers.code(TarnErrorInvalidArgument));
+            return std::nullopt;
+        }
+        return std::move(containers).value();
     } catch (const std::exception& e) {
         globalLock.release();
         TarnSetError(error, TarnHandleCaughtException(__func__, &e));

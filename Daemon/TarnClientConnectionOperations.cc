@@ -195,12 +195,12 @@ void TarnClientConnection::setInfoValue(const std::optional<PlistValue>& value,
             setErrorFrom(error, written.error(), TarnErrorWriteFailed);
             return;
         }
-        TarnErrorRef cacheError;
-        if (!TarnContainerCache::sharedInstance().addContainerMetadata(
-                changed, changed->url(), changed->transient(), false, &cacheError)) {
-            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorCacheAddFailed, cacheError,
-                                           "Failed to add to cache: %@, url: %@, transient: %d",
-                                           changed, changed->url(), changed->transient()));
+        if (const TarnStatus added = TarnContainerCache::sharedInstance().addContainerMetadata(
+                changed, changed->url(), changed->transient(), /*updateSandbox=*/false);
+            !added.ok()) {
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorCacheAddFailed, added.error(),
+                                              "Failed to add to cache: %@, url: %@, transient: %d",
+                                              changed, changed->url(), changed->transient()));
         }
     });
 }
@@ -331,12 +331,12 @@ void TarnClientConnection::regenerateDirectoryUUIDWithContainerIdentity(
                                      "Failed to move dir: %@ to new UUID dir: %@", oldURL, newURL));
             return;
         }
-        TarnErrorRef cacheError;
-        if (!TarnContainerCache::sharedInstance().addContainerMetadata(
-                metadata, newURL, metadata->transient(), true, &cacheError)) {
-            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorCacheAddFailed, cacheError,
-                                           "Failed to add to cache: %@, url: %@, transient: %d",
-                                           metadata, newURL, metadata->transient()));
+        if (const TarnStatus added = TarnContainerCache::sharedInstance().addContainerMetadata(
+                metadata, newURL, metadata->transient(), /*updateSandbox=*/true);
+            !added.ok()) {
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorCacheAddFailed, added.error(),
+                                              "Failed to add to cache: %@, url: %@, transient: %d",
+                                              metadata, newURL, metadata->transient()));
         }
     });
 }

@@ -21,8 +21,10 @@ TarnMetadataRef cachedContainerForIdentity(TarnContainerCache& cache,
                                            const TarnContainerIdentityRef& identity) {
     if (auto concrete = std::dynamic_pointer_cast<const TarnConcreteContainerIdentity>(identity))
         return cache.containerForContainerIdentity(concrete);
-    TarnErrorRef lookupError;  // not found: nothing to stage
-    return cache.containerForContainerIdentity(identity, false, true, &lookupError);
+    // Not found: nothing to stage.
+    auto found =
+        cache.containerForContainerIdentity(identity, /*transient=*/false, /*updateSandbox=*/true);
+    return found.valueOr(nullptr);
 }
 
 // A transient bundle shares its identifier's code-signing records with the
@@ -38,12 +40,13 @@ bool keepsCodeSigningRecords(TarnContainerCache& cache, const TarnMetadata& cont
                 container.identifier(), code);
         return false;
     }
-    TarnErrorRef lookupError;
-    if (!cache.containerForContainerIdentity(permanent, false, false, &lookupError)) return false;
+    const TarnResult<TarnMetadataRef> found = cache.containerForContainerIdentity(
+        permanent, /*transient=*/false, /*updateSandbox=*/false);
+    if (!found.ok()) return false;
     PlatformLog("unspecified", PlatformLogType::Default,
                 "Skipping removal of code sign mapping since container to be deleted [%@] is "
                 "transient and there's a permanent one; error = %@",
-                container.description(), lookupError);
+                container.description(), found.error());
     return true;
 }
 
@@ -119,12 +122,12 @@ bool TarnCommandStageForDelete::stageAll(TarnCommandQueue* queue, uint64_t* erro
             }
         }
 
-        TarnErrorRef cacheError;
-        if (!cache.removeContainerForUserIdentity(
+        if (const TarnStatus removed = cache.removeContainerForUserIdentity(
                 container->userIdentity(), container->containerClass(), container->identifier(),
-                container->transient(), &cacheError)) {
+                container->transient());
+            !removed.ok()) {
             TarnErrorRef e = TARN_ERROR_IN(
-                "fromQueue", TarnErrorCacheRemoveFailed, cacheError,
+                "fromQueue", TarnErrorCacheRemoveFailed, removed.error(),
                 "Failed to remove from cache id: %@, class: %ld, transient: %d",
                 container->identifier(), static_cast<int64_t>(container->containerClass()),
                 container->transient());

@@ -114,9 +114,10 @@ int main(int argc, char** argv) {
     auto probe = [&](tarn::TarnContainerCache& cache, size_t i) {
         auto identity = tarn::TarnContainerIdentity::containerIdentityWithUserIdentity(
             user, identifiers[i], 2, nullptr);
-        tarn::TarnErrorRef error;
         // No kernel read-back: this measures the scan.
-        return cache.containerForContainerIdentity(identity, false, true, false, &error);
+        return cache.containerForContainerIdentity(identity, /*transient=*/false,
+                                                   /*updateSandbox=*/true,
+                                                   /*allowKernelLookup=*/false);
     };
 
     (void)bareReads(base);  // warm the page cache for both sides
@@ -126,7 +127,7 @@ int main(int argc, char** argv) {
     for (int r = 0; r < rounds; ++r) {
         cache = tarn::TarnContainerCache::initWithUserIdentityCache(identities, nullptr, state);
         auto t0 = Clock::now();
-        bool ok = probe(*cache, 0) != nullptr;
+        bool ok = probe(*cache, 0).ok();
         auto t1 = Clock::now();
         bareBytes = bareReads(base);
         auto t2 = Clock::now();
@@ -151,9 +152,10 @@ int main(int argc, char** argv) {
     for (int done = 0; done < lookups; done += chunk) {
         auto t0 = Clock::now();
         for (int i = 0; i < chunk; ++i) {
-            tarn::TarnErrorRef error;
-            hits += cache->containerForContainerIdentity(probes[(done + i) % containers], false,
-                                                         true, &error) != nullptr;
+            auto found = cache->containerForContainerIdentity(probes[(done + i) % containers],
+                                                              /*transient=*/false,
+                                                              /*updateSandbox=*/true);
+            hits += found.ok();
         }
         auto t1 = Clock::now();
         for (int i = 0; i < chunk; ++i) {

@@ -209,9 +209,10 @@ TEST_F(TarnCreateOrLookupTest, AnEmptyIdentifierMakesOneContainer) {
     EXPECT_TRUE(SandboxUserState::sharedInstance().userStateItemIsRecordedWithPersona(
         mobile->posixUID(), mobile->kernelPersonaID(), TarnContainerClassSandboxItemType(2), "",
         made->url().c_str()));
-    TarnErrorRef error;
-    EXPECT_TRUE(TarnContainerCache::sharedInstance().removeContainerForUserIdentity(
-        TarnUserIdentityCache::defaultUserIdentity(), 2, "", false, &error));
+    EXPECT_TRUE(TarnContainerCache::sharedInstance()
+                    .removeContainerForUserIdentity(TarnUserIdentityCache::defaultUserIdentity(), 2,
+                                                    "", false)
+                    .ok());
 }
 
 TEST_F(TarnCreateOrLookupTest, ConcurrentCreationsOfOneIdentityMakeOneContainer) {

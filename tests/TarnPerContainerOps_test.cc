@@ -94,10 +94,9 @@ class TarnPerContainerOpsTest : public test::ScratchRootTest {
         auto m = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir, std::nullopt);
         TarnStatus written = m->writeMetadataToDiskWithError();
         EXPECT_TRUE(written.ok()) << (written.error() ? written.error()->description() : "");
-        TarnErrorRef error;
-        EXPECT_TRUE(
-            TarnContainerCache::sharedInstance().addContainerMetadata(m, dir, false, true, &error))
-            << (error ? error->description() : "");
+        TarnStatus added = TarnContainerCache::sharedInstance().addContainerMetadata(
+            m, dir, /*transient=*/false, /*updateSandbox=*/true);
+        EXPECT_TRUE(added.ok()) << (added.error() ? added.error()->description() : "");
         return identity;
     }
 
