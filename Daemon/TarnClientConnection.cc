@@ -182,25 +182,25 @@ bool TarnClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, bool isD
     // the rename lands; the item is then still here and needs a new slot.
     constexpr int kAttempts = 3;
     for (int attempt = 1;; ++attempt) {
-        TarnErrorRef underlying;
         // A directory of its own keeps two items of the same name from colliding.
         auto unique = fm.createTemporaryDirectoryInDirectoryURL(
-            TarnGlobalConfiguration::sharedInstance().deathrowDirectory(), &underlying);
-        if (!unique) {
+            TarnGlobalConfiguration::sharedInstance().deathrowDirectory());
+        if (!unique.ok()) {
             if (error)
-                *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, underlying,
+                *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, unique.error(),
                                     "Failed to create unique directory at: %@", url);
             return false;
         }
         const FileURL destination = PathJoin(*unique, PathLastComponent(url));
-        if (fm.moveItemAtURL(url, destination, &underlying)) break;
-        if (underlying && underlying->posixCode() == ENOENT) {
+        const TarnStatus moved = fm.moveItemAtURL(url, destination);
+        if (moved.ok()) break;
+        if (moved.error() && moved.error()->posixCode() == ENOENT) {
             // Already gone; the empty slot goes with the next pass.
             if (fm.itemDoesNotExistAtURL(url)) return true;
             if (attempt < kAttempts) continue;
         }
         if (error)
-            *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, underlying,
+            *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, moved.error(),
                                 "Failed to move item at: %@ to: %@", url, destination);
         return false;
     }
@@ -216,10 +216,9 @@ void TarnClientConnection::deleteContainersOnDeathRowWithCompletion(
         uint64_t result = TarnSuccess;
         try {
             const FileURL deathRow = TarnGlobalConfiguration::sharedInstance().deathrowDirectory();
-            TarnErrorRef listError;
-            auto items =
-                TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow, &listError);
-            if (!items) {
+            auto items = TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow);
+            if (!items.ok()) {
+                const TarnErrorRef listError = items.error();
                 if (!(listError && listError->posixCode() == ENOENT)) {
                     TarnErrorRef e = TARN_ERROR_IN(kOperation, TarnErrorDeleteFailed, listError,
                                                    "Failed to get items for deletion: %@ : %@",
@@ -247,27 +246,25 @@ void TarnClientConnection::deleteContainersOnDeathRowWithCompletion(
 
 bool TarnClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& url, TarnErrorRef* error) {
     auto& fm = TarnFileManager::defaultManager();
-    TarnErrorRef removeError;
-    if (fm.removeItemAtURL(url, &removeError) ||
-        (removeError && removeError->posixCode() == ENOENT))
-        return true;
+    const TarnStatus removed = fm.removeItemAtURL(url);
+    if (removed.ok() || (removed.error() && removed.error()->posixCode() == ENOENT)) return true;
     TarnLog(kLogDebug, __func__, "Couldn't remove, so moving item to /tmp: %@ : %@", url,
-            removeError);
+            removed.error());
 
     const FileURL tmp = RootPath("/tmp");
-    TarnErrorRef moveError;
+    // The move reports any failure.
     if (fm.itemDoesNotExistAtURL(tmp))
-        (void)fm.createDirectoryAtURL(tmp, true, 01777,
-                                      &moveError);  // the move reports any failure
+        (void)fm.createDirectoryAtURL(tmp, /*withIntermediateDirectories=*/true, 01777);
     FileURL destination = PathJoin(tmp, PathLastComponent(url));
     // Never replace something already in /tmp: a taken name goes into a fresh directory.
     if (!fm.itemDoesNotExistAtURL(destination)) {
-        auto unique = fm.createTemporaryDirectoryInDirectoryURL(tmp, "tarnkeeperd.", &moveError);
-        if (unique) destination = PathJoin(*unique, PathLastComponent(url));
+        auto unique = fm.createTemporaryDirectoryInDirectoryURL(tmp, "tarnkeeperd.");
+        if (unique.ok()) destination = PathJoin(*unique, PathLastComponent(url));
     }
     // A rename only: where /tmp is another volume a copy would fail to remove
     // its source for the same reason, and every pass would leave one more copy.
-    if (!fm.renameItemAtURL(url, destination, &moveError)) {
+    if (const TarnStatus renamed = fm.renameItemAtURL(url, destination); !renamed.ok()) {
+        const TarnErrorRef& moveError = renamed.error();
         // Gone meanwhile is done; a missing /tmp is not.
         if (moveError && moveError->posixCode() == ENOENT && fm.itemDoesNotExistAtURL(url))
             return true;
@@ -315,8 +312,11 @@ bool TarnClientConnection::_createTopLevelContainerDirectory(const FileURL& url,
     uint32_t topLevelOwner = owner;
     if (TarnContainerClassIsBundle(containerClass)) topLevelOwner = CONTAINER_INSTALLATION_UID;
     if (TarnContainerClassIsSystem(containerClass)) topLevelOwner = 0;
-    return TarnFileManager::defaultManager().createDirectoryAtURL(
-        url, true, 0755, topLevelOwner, kTarnDataProtectionClassNone, error);
+    const TarnStatus created = TarnFileManager::defaultManager().createDirectoryAtURL(
+        url, /*withIntermediateDirectories=*/true, 0755, topLevelOwner,
+        kTarnDataProtectionClassNone);
+    if (!created.ok() && error) *error = created.error();
+    return created.ok();
 }
 
 bool TarnClientConnection::_createSubDirectories(const FileURL& url,
@@ -348,12 +348,12 @@ bool TarnClientConnection::_createSubDirectories(const FileURL& url,
         if (TarnContainerClassIsPerUser(containerClass) &&
             std::find(excluded.begin(), excluded.end(), name) != excluded.end())
             subdirectoryClass = kTarnDataProtectionClassNone;
-        TarnErrorRef underlying;
-        if (!fm.createDirectoryAtURL(subdirectory, true, mode, owner,
-                                     static_cast<TarnDataProtectionClass>(subdirectoryClass),
-                                     &underlying)) {
+        if (const TarnStatus created = fm.createDirectoryAtURL(
+                subdirectory, /*withIntermediateDirectories=*/true, mode, owner,
+                static_cast<TarnDataProtectionClass>(subdirectoryClass));
+            !created.ok()) {
             TarnErrorRef e =
-                TARN_ERROR(TarnErrorCreateDirectoryFailed, underlying,
+                TARN_ERROR(TarnErrorCreateDirectoryFailed, created.error(),
                            "Failed to create sub-dir for %@ at %@ (protClass: %d)",
                            containerMetadata->identifier(), subdirectory, subdirectoryClass);
             if (error) *error = e;
@@ -479,21 +479,30 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
         metadata = TarnMetadata::initWithContainerIdentity(concrete, std::nullopt, stagingURL,
                                                            std::nullopt);
         metadata->setTransient(transient);
-        if (!metadata->writeMetadataToDiskWithError(&failure)) return;
-        if (TarnContainerClassIsSystem(containerClass) &&
-            !fm.setTopLevelSystemContainerACLAtURL(stagingURL, &failure))
+        if (const TarnStatus written = metadata->writeMetadataToDiskWithError(); !written.ok()) {
+            failure = written.error();
             return;
+        }
+        if (TarnContainerClassIsSystem(containerClass)) {
+            if (const TarnStatus acl = fm.setTopLevelSystemContainerACLAtURL(stagingURL);
+                !acl.ok()) {
+                failure = acl.error();
+                return;
+            }
+        }
         if (!connection._createSubDirectories(stagingURL, metadata, &failure)) return;
 
         std::optional<FileURL> liveParent = configuration.containerDirectoryURLForUserIdentity(
             userIdentity, containerClass, transient);
         liveURL = PathJoin(liveParent.value_or(FileURL()),
                            liveDirectoryName(identifier, containerClass, directoryName));
-        TarnErrorRef moveError;
-        if (!liveParent || !fm.moveItemAtURL(stagingURL, liveURL, &moveError))
-            failure =
-                TARN_ERROR_IN(kCreateOrLookup, TarnErrorMoveStagingFailed, moveError,
-                           "Failed to move staging dir: %@ to live dir: %@", stagingURL, liveURL);
+        // No live directory fails the move with no underlying error.
+        const TarnStatus moved =
+            liveParent ? fm.moveItemAtURL(stagingURL, liveURL) : TarnStatus(TarnErrorRef());
+        if (!moved.ok())
+            failure = TARN_ERROR_IN(kCreateOrLookup, TarnErrorMoveStagingFailed, moved.error(),
+                                    "Failed to move staging dir: %@ to live dir: %@", stagingURL,
+                                    liveURL);
     }();
 
     if (failure) {
@@ -510,12 +519,12 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
 
     metadata->setUrl(liveURL);
     metadata->setExisted(false);
-    TarnErrorRef cacheError;
-    if (!TarnContainerCache::sharedInstance().addContainerMetadata(metadata, liveURL, transient,
-                                                                   true, &cacheError)) {
-        *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorCacheAddFailed, cacheError,
-                            "Failed to add to cache : %@, url: %@, transient: %d",
-                            metadata->description(), liveURL, transient);
+    if (const TarnStatus added = TarnContainerCache::sharedInstance().addContainerMetadata(
+            metadata, liveURL, transient, /*updateSandbox=*/true);
+        !added.ok()) {
+        *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorCacheAddFailed, added.error(),
+                               "Failed to add to cache : %@, url: %@, transient: %d",
+                               metadata->description(), liveURL, transient);
         return nullptr;
     }
     return metadata;
@@ -553,13 +562,12 @@ TarnMetadataRef createOrLookup(TarnClientConnection& connection,
         !(connection.clientIdentity() && connection.clientIdentity()->isKernel());
     if (!transient) {
         if (useLocking) globalLock.readLock();
-        TarnErrorRef lookupError;
-        TarnMetadataRef cached = cache.containerForContainerIdentity(
-            identity, false, true, allowKernelLookup, &lookupError);
+        const TarnResult<TarnMetadataRef> cached = cache.containerForContainerIdentity(
+            identity, /*transient=*/false, /*updateSandbox=*/true, allowKernelLookup);
         globalLock.release();
-        if (cached) return foundContainer(cached);
-        if (!isNotFound(lookupError)) {
-            *error = lookupError;
+        if (cached.ok()) return foundContainer(*cached);
+        if (!isNotFound(cached.error())) {
+            *error = cached.error();
             return nullptr;
         }
     }
@@ -573,20 +581,21 @@ TarnMetadataRef createOrLookup(TarnClientConnection& connection,
     // Look again under the write lock: another request may have created it
     // since the read lock was let go.
     if (useLocking) globalLock.writeLock();
-    TarnErrorRef lookupError;
-    TarnMetadataRef cached = cache.containerForContainerIdentity(identity, transient, true,
-                                                                 allowKernelLookup, &lookupError);
-    if (cached && !transient) return foundContainer(cached);
-    if (cached) {
+    const TarnResult<TarnMetadataRef> cached = cache.containerForContainerIdentity(
+        identity, transient, /*updateSandbox=*/true, allowKernelLookup);
+    if (cached.ok() && !transient) return foundContainer(*cached);
+    if (cached.ok()) {
         // A transient container is made anew on every request.
+        const FileURL& cachedURL = (*cached)->url();
         TarnErrorRef moveError;
-        if (!connection._moveItemAtURLToDeathRow(cached->url(), true, true, &moveError)) {
+        if (!connection._moveItemAtURLToDeathRow(cachedURL, /*isDir=*/true,
+                                                 /*startDeletionThread=*/true, &moveError)) {
             *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorRemoveTransientFailed, moveError,
-                                "Failed to remove transient container at %@", cached->url());
+                                   "Failed to remove transient container at %@", cachedURL);
             return nullptr;
         }
-    } else if (!isNotFound(lookupError)) {
-        *error = lookupError;
+    } else if (!isNotFound(cached.error())) {
+        *error = cached.error();
         return nullptr;
     }
     return createContainer(connection, identity, transient, error);
@@ -632,12 +641,14 @@ std::optional<std::vector<TarnMetadataRef>> TarnClientConnection::containersWith
             clientIdentity_ ? clientIdentity_->userIdentity() : nullptr;
         if (!userIdentity) userIdentity = TarnUserIdentityCache::defaultUserIdentity();
         globalLock.readLock();
-        TarnErrorRef cacheError;
         auto containers = TarnContainerCache::sharedInstance().allContainersForUserIdentity(
-            userIdentity, containerClass, transient, &cacheError);
+            userIdentity, containerClass, transient);
         globalLock.release();
-        if (!containers) TarnSetError(error, TarnErrorCodeOf(cacheError, TarnErrorInvalidArgument));
-        return containers;
+        if (!containers.ok()) {
+            TarnSetError(error, containers.code(TarnErrorInvalidArgument));
+            return std::nullopt;
+        }
+        return std::move(containers).value();
     } catch (const std::exception& e) {
         globalLock.release();
         TarnSetError(error, TarnHandleCaughtException(__func__, &e));

@@ -191,17 +191,16 @@ void TarnClientConnection::setInfoValue(const std::optional<PlistValue>& value,
 
         TarnMutableMetadataRef changed = metadata->copy();
         changed->setInfo(std::move(info));
-        TarnErrorRef writeError;
-        if (!changed->writeMetadataToDiskWithError(&writeError)) {
-            setErrorFrom(error, writeError, TarnErrorWriteFailed);
+        if (const TarnStatus written = changed->writeMetadataToDiskWithError(); !written.ok()) {
+            setErrorFrom(error, written.error(), TarnErrorWriteFailed);
             return;
         }
-        TarnErrorRef cacheError;
-        if (!TarnContainerCache::sharedInstance().addContainerMetadata(
-                changed, changed->url(), changed->transient(), false, &cacheError)) {
-            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorCacheAddFailed, cacheError,
-                                           "Failed to add to cache: %@, url: %@, transient: %d",
-                                           changed, changed->url(), changed->transient()));
+        if (const TarnStatus added = TarnContainerCache::sharedInstance().addContainerMetadata(
+                changed, changed->url(), changed->transient(), /*updateSandbox=*/false);
+            !added.ok()) {
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorCacheAddFailed, added.error(),
+                                              "Failed to add to cache: %@, url: %@, transient: %d",
+                                              changed, changed->url(), changed->transient()));
         }
     });
 }
@@ -285,10 +284,12 @@ void TarnClientConnection::recreateDefaultStructureWithContainerIdentity(
         }
         // New subdirectories of a system container need the system-users ACL
         // that the rest of the tree carries.
-        if (TarnContainerClassIsSystem(metadata->containerClass()) &&
-            !TarnFileManager::defaultManager().standardizeACLsForSystemContainerAtURL(
-                metadata->url(), &failure)) {
-            setErrorFrom(error, failure, TarnErrorACLFailed);
+        if (TarnContainerClassIsSystem(metadata->containerClass())) {
+            if (const TarnStatus standardized =
+                    TarnFileManager::defaultManager().standardizeACLsForSystemContainerAtURL(
+                        metadata->url());
+                !standardized.ok())
+                setErrorFrom(error, standardized.error(), TarnErrorACLFailed);
         }
     });
 }
@@ -322,19 +323,20 @@ void TarnClientConnection::regenerateDirectoryUUIDWithContainerIdentity(
             return;
         }
         const FileURL newURL = PathJoin(PathParent(oldURL), Uuid::generate().string());
-        TarnErrorRef moveError;
-        if (!TarnFileManager::defaultManager().moveItemAtURL(oldURL, newURL, &moveError)) {
-            setErrorFrom(error,
-                         TARN_ERROR_IN(operation, TarnErrorUUIDMoveFailed, moveError,
-                                    "Failed to move dir: %@ to new UUID dir: %@", oldURL, newURL));
+        if (const TarnStatus moved =
+                TarnFileManager::defaultManager().moveItemAtURL(oldURL, newURL);
+            !moved.ok()) {
+            setErrorFrom(
+                error, TARN_ERROR_IN(operation, TarnErrorUUIDMoveFailed, moved.error(),
+                                     "Failed to move dir: %@ to new UUID dir: %@", oldURL, newURL));
             return;
         }
-        TarnErrorRef cacheError;
-        if (!TarnContainerCache::sharedInstance().addContainerMetadata(
-                metadata, newURL, metadata->transient(), true, &cacheError)) {
-            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorCacheAddFailed, cacheError,
-                                           "Failed to add to cache: %@, url: %@, transient: %d",
-                                           metadata, newURL, metadata->transient()));
+        if (const TarnStatus added = TarnContainerCache::sharedInstance().addContainerMetadata(
+                metadata, newURL, metadata->transient(), /*updateSandbox=*/true);
+            !added.ok()) {
+            setErrorFrom(error, TARN_ERROR_IN(operation, TarnErrorCacheAddFailed, added.error(),
+                                              "Failed to add to cache: %@, url: %@, transient: %d",
+                                              metadata, newURL, metadata->transient()));
         }
     });
 }

@@ -21,8 +21,10 @@ TarnMetadataRef cachedContainerForIdentity(TarnContainerCache& cache,
                                            const TarnContainerIdentityRef& identity) {
     if (auto concrete = std::dynamic_pointer_cast<const TarnConcreteContainerIdentity>(identity))
         return cache.containerForContainerIdentity(concrete);
-    TarnErrorRef lookupError;  // not found: nothing to stage
-    return cache.containerForContainerIdentity(identity, false, true, &lookupError);
+    // Not found: nothing to stage.
+    auto found =
+        cache.containerForContainerIdentity(identity, /*transient=*/false, /*updateSandbox=*/true);
+    return found.valueOr(nullptr);
 }
 
 // A transient bundle shares its identifier's code-signing records with the
@@ -39,12 +41,13 @@ bool keepsCodeSigningRecords(TarnContainerCache& cache, const TarnMetadata& cont
         return false;
     }
     TarnContainerIdentityRef permanent = std::move(*made);
-    TarnErrorRef lookupError;
-    if (!cache.containerForContainerIdentity(permanent, false, false, &lookupError)) return false;
+    const TarnResult<TarnMetadataRef> found = cache.containerForContainerIdentity(
+        permanent, /*transient=*/false, /*updateSandbox=*/false);
+    if (!found.ok()) return false;
     PlatformLog("unspecified", PlatformLogType::Default,
                 "Skipping removal of code sign mapping since container to be deleted [%@] is "
                 "transient and there's a permanent one; error = %@",
-                container.description(), lookupError);
+                container.description(), found.error());
     return true;
 }
 
@@ -109,25 +112,23 @@ bool TarnCommandStageForDelete::stageAll(TarnCommandQueue* queue, uint64_t* erro
                     container->identifier(), queue);
         }
 
-        TarnErrorRef moveError;
-        if (!fm.moveItemAtURL(url, deathRowURL, &moveError)) {
+        if (const TarnStatus moved = fm.moveItemAtURL(url, deathRowURL); !moved.ok()) {
             TarnLog(kLogDebug, "fromQueue", "Couldn't stage for deletion from %@ to %@: %@", url,
-                    deathRowURL, moveError);
-            TarnErrorRef removeError;
-            if (!fm.removeItemAtURL(url, &removeError)) {
+                    deathRowURL, moved.error());
+            if (const TarnStatus removed = fm.removeItemAtURL(url); !removed.ok()) {
                 // Logged only: the container stays live and cached, the others go on.
-                (void)TARN_ERROR_IN("fromQueue", TarnErrorDeleteFailed, removeError,
-                                    "Failed to delete container at %@: %@", url, removeError);
+                (void)TARN_ERROR_IN("fromQueue", TarnErrorDeleteFailed, removed.error(),
+                                    "Failed to delete container at %@: %@", url, removed.error());
                 continue;
             }
         }
 
-        TarnErrorRef cacheError;
-        if (!cache.removeContainerForUserIdentity(
+        if (const TarnStatus removed = cache.removeContainerForUserIdentity(
                 container->userIdentity(), container->containerClass(), container->identifier(),
-                container->transient(), &cacheError)) {
+                container->transient());
+            !removed.ok()) {
             TarnErrorRef e = TARN_ERROR_IN(
-                "fromQueue", TarnErrorCacheRemoveFailed, cacheError,
+                "fromQueue", TarnErrorCacheRemoveFailed, removed.error(),
                 "Failed to remove from cache id: %@, class: %ld, transient: %d",
                 container->identifier(), static_cast<int64_t>(container->containerClass()),
                 container->transient());

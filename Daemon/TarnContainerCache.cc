@@ -2,15 +2,14 @@
 
 #include <cstdlib>
 #include <cstring>
-#include <exception>
 #include <mutex>
 #include <unordered_set>
 
 #include "Daemon/TarnCodeSigningMapping.h"
+#include "Daemon/TarnExceptionFence.h"
 #include "Daemon/TarnFileManager.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnLog.h"
-#include "Daemon/TarnRequestProcessor.h"
 #include "Daemon/TarnTestLocks.h"
 #include "Daemon/TarnWhitelist.h"
 #include "Platform/ContainerLibrary.h"
@@ -184,20 +183,20 @@ bool TarnContainerCache::containerName(std::string_view name,
 
 // ---- Building ----
 
-TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
-    const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
-    TarnErrorRef* error) {
-    return _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, true, true, error);
+TarnResult<TarnContainerClassCacheRef> TarnContainerCache::_lock_getCacheForUserIdentity(
+    const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient) {
+    return _lock_getCacheForUserIdentity(userIdentity, contentClass, transient,
+                                         /*populateSandboxCache=*/true, /*buildCache=*/true);
 }
 
-TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
+TarnResult<TarnContainerClassCacheRef> TarnContainerCache::_lock_getCacheForUserIdentity(
     const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
-    bool populateSandboxCache, bool buildCache, TarnErrorRef* error) {
+    bool populateSandboxCache, bool buildCache) {
     auto& dictionaries = transient ? transientContainerCache_ : liveContainerCache_;
     if (auto it = dictionaries.find(_cacheKeyPartsForUserIdentity(userIdentity, contentClass));
         it != dictionaries.end())
         return it->second;
-    if (!buildCache) return nullptr;
+    if (!buildCache) return TarnContainerClassCacheRef();
     const std::string key = _cacheKeyForUserIdentity(userIdentity, contentClass);
 
     TarnLog(kLogNotice, __func__, "Rebuilding container class cache: %@%@", key,
@@ -210,10 +209,8 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
     auto directory = TarnGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
         userIdentity, contentClass, transient);
     if (!directory) {
-        if (error)
-            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
-                                static_cast<int64_t>(contentClass));
-        return nullptr;
+        return TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
+                          static_cast<int64_t>(contentClass));
     }
     auto dictionary = std::make_shared<TarnContainerClassCache>();
     // One durable write of the sandbox state for the whole scan, not one per container.
@@ -223,12 +220,15 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
     auto take = [&](FileURL entry) {
         cacheLock_.assertHeld();  // called only from this function, lock held
         // Not a container of ours when unreadable: the error is of no use here.
-        TarnMetadataRef metadata =
-            classDirectory
-                ? TarnMetadata::readAndValidateMetadataInClassDirectory(
-                      classDirectory, std::move(entry), userIdentity, true, nullptr)
-                : TarnMetadata::readAndValidateMetadataAtUrl(entry, userIdentity, true, nullptr);
-        if (!metadata) return;
+        TarnResult<TarnMutableMetadataRef> read =
+            classDirectory ? TarnMetadata::readAndValidateMetadataInClassDirectory(
+                                 classDirectory, std::move(entry), userIdentity,
+                                 /*checkClassPath=*/true, TarnMetadataUnreadable::kQuiet)
+                           : TarnMetadata::readAndValidateMetadataAtUrl(
+                                 entry, userIdentity,
+                                 /*checkClassPath=*/true, TarnMetadataUnreadable::kQuiet);
+        if (!read.ok()) return;
+        TarnMetadataRef metadata = std::move(read).value();
         const std::string& identifier = metadata->identifier();
         if (populateSandboxCache && !transient &&
             _lock_shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier,
@@ -263,13 +263,9 @@ TarnContainerClassCacheRef TarnContainerCache::_lock_getCacheForUserIdentity(
         }
     }
     if (!classDirectory) {
-        TarnErrorRef listError;
-        auto listed = fileManager.urlsForItemsInDirectoryAtURL(*directory, &listError);
-        if (!listed) {
-            if (error) *error = listError;
-            return nullptr;
-        }
-        for (FileURL& entry : *listed)
+        std::vector<FileURL> listed =
+            TARN_TRY(fileManager.urlsForItemsInDirectoryAtURL(*directory));
+        for (FileURL& entry : listed)
             if (containerURL(entry, contentClass)) take(std::move(entry));
     }
     dictionaries[key] = dictionary;
@@ -475,14 +471,14 @@ TarnMetadataRef TarnContainerCache::_lock_metadataFromSandboxForContainerIdentit
         endInterval();
         return nullptr;
     }
-    TarnErrorRef readError;
-    TarnMetadataRef metadata =
-        TarnMetadata::readAndValidateMetadataAtUrl(*foundPath, userIdentity, true, &readError);
+    TarnResult<TarnMutableMetadataRef> read = TarnMetadata::readAndValidateMetadataAtUrl(
+        *foundPath, userIdentity, /*checkClassPath=*/true);
+    TarnMetadataRef metadata = read.ok() ? std::move(read).value() : TarnMetadataRef();
     TarnMetadataRef answer;
     if (!metadata) {
         TarnLog(kLogError, __func__,
                 "Could not validate container from Sandbox-provided path [%@]; error = %@",
-                *foundPath, readError);
+                *foundPath, read.error());
     } else if (metadata->containerClass() != containerClass || metadata->identifier() != wanted) {
         TarnLog(
             kLogError, __func__,
@@ -501,34 +497,29 @@ TarnMetadataRef TarnContainerCache::_lock_metadataFromSandboxForContainerIdentit
 
 // ---- Lookups ----
 
-TarnMetadataRef TarnContainerCache::containerForContainerIdentity(
-    const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox,
-    TarnErrorRef* error) {
-    return containerForContainerIdentity(identity, transient, updateSandbox, true, error);
+TarnResult<TarnMetadataRef> TarnContainerCache::containerForContainerIdentity(
+    const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox) {
+    return containerForContainerIdentity(identity, transient, updateSandbox,
+                                         /*allowKernelLookup=*/true);
 }
 
-TarnMetadataRef TarnContainerCache::containerForContainerIdentity(
+TarnResult<TarnMetadataRef> TarnContainerCache::containerForContainerIdentity(
     const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox,
-    bool allowKernelLookup, TarnErrorRef* error) {
+    bool allowKernelLookup) {
     assertNotOnMappingQueue();
-    try {
-        return _containerForContainerIdentity(identity, transient, updateSandbox, allowKernelLookup,
-                                              error);
-    } catch (const std::exception& e) {
-        if (error) *error = TarnCaughtExceptionError(__func__, &e);
-    } catch (...) {
-        if (error) *error = TarnCaughtExceptionError(__func__, nullptr);
-    }
-    return nullptr;
+    // A boundary: its callers read an exception as error 40 of the look-up.
+    return TarnFenceExceptions(kLookupOperation, [&] {
+        return _containerForContainerIdentity(identity, transient, updateSandbox,
+                                              allowKernelLookup);
+    });
 }
 
-TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
+TarnResult<TarnMetadataRef> TarnContainerCache::_containerForContainerIdentity(
     const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox,
-    bool allowKernelLookup, TarnErrorRef* error) {
-    if (!identity) {
-        if (error) *error = TARN_ERROR_IN(kLookupOperation, TarnErrorCacheInvalidInput, nullptr, "Cache: nil identity");
-        return nullptr;
-    }
+    bool allowKernelLookup) {
+    if (!identity)
+        return TARN_ERROR_IN(kLookupOperation, TarnErrorCacheInvalidInput, nullptr,
+                             "Cache: nil identity");
     const TarnUserIdentityRef& userIdentity = identity->userIdentity();
     const TarnContainerClass containerClass = identity->containerClass();
     const std::string& identifier = identity->identifier();
@@ -542,8 +533,10 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
         TarnContainerClassCacheRef dictionary;
         bool fromKernel = false;
         if (allowKernelLookup) {
-            dictionary = _lock_getCacheForUserIdentity(userIdentity, containerClass, transient,
-                                                       updateSandbox, false, nullptr);
+            // Without building, a look-up of the dictionary cannot fail.
+            TarnResult<TarnContainerClassCacheRef> built = _lock_getCacheForUserIdentity(
+                userIdentity, containerClass, transient, updateSandbox, /*buildCache=*/false);
+            if (built.ok()) dictionary = std::move(built).value();
             if (!dictionary && !transient) {
                 metadata = _lock_metadataFromSandboxForContainerIdentity(identity);
                 fromKernel = metadata != nullptr;
@@ -551,53 +544,46 @@ TarnMetadataRef TarnContainerCache::_containerForContainerIdentity(
         }
         if (!fromKernel) {
             if (!dictionary) {
-                TarnErrorRef buildError;
-                dictionary = _lock_getCacheForUserIdentity(userIdentity, containerClass, transient,
-                                                           updateSandbox, true, &buildError);
-                if (!dictionary) {
+                TarnResult<TarnContainerClassCacheRef> built = _lock_getCacheForUserIdentity(
+                    userIdentity, containerClass, transient, updateSandbox, /*buildCache=*/true);
+                if (!built.ok()) {
                     const char* relative = TarnContainerClassRelativeDirectory(containerClass);
-                    if (error)
-                        *error = TARN_ERROR_IN(kLookupOperation, TarnErrorCacheRebuildFailed, buildError,
-                                            "Cache: [%@]-%@%@: Failed to rebuild",
-                                            userIdentity ? userIdentity->identifier() : "(null)",
-                                            relative ? relative : "(null)", marker);
-                    return nullptr;
+                    return TARN_ERROR_IN(kLookupOperation, TarnErrorCacheRebuildFailed,
+                                         built.error(), "Cache: [%@]-%@%@: Failed to rebuild",
+                                         userIdentity ? userIdentity->identifier() : "(null)",
+                                         relative ? relative : "(null)", marker);
                 }
+                dictionary = std::move(built).value();
             }
             auto it = dictionary->find(identifier);
             if (it == dictionary->end()) {
-                if (error)
-                    *error = TARN_ERROR_IN(kLookupOperation, TarnErrorNotFound, nullptr,
-                                        "Cache: %@%@: Container Not Found with ID: %@", key(), marker,
-                                        identifier);
-                return nullptr;
+                return TARN_ERROR_IN(kLookupOperation, TarnErrorNotFound, nullptr,
+                                     "Cache: %@%@: Container Not Found with ID: %@", key(), marker,
+                                     identifier);
             }
             metadata = it->second;
         }
     }
 
     if (metadata->url().empty() || metadata->url()[0] != '/') {
-        if (error)
-            *error = TARN_ERROR_IN(kLookupOperation, TarnErrorCacheInvalidInput, nullptr,
-                                "Cache: %@%@: Invalid URL path string: %@", key(), marker,
-                                metadata->url());
-        return nullptr;
+        return TARN_ERROR_IN(kLookupOperation, TarnErrorCacheInvalidInput, nullptr,
+                             "Cache: %@%@: Invalid URL path string: %@", key(), marker,
+                             metadata->url());
     }
     if (metadataFileIsGone(metadataFileURL(metadata->url()))) {
         const FileURL metadataFile = PathJoin(metadata->url(), kTarnMetadataFileName);
-        if (error)
-            *error =
-                TARN_ERROR_IN(kLookupOperation, TarnErrorCacheInconsistent, nullptr,
-                           "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu",
-                           key(), marker, metadataFile, identifier, containerClass);
-        TarnErrorRef removeError;
-        if (!removeContainerForUserIdentity(userIdentity, containerClass, identifier, transient,
-                                            &removeError)) {
+        TarnErrorRef inconsistent =
+            TARN_ERROR_IN(kLookupOperation, TarnErrorCacheInconsistent, nullptr,
+                          "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu",
+                          key(), marker, metadataFile, identifier, containerClass);
+        if (TarnStatus removed =
+                removeContainerForUserIdentity(userIdentity, containerClass, identifier, transient);
+            !removed.ok()) {
             TarnLog(kLogError, kLookupOperation,
                     "Failed to remove from cache user: %@, id: %@, class: %llu, transient: %d : %@",
-                    userIdentity, identifier, containerClass, transient, removeError);
+                    userIdentity, identifier, containerClass, transient, removed.error());
         }
-        return nullptr;
+        return inconsistent;
     }
     if (TarnLogShouldWrite(kLogDebug))
         TarnLog(kLogDebug, kLookupOperation, "Cache: %@%@: Found Identifier: %@", key(), marker,
@@ -610,11 +596,12 @@ TarnMetadataRef TarnContainerCache::containerForContainerIdentity(
     if (!identity) return nullptr;
     TarnContainerIdentityRef base = identity->baseIdentity();
     for (bool transient : {false, true}) {
-        TarnErrorRef ignored;  // a miss in one dictionary is not the caller's concern
-        TarnMetadataRef found = containerForContainerIdentity(base, transient, true, &ignored);
-        if (found && found->uuid() == identity->uuid()) {
-            if (found->transient() == transient) return found;
-            TarnMutableMetadataRef marked = found->copy();
+        // A miss in one dictionary is not the caller's concern.
+        TarnResult<TarnMetadataRef> found =
+            containerForContainerIdentity(base, transient, /*updateSandbox=*/true);
+        if (found.ok() && (*found)->uuid() == identity->uuid()) {
+            if ((*found)->transient() == transient) return std::move(found).value();
+            TarnMutableMetadataRef marked = (*found)->copy();
             marked->setTransient(transient);
             return marked;
         }
@@ -622,63 +609,58 @@ TarnMetadataRef TarnContainerCache::containerForContainerIdentity(
     return nullptr;
 }
 
-std::optional<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersForUserIdentity(
-    const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
-    TarnErrorRef* error) {
-    return allContainersForUserIdentity(userIdentity, contentClass, transient, true, error);
+TarnResult<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersForUserIdentity(
+    const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient) {
+    return allContainersForUserIdentity(userIdentity, contentClass, transient,
+                                        /*populateSandboxCache=*/true);
 }
 
-std::optional<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersForUserIdentity(
+TarnResult<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersForUserIdentity(
     const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
-    bool populateSandboxCache, TarnErrorRef* error) {
+    bool populateSandboxCache) {
     assertNotOnMappingQueue();
     if (!TarnContainerClassIsValid(contentClass)) {
-        if (error)
-            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
-                                static_cast<int64_t>(contentClass));
-        return std::nullopt;
+        return TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
+                          static_cast<int64_t>(contentClass));
     }
     const char* marker = transientMarker(transient);
-    std::vector<TarnMetadataRef> all;
-    try {
-        MutexLock lock(cacheLock_);
-        std::vector<TarnUserIdentityRef> identities;
-        if (userIdentity && userIdentity->isNoSpecificPersona()) {
-            userIdentityCache_.forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
-                [&](const TarnUserIdentityRef& u) { identities.push_back(u); });
-        } else {
-            identities.push_back(userIdentity);
-        }
-        std::unordered_set<const TarnContainerClassCache*> seen;
-        for (const auto& identity : identities) {
-            TarnErrorRef buildError;
-            auto dictionary = _lock_getCacheForUserIdentity(
-                identity, contentClass, transient, populateSandboxCache, true, &buildError);
-            if (!dictionary) {
-                const char* relative = TarnContainerClassRelativeDirectory(contentClass);
-                if (error)
-                    *error =
-                        TARN_ERROR(TarnErrorCacheRebuildFailed, buildError,
-                                   "Cache: [%@]-%@%@: Failed to rebuild",
-                                   identity ? identity->identifier() : "(null)", relative, marker);
-                return std::nullopt;
+    const char* const operation = __func__;  // inside the fenced body __func__ is the lambda's
+    // A boundary, as the look-up is: an exception while the dictionaries are
+    // read or built is error 40 of this operation.
+    TarnResult<std::vector<TarnMetadataRef>> gathered =
+        TarnFenceExceptions(operation, [&]() -> TarnResult<std::vector<TarnMetadataRef>> {
+            std::vector<TarnMetadataRef> all;
+            MutexLock lock(cacheLock_);
+            std::vector<TarnUserIdentityRef> identities;
+            if (userIdentity && userIdentity->isNoSpecificPersona()) {
+                userIdentityCache_.forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+                    [&](const TarnUserIdentityRef& u) { identities.push_back(u); });
+            } else {
+                identities.push_back(userIdentity);
             }
-            // Global classes answer one dictionary for every identity.
-            if (!seen.insert(dictionary.get()).second) continue;
-            _lock_forEachContainerInContainerCache(
-                *dictionary, [&](const TarnMetadataRef& m) { all.push_back(m); });
-        }
-    } catch (const std::exception& e) {
-        if (error) *error = TarnCaughtExceptionError(__func__, &e);
-        return std::nullopt;
-    } catch (...) {
-        if (error) *error = TarnCaughtExceptionError(__func__, nullptr);
-        return std::nullopt;
-    }
+            std::unordered_set<const TarnContainerClassCache*> seen;
+            for (const auto& identity : identities) {
+                TarnResult<TarnContainerClassCacheRef> dictionary = _lock_getCacheForUserIdentity(
+                    identity, contentClass, transient, populateSandboxCache, /*buildCache=*/true);
+                if (!dictionary.ok()) {
+                    const char* relative = TarnContainerClassRelativeDirectory(contentClass);
+                    return TARN_ERROR_IN(operation, TarnErrorCacheRebuildFailed, dictionary.error(),
+                                         "Cache: [%@]-%@%@: Failed to rebuild",
+                                         identity ? identity->identifier() : "(null)", relative,
+                                         marker);
+                }
+                // Global classes answer one dictionary for every identity.
+                if (!seen.insert(dictionary->get()).second) continue;
+                _lock_forEachContainerInContainerCache(
+                    **dictionary, [&](const TarnMetadataRef& m) { all.push_back(m); });
+            }
+            return all;
+        });
+    if (!gathered.ok()) return gathered;
 
     std::vector<TarnMetadataRef> answer;
-    answer.reserve(all.size());
-    for (const auto& metadata : all) {
+    answer.reserve(gathered->size());
+    for (const auto& metadata : *gathered) {
         const std::string key = _cacheKeyForUserIdentity(metadata->userIdentity(), contentClass);
         if (metadata->url().empty()) {
             TarnLog(kLogError, __func__, "Cache: %@%@: nil URL from %@", key, marker, metadata);
@@ -689,14 +671,14 @@ std::optional<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersFor
             TarnLog(kLogError, __func__,
                     "Cache: %@%@: INCONSISTENT-No Metadata at: %@ for id: %@, class: %llu", key,
                     marker, metadataFile, metadata->identifier(), contentClass);
-            TarnErrorRef removeError;
-            if (!removeContainerForUserIdentity(metadata->userIdentity(), contentClass,
-                                                metadata->identifier(), transient, &removeError)) {
+            if (TarnStatus removed = removeContainerForUserIdentity(
+                    metadata->userIdentity(), contentClass, metadata->identifier(), transient);
+                !removed.ok()) {
                 TarnLog(
                     kLogError, __func__,
                     "Failed to remove from cache user: %@, id: %@, class: %llu, transient: %d : %@",
                     metadata->userIdentity(), metadata->identifier(), contentClass, transient,
-                    removeError);
+                    removed.error());
             }
             continue;
         }
@@ -709,46 +691,38 @@ std::optional<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersFor
 
 // ---- Changes ----
 
-bool TarnContainerCache::addContainerMetadata(const TarnMetadataRef& metadata, const FileURL& url,
-                                              bool transient, bool updateSandbox,
-                                              TarnErrorRef* error) {
+TarnStatus TarnContainerCache::addContainerMetadata(const TarnMetadataRef& metadata,
+                                                    const FileURL& url, bool transient,
+                                                    bool updateSandbox) {
     assertNotOnMappingQueue();
     if (!metadata || !TarnContainerClassIsValid(metadata->containerClass())) {
-        if (error)
-            *error = TARN_ERROR(
-                TarnErrorCacheInvalidInput, nullptr, "Invalid Metadata Content Class: %lld",
-                metadata ? static_cast<int64_t>(metadata->containerClass()) : int64_t{0});
-        return false;
+        return TARN_ERROR(TarnErrorCacheInvalidInput, nullptr,
+                          "Invalid Metadata Content Class: %lld",
+                          metadata ? static_cast<int64_t>(metadata->containerClass()) : int64_t{0});
     }
     // The identifier is always a string here, and an empty one is valid.
-    if (url.empty() || url[0] != '/') {
-        if (error)
-            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid input: URL: %@", url);
-        return false;
-    }
+    if (url.empty() || url[0] != '/')
+        return TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid input: URL: %@", url);
     const TarnUserIdentityRef& userIdentity = metadata->userIdentity();
     const TarnContainerClass containerClass = metadata->containerClass();
     const std::string& identifier = metadata->identifier();
     bool shouldRegister = false;
     {
         MutexLock lock(cacheLock_);
-        TarnErrorRef buildError;
-        auto dictionary = _lock_getCacheForUserIdentity(userIdentity, containerClass, transient,
-                                                        updateSandbox, updateSandbox, &buildError);
-        if (!dictionary) {
+        TarnResult<TarnContainerClassCacheRef> dictionary = _lock_getCacheForUserIdentity(
+            userIdentity, containerClass, transient, updateSandbox, /*buildCache=*/updateSandbox);
+        if (!dictionary.ok() || !*dictionary) {
             // Without a dictionary the container is on disk and the next build reads it.
-            if (!updateSandbox) return true;
-            if (error)
-                *error = TARN_ERROR(TarnErrorCacheRebuildFailed, buildError,
-                                    "Cache: [%@]-%@%@: Failed to rebuild",
-                                    userIdentity ? userIdentity->identifier() : "(null)",
-                                    TarnContainerClassRelativeDirectory(containerClass),
-                                    transientMarker(transient));
-            return false;
+            if (!updateSandbox) return {};
+            return TARN_ERROR(TarnErrorCacheRebuildFailed, dictionary.error(),
+                              "Cache: [%@]-%@%@: Failed to rebuild",
+                              userIdentity ? userIdentity->identifier() : "(null)",
+                              TarnContainerClassRelativeDirectory(containerClass),
+                              transientMarker(transient));
         }
         TarnMutableMetadataRef stored = metadata->copy();
         stored->setUrl(url);
-        (*dictionary)[identifier] = stored;
+        (**dictionary)[identifier] = stored;
         if (updateSandbox)
             shouldRegister = _lock_shouldRegisterSandboxMappingWithUserIdentity(
                 userIdentity, identifier, containerClass);
@@ -761,36 +735,31 @@ bool TarnContainerCache::addContainerMetadata(const TarnMetadataRef& metadata, c
     TarnLog(kLogDebug, __func__, "Cache: %@%@: Added Identifier: %@",
             _cacheKeyForUserIdentity(userIdentity, containerClass), transientMarker(transient),
             identifier);
-    return true;
+    return {};
 }
 
-bool TarnContainerCache::removeContainerForUserIdentity(const TarnUserIdentityRef& userIdentity,
-                                                        TarnContainerClass contentClass,
-                                                        const std::string& identifier,
-                                                        bool transient, TarnErrorRef* error) {
+TarnStatus TarnContainerCache::removeContainerForUserIdentity(
+    const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass,
+    const std::string& identifier, bool transient) {
     assertNotOnMappingQueue();
     if (!TarnContainerClassIsValid(contentClass)) {
-        if (error)
-            *error = TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
-                                static_cast<int64_t>(contentClass));
-        return false;
+        return TARN_ERROR(TarnErrorCacheInvalidInput, nullptr, "Invalid Content Class: %ld",
+                          static_cast<int64_t>(contentClass));
     }
     // The identifier is always a string here, and an empty one is valid.
     bool shouldRegister = false;
     {
         MutexLock lock(cacheLock_);
-        TarnErrorRef buildError;
-        auto dictionary =
-            _lock_getCacheForUserIdentity(userIdentity, contentClass, transient, &buildError);
-        if (!dictionary) {
-            if (error)
-                *error = TARN_ERROR(
-                    TarnErrorCacheRebuildFailed, buildError, "Cache: [%@]-%@%@: Failed to rebuild",
-                    userIdentity ? userIdentity->identifier() : "(null)",
-                    TarnContainerClassRelativeDirectory(contentClass), transientMarker(transient));
-            return false;
+        TarnResult<TarnContainerClassCacheRef> dictionary =
+            _lock_getCacheForUserIdentity(userIdentity, contentClass, transient);
+        if (!dictionary.ok()) {
+            return TARN_ERROR(TarnErrorCacheRebuildFailed, dictionary.error(),
+                              "Cache: [%@]-%@%@: Failed to rebuild",
+                              userIdentity ? userIdentity->identifier() : "(null)",
+                              TarnContainerClassRelativeDirectory(contentClass),
+                              transientMarker(transient));
         }
-        dictionary->erase(identifier);
+        (*dictionary)->erase(identifier);
         shouldRegister = _lock_shouldRegisterSandboxMappingWithUserIdentity(
             userIdentity, identifier, contentClass);
     }
@@ -803,7 +772,7 @@ bool TarnContainerCache::removeContainerForUserIdentity(const TarnUserIdentityRe
     TarnLog(kLogDebug, __func__, "Cache: %@%@: Removed Identifier: %@",
             _cacheKeyForUserIdentity(userIdentity, contentClass), transientMarker(transient),
             identifier);
-    return true;
+    return {};
 }
 
 // ---- Invalidation ----

@@ -46,6 +46,7 @@
 #include "Daemon/TarnContainerIdentity.h"
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnMetadata.h"
+#include "Daemon/TarnResult.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/Dispatch.h"
 #include "Platform/Path.h"
@@ -91,41 +92,40 @@ class TarnContainerCache : public TarnUserIdentityCacheObserver,
 
     // ---- Lookups ----
 
-    // The container's metadata, or nullptr with the error: 21 not found, 43
+    // The container's metadata (never null), or the error: 21 not found, 43
     // rebuild failed, 44 found but its metadata file is gone (the entry is
     // dropped; the next lookup answers 21), 47 bad URL, 40 exception.
     // `updateSandbox`: a rebuild may push mappings; `allowKernelLookup`: an
     // unscanned class may be answered from the sandbox state (non-transient only).
-    TarnMetadataRef containerForContainerIdentity(const TarnContainerIdentityRef& identity,
-                                                  bool transient, bool updateSandbox,
-                                                  bool allowKernelLookup, TarnErrorRef* error);
-    TarnMetadataRef containerForContainerIdentity(const TarnContainerIdentityRef& identity,
-                                                  bool transient, bool updateSandbox,
-                                                  TarnErrorRef* error);
+    TarnResult<TarnMetadataRef> containerForContainerIdentity(
+        const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox,
+        bool allowKernelLookup);
+    TarnResult<TarnMetadataRef> containerForContainerIdentity(
+        const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox);
     // Live first, then transient; only a container with the identity's UUID
     // counts. The answer is marked transient or not accordingly. No errors.
     TarnMetadataRef containerForContainerIdentity(const TarnConcreteContainerIdentityRef& identity);
 
     // Every container of the class (of every accessible identity for the
     // unspecific one). Entries whose metadata file is gone are left out and
-    // dropped. Order unspecified.
-    std::optional<std::vector<TarnMetadataRef>> allContainersForUserIdentity(
+    // dropped. Order unspecified. Errors: 47 bad class, 43 rebuild failed,
+    // 40 exception.
+    TarnResult<std::vector<TarnMetadataRef>> allContainersForUserIdentity(
         const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
-        bool populateSandboxCache, TarnErrorRef* error);
-    std::optional<std::vector<TarnMetadataRef>> allContainersForUserIdentity(
-        const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
-        TarnErrorRef* error);
+        bool populateSandboxCache);
+    TarnResult<std::vector<TarnMetadataRef>> allContainersForUserIdentity(
+        const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient);
 
     // ---- Changes ----
 
     // Records `metadata` (with its url set to `url`). Before the class was
     // built and without `updateSandbox` it records nothing and succeeds.
-    bool addContainerMetadata(const TarnMetadataRef& metadata, const FileURL& url, bool transient,
-                              bool updateSandbox, TarnErrorRef* error);
-    bool removeContainerForUserIdentity(const TarnUserIdentityRef& userIdentity,
-                                        TarnContainerClass contentClass,
-                                        const std::string& identifier, bool transient,
-                                        TarnErrorRef* error);
+    // Errors: 47 bad input, 43 rebuild failed.
+    TarnStatus addContainerMetadata(const TarnMetadataRef& metadata, const FileURL& url,
+                                    bool transient, bool updateSandbox);
+    TarnStatus removeContainerForUserIdentity(const TarnUserIdentityRef& userIdentity,
+                                              TarnContainerClass contentClass,
+                                              const std::string& identifier, bool transient);
 
     // ---- Kernel sandbox mapping ----
 
@@ -189,12 +189,14 @@ class TarnContainerCache : public TarnUserIdentityCacheObserver,
     void TEST_drainInvalidations();
 
   private:
-    TarnContainerClassCacheRef _lock_getCacheForUserIdentity(
+    // The dictionary of the key, built when missing. Without `buildCache` a
+    // missing one is null (and no failure).
+    TarnResult<TarnContainerClassCacheRef> _lock_getCacheForUserIdentity(
         const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
-        bool populateSandboxCache, bool buildCache, TarnErrorRef* error) REQUIRES(cacheLock_);
-    TarnContainerClassCacheRef _lock_getCacheForUserIdentity(
-        const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
-        TarnErrorRef* error) REQUIRES(cacheLock_);
+        bool populateSandboxCache, bool buildCache) REQUIRES(cacheLock_);
+    TarnResult<TarnContainerClassCacheRef> _lock_getCacheForUserIdentity(
+        const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient)
+        REQUIRES(cacheLock_);
     TarnMetadataRef _lock_metadataFromSandboxForContainerIdentity(
         const TarnContainerIdentityRef& identity) REQUIRES(cacheLock_);
     void _lock_forEachContainerInContainerCache(
@@ -213,9 +215,10 @@ class TarnContainerCache : public TarnUserIdentityCacheObserver,
     bool _setSandboxContainerMapping(const TarnUserIdentityRef& userIdentity,
                                      const std::string& identifier,
                                      TarnContainerClass containerClass, const char* url);
-    TarnMetadataRef _containerForContainerIdentity(const TarnContainerIdentityRef& identity,
-                                                   bool transient, bool updateSandbox,
-                                                   bool allowKernelLookup, TarnErrorRef* error);
+    // containerForContainerIdentity without its exception fence.
+    TarnResult<TarnMetadataRef> _containerForContainerIdentity(
+        const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox,
+        bool allowKernelLookup);
     // Aborts when called on the code-signing mapping's queue.
     void assertNotOnMappingQueue() const;
 

@@ -25,10 +25,6 @@ constexpr int32_t kCompleteProtectionClass = 1;
 
 std::string errText(int err) { return FsErrorText(err); }
 
-void setError(TarnErrorRef* slot, TarnErrorRef e) {
-    if (slot) *slot = std::move(e);
-}
-
 // Components as the platform lists them: "/" first for an absolute path.
 std::vector<std::string> componentsWithRoot(const std::string& path) {
     std::vector<std::string> out;
@@ -315,30 +311,31 @@ FileURL TarnFileManager::homeDirectoryURLForPOSIXUID(uid_t uid) {
 
 // ---- Directories ----
 
-bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
-                                           TarnErrorRef* error) {
-    return createDirectoryAtURL(url, withIntermediateDirectories, mode, 0, kTarnDataProtectionClassUnchanged,
-                                error);
+TarnStatus TarnFileManager::createDirectoryAtURL(const FileURL& url,
+                                                 bool withIntermediateDirectories, mode_t mode) {
+    return createDirectoryAtURL(url, withIntermediateDirectories, mode, 0,
+                                kTarnDataProtectionClassUnchanged);
 }
 
-bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
-                                           TarnDataProtectionClass dataProtectionClass, TarnErrorRef* error) {
-    return createDirectoryAtURL(url, withIntermediateDirectories, mode, 0, dataProtectionClass, error);
+TarnStatus TarnFileManager::createDirectoryAtURL(const FileURL& url,
+                                                 bool withIntermediateDirectories, mode_t mode,
+                                                 TarnDataProtectionClass dataProtectionClass) {
+    return createDirectoryAtURL(url, withIntermediateDirectories, mode, 0, dataProtectionClass);
 }
 
-bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
-                                           uid_t owner, TarnErrorRef* error) {
-    return createDirectoryAtURL(url, withIntermediateDirectories, mode, owner, kTarnDataProtectionClassUnchanged,
-                                error);
+TarnStatus TarnFileManager::createDirectoryAtURL(const FileURL& url,
+                                                 bool withIntermediateDirectories, mode_t mode,
+                                                 uid_t owner) {
+    return createDirectoryAtURL(url, withIntermediateDirectories, mode, owner,
+                                kTarnDataProtectionClassUnchanged);
 }
 
-bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
-                                           uid_t owner, TarnDataProtectionClass dataProtectionClass,
-                                           TarnErrorRef* error) {
-    if (auto fp = TARN_FAILPOINT("fm.createDirectory")) {
-        setError(error, TARN_POSIX_ERROR(*fp, "mkdir of %s failed: %s", url, errText(*fp)));
-        return false;
-    }
+TarnStatus TarnFileManager::createDirectoryAtURL(const FileURL& url,
+                                                 bool withIntermediateDirectories, mode_t mode,
+                                                 uid_t owner,
+                                                 TarnDataProtectionClass dataProtectionClass) {
+    if (auto fp = TARN_FAILPOINT("fm.createDirectory"))
+        return TARN_POSIX_ERROR(*fp, "mkdir of %s failed: %s", url, errText(*fp));
     if (dataProtectionClass == kTarnDataProtectionClassUnchanged) {
         // The daemon's own directories are asked for on every creation and
         // nearly always exist as asked: one lstat instead of mkdir, stat, open
@@ -347,155 +344,124 @@ bool TarnFileManager::createDirectoryAtURL(const FileURL& url, bool withIntermed
         struct stat st;
         if (::lstat(url.c_str(), &st) == 0 && S_ISDIR(st.st_mode) &&
             (owner == 0 || (st.st_uid == owner && st.st_gid == owner)))
-            return true;
+            return {};
     }
     bool created = false;
     if (withIntermediateDirectories) {
         int err = FsMakePath(url, mode, &created);
-        if (err != 0 && err != EEXIST) {
-            setError(error, TARN_POSIX_ERROR(err, "mkpath of %s failed: %s", url, errText(err)));
-            return false;
-        }
+        if (err != 0 && err != EEXIST)
+            return TARN_POSIX_ERROR(err, "mkpath of %s failed: %s", url, errText(err));
     } else {
         int err = FsMkdir(url, mode);
-        if (err != 0 && err != EEXIST) {
-            setError(error, TARN_POSIX_ERROR(err, "mkdir of %s failed: %s", url, errText(err)));
-            return false;
-        }
+        if (err != 0 && err != EEXIST)
+            return TARN_POSIX_ERROR(err, "mkdir of %s failed: %s", url, errText(err));
         created = err == 0;
     }
-    if (dataProtectionClass == kTarnDataProtectionClassUnchanged && owner == 0) return true;
+    if (dataProtectionClass == kTarnDataProtectionClassUnchanged && owner == 0) return {};
 
     // Class and owner go through the directory's own descriptor, opened
     // without following: a link planted at the path is refused, not chowned.
     FsFd dir;
-    if (int err = FsOpenDirectory(url, &dir)) {
-        setError(error, TARN_POSIX_ERROR(err, "opendir of %s failed: %s", url, errText(err)));
-        return false;
-    }
+    if (int err = FsOpenDirectory(url, &dir))
+        return TARN_POSIX_ERROR(err, "opendir of %s failed: %s", url, errText(err));
     if (dataProtectionClass != kTarnDataProtectionClassUnchanged) {
         if (int err = setProtectionClassChecked(dir.get(), dataProtectionClass, created)) {
-            setError(error, TARN_POSIX_ERROR(err, "Failed to setclass(%d) on directory %s: %s",
-                                             static_cast<int32_t>(dataProtectionClass), url, errText(err)));
-            return false;
+            return TARN_POSIX_ERROR(err, "Failed to setclass(%d) on directory %s: %s",
+                                    static_cast<int32_t>(dataProtectionClass), url, errText(err));
         }
     }
     if (owner != 0) {
         if (!ProcessIsPrivileged()) {
             logSkippedOwner(__func__, url);
         } else if (int err = FsChownFd(dir.get(), owner, owner)) {
-            setError(error, TARN_POSIX_ERROR(err, "Failed to chown(%d,%d) %s: %s", owner, owner, url, errText(err)));
-            return false;
+            return TARN_POSIX_ERROR(err, "Failed to chown(%d,%d) %s: %s", owner, owner, url,
+                                    errText(err));
         }
     }
-    return true;
+    return {};
 }
 
-std::optional<FileURL> TarnFileManager::createTemporaryDirectoryInDirectoryURL(const FileURL& url,
-                                                                               TarnErrorRef* error) {
-    return createTemporaryDirectoryInDirectoryURL(url, "temp.", error);
+TarnResult<FileURL> TarnFileManager::createTemporaryDirectoryInDirectoryURL(const FileURL& url) {
+    return createTemporaryDirectoryInDirectoryURL(url, "temp.");
 }
 
-std::optional<FileURL> TarnFileManager::createTemporaryDirectoryInDirectoryURL(const FileURL& url,
-                                                                               const std::string& withNamePrefix,
-                                                                               TarnErrorRef* error) {
+TarnResult<FileURL> TarnFileManager::createTemporaryDirectoryInDirectoryURL(
+    const FileURL& url, const std::string& withNamePrefix) {
     std::string path = PathJoin(url, Format("%@XXXXXX", withNamePrefix));
-    if (auto fp = TARN_FAILPOINT("fm.createTemporaryDirectory")) {
-        setError(error, TARN_POSIX_ERROR(*fp, "Failed to create temp dir at path %s : %s", path, errText(*fp)));
-        return std::nullopt;
-    }
+    if (auto fp = TARN_FAILPOINT("fm.createTemporaryDirectory"))
+        return TARN_POSIX_ERROR(*fp, "Failed to create temp dir at path %s : %s", path,
+                                errText(*fp));
     std::string made = path;
-    if (int err = FsMkdtemp(&made)) {
-        setError(error, TARN_POSIX_ERROR(err, "Failed to create temp dir at path %s : %s", path, errText(err)));
-        return std::nullopt;
-    }
+    if (int err = FsMkdtemp(&made))
+        return TARN_POSIX_ERROR(err, "Failed to create temp dir at path %s : %s", path,
+                                errText(err));
     return made;
 }
 
 // ---- Move, copy, remove ----
 
-bool TarnFileManager::moveItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error) {
-    return _moveItemAtURL(url, toURL, true, error);
+TarnStatus TarnFileManager::moveItemAtURL(const FileURL& url, const FileURL& toURL) {
+    return _moveItemAtURL(url, toURL, /*failIfSrcMissing=*/true);
 }
 
-bool TarnFileManager::moveItemIfExistsAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error) {
-    return _moveItemAtURL(url, toURL, false, error);
+TarnStatus TarnFileManager::moveItemIfExistsAtURL(const FileURL& url, const FileURL& toURL) {
+    return _moveItemAtURL(url, toURL, /*failIfSrcMissing=*/false);
 }
 
-bool TarnFileManager::copyItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error) {
-    return _copyItemAtURL(url, toURL, true, error);
+TarnStatus TarnFileManager::copyItemAtURL(const FileURL& url, const FileURL& toURL) {
+    return _copyItemAtURL(url, toURL, /*failIfSrcMissing=*/true);
 }
 
-bool TarnFileManager::copyItemIfExistsAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error) {
-    return _copyItemAtURL(url, toURL, false, error);
+TarnStatus TarnFileManager::copyItemIfExistsAtURL(const FileURL& url, const FileURL& toURL) {
+    return _copyItemAtURL(url, toURL, /*failIfSrcMissing=*/false);
 }
 
-bool TarnFileManager::renameItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error) {
+TarnStatus TarnFileManager::renameItemAtURL(const FileURL& url, const FileURL& toURL) {
     int err = 0;
     if (auto fp = TARN_FAILPOINT("fm.move"))
         err = *fp;
     else
         err = FsRename(url, toURL);
-    if (err == 0) return true;
-    setError(error, TARN_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", url, toURL, errText(err)));
-    return false;
+    if (err == 0) return {};
+    return TARN_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", url, toURL, errText(err));
 }
 
-bool TarnFileManager::_moveItemAtURL(const FileURL& url, const FileURL& toURL, bool failIfSrcMissing,
-                                     TarnErrorRef* error) {
+TarnStatus TarnFileManager::_moveItemAtURL(const FileURL& url, const FileURL& toURL,
+                                           bool failIfSrcMissing) {
     if (!failIfSrcMissing) {
         int err = FsLstat(url, nullptr);
-        if (err == ENOENT) return true;
-        if (err) {
-            setError(error, TARN_POSIX_ERROR(err, "stat of %@ failed: %s", url, errText(err)));
-            return false;
-        }
+        if (err == ENOENT) return {};
+        if (err) return TARN_POSIX_ERROR(err, "stat of %@ failed: %s", url, errText(err));
     }
-    TarnErrorRef renameError;
-    if (renameItemAtURL(url, toURL, &renameError)) return true;
-    if (renameError->posixCode() != EXDEV) {
-        setError(error, renameError);
-        return false;
-    }
-    if (!_copyItemAtURL(url, toURL, true, error)) return false;
-    if (auto fp = TARN_FAILPOINT("fm.move.afterCopy")) {
-        setError(error, TARN_POSIX_ERROR(*fp, "rename of %@ to %@ failed: %s", url, toURL, errText(*fp)));
-        return false;
-    }
-    TarnErrorRef removeError;
-    if (!removeItemAtURL(url, &removeError))
-        TarnLog(kLogError, __func__, "Failed to remove move source after copy at %@ : %@", url, removeError);
-    return true;
+    TarnStatus renamed = renameItemAtURL(url, toURL);
+    if (renamed.ok()) return {};
+    if (renamed.error()->posixCode() != EXDEV) return renamed;
+    TARN_TRY(_copyItemAtURL(url, toURL, /*failIfSrcMissing=*/true));
+    if (auto fp = TARN_FAILPOINT("fm.move.afterCopy"))
+        return TARN_POSIX_ERROR(*fp, "rename of %@ to %@ failed: %s", url, toURL, errText(*fp));
+    if (TarnStatus removed = removeItemAtURL(url); !removed.ok())
+        TarnLog(kLogError, __func__, "Failed to remove move source after copy at %@ : %@", url,
+                removed.error());
+    return {};
 }
 
-bool TarnFileManager::_copyItemAtURL(const FileURL& url, const FileURL& toURL, bool failIfSrcMissing,
-                                     TarnErrorRef* error) {
+TarnStatus TarnFileManager::_copyItemAtURL(const FileURL& url, const FileURL& toURL,
+                                           bool failIfSrcMissing) {
     int err = FsLstat(url, nullptr);
-    if (err == ENOENT && !failIfSrcMissing) return true;
-    if (err) {
-        setError(error, TARN_POSIX_ERROR(err, "stat of %@ failed: %s", url, errText(err)));
-        return false;
-    }
+    if (err == ENOENT && !failIfSrcMissing) return {};
+    if (err) return TARN_POSIX_ERROR(err, "stat of %@ failed: %s", url, errText(err));
     if (auto fp = TARN_FAILPOINT("fm.copy"))
         err = *fp;
     else
         err = FsCopyTree(url, toURL);
-    if (err) {
-        setError(error, TARN_POSIX_ERROR(err, "copy of %@ to %@ failed: %s", url, toURL, errText(err)));
-        return false;
-    }
-    return true;
+    if (err) return TARN_POSIX_ERROR(err, "copy of %@ to %@ failed: %s", url, toURL, errText(err));
+    return {};
 }
 
-bool TarnFileManager::removeItemAtURL(const FileURL& url, TarnErrorRef* error) {
-    if (url.empty()) {
-        setError(error, TARN_POSIX_ERROR(EFAULT, "nil url passed to -removeItemAtURL:error:"));
-        return false;
-    }
-    if (auto fp = TARN_FAILPOINT("fm.remove")) {
-        setError(error, TARN_POSIX_ERROR(*fp, "remove of %@ failed: %s", url, errText(*fp)));
-        return false;
-    }
+TarnStatus TarnFileManager::removeItemAtURL(const FileURL& url) {
+    if (url.empty()) return TARN_POSIX_ERROR(EFAULT, "nil url passed to -removeItemAtURL:error:");
+    if (auto fp = TARN_FAILPOINT("fm.remove"))
+        return TARN_POSIX_ERROR(*fp, "remove of %@ failed: %s", url, errText(*fp));
     int firstError = 0;
     auto callback = [&firstError](const FsWalkEntry& entry, int err) {
         const char* tag = "_remove_error_callback";
@@ -523,26 +489,22 @@ bool TarnFileManager::removeItemAtURL(const FileURL& url, TarnErrorRef* error) {
         return err == ENOENT;
     };
     int err = FsRemoveTree(url, callback);
-    if (err != 0 && err != ENOENT) {
-        setError(error, TARN_POSIX_ERROR(err, "remove of %@ failed: %s", url, errText(err)));
-        return false;
-    }
-    if (firstError != 0 && firstError != ENOENT) {
-        setError(error, TARN_POSIX_ERROR(firstError, "remove of %@ failed: %s", url, errText(firstError)));
-        return false;
-    }
-    return true;
+    if (err != 0 && err != ENOENT)
+        return TARN_POSIX_ERROR(err, "remove of %@ failed: %s", url, errText(err));
+    if (firstError != 0 && firstError != ENOENT)
+        return TARN_POSIX_ERROR(firstError, "remove of %@ failed: %s", url, errText(firstError));
+    return {};
 }
 
 // ---- Files the daemon writes for itself ----
 
-bool TarnFileManager::writeData(const std::string& data, const FileURL& toURL, uint64_t options,
-                                TarnErrorRef* error) {
-    return writeData(data, toURL, options, 0644, error);
+TarnStatus TarnFileManager::writeData(const std::string& data, const FileURL& toURL,
+                                      uint64_t options) {
+    return writeData(data, toURL, options, 0644);
 }
 
-bool TarnFileManager::writeData(const std::string& data, const FileURL& toURL, uint64_t options, mode_t mode,
-                                TarnErrorRef* error) {
+TarnStatus TarnFileManager::writeData(const std::string& data, const FileURL& toURL,
+                                      uint64_t options, mode_t mode) {
     int err = 0;
     if (auto fp = TARN_FAILPOINT("fm.writeData"))
         err = *fp;
@@ -550,20 +512,14 @@ bool TarnFileManager::writeData(const std::string& data, const FileURL& toURL, u
         // Without file protection the file simply carries no class, which
         // reads as class 0; with it, nothing is inherited on Linux either.
         err = FsWriteFile(toURL, data, mode, (options & kTarnWriteAtomic) != 0, -1);
-    if (err) {
-        setError(error, TARN_POSIX_ERROR(err, "write of %@ failed: %s", toURL, errText(err)));
-        return false;
-    }
-    return true;
+    if (err) return TARN_POSIX_ERROR(err, "write of %@ failed: %s", toURL, errText(err));
+    return {};
 }
 
-std::optional<std::string> TarnFileManager::readDataAtURL(const FileURL& url, size_t maxBytes,
-                                                          TarnErrorRef* error) {
+TarnResult<std::string> TarnFileManager::readDataAtURL(const FileURL& url, size_t maxBytes) {
     std::string out;
-    if (int err = FsReadFile(url, maxBytes, &out)) {
-        setError(error, TARN_POSIX_ERROR(err, "read of %@ failed: %s", url, errText(err)));
-        return std::nullopt;
-    }
+    if (int err = FsReadFile(url, maxBytes, &out))
+        return TARN_POSIX_ERROR(err, "read of %@ failed: %s", url, errText(err));
     return out;
 }
 
@@ -593,13 +549,11 @@ int TarnFileManager::forEachNameInDirectory(const FsFd& directory,
 
 // ---- Listing and traversal ----
 
-std::optional<std::vector<FileURL>> TarnFileManager::urlsForItemsInDirectoryAtURL(const FileURL& url,
-                                                                                  TarnErrorRef* error) {
+TarnResult<std::vector<FileURL>> TarnFileManager::urlsForItemsInDirectoryAtURL(const FileURL& url) {
     std::vector<FsDirEntry> entries;
     if (int err = FsListDirectory(url, &entries)) {
         if (err != ENOENT) TarnLog(kLogError, __func__, "opendir of %s failed: %s", url, errText(err));
-        setError(error, TARN_POSIX_ERROR(err, "_IterateDirectory for %@ returned %s", url, errText(err)));
-        return std::nullopt;
+        return TARN_POSIX_ERROR(err, "_IterateDirectory for %@ returned %s", url, errText(err));
     }
     std::vector<FileURL> out;
     out.reserve(entries.size());
@@ -616,8 +570,8 @@ std::optional<std::vector<FileURL>> TarnFileManager::urlsForItemsInDirectoryAtUR
     return out;
 }
 
-bool TarnFileManager::_traverseDirectory(const FileURL& url, TarnErrorRef* error,
-                                         const TarnTraversalBlock& withBlock) {
+TarnStatus TarnFileManager::_traverseDirectory(const FileURL& url,
+                                               const TarnTraversalBlock& withBlock) {
     SignpostInterval interval(kLogCategory, "TraversingDirectory");
     uint64_t handed = 0;
     TarnErrorRef walkError;
@@ -629,9 +583,8 @@ bool TarnFileManager::_traverseDirectory(const FileURL& url, TarnErrorRef* error
             return false;
         }
         ++handed;
-        TarnErrorRef blockError;
-        if (!withBlock(entry, &blockError)) {
-            walkError = blockError;
+        if (TarnStatus visited = withBlock(entry); !visited.ok()) {
+            walkError = visited.error();
             if (!walkError)
                 walkError = TARN_POSIX_ERROR_IN(operation, ECANCELED, "traversal of %s stopped", url);
             return false;
@@ -639,15 +592,10 @@ bool TarnFileManager::_traverseDirectory(const FileURL& url, TarnErrorRef* error
         return true;
     });
     interval.end({{"count", std::to_string(handed)}});
-    if (walkError) {
-        setError(error, walkError);
-        return false;
-    }
-    if (err) {
-        setError(error, TARN_POSIX_ERROR(err, "fts_open failed for %s with error %s", url, errText(err)));
-        return false;
-    }
-    return true;
+    if (walkError) return walkError;
+    if (err)
+        return TARN_POSIX_ERROR(err, "fts_open failed for %s with error %s", url, errText(err));
+    return {};
 }
 
 void TarnFileManager::printDirectoryStructureAtURL(const FileURL& url) {
@@ -678,58 +626,44 @@ bool TarnFileManager::itemDoesNotExistAtURL(const FileURL& url) {
 
 // ---- Data protection ----
 
-bool TarnFileManager::dataProtectionClassOfItemAtURL(const FileURL& url, int32_t* dataProtectionClass,
-                                                     TarnErrorRef* error) {
+TarnResult<int32_t> TarnFileManager::dataProtectionClassOfItemAtURL(const FileURL& url) {
     FsFd fd;
-    if (int err = FsOpenItem(-1, url, &fd)) {
-        setError(error, TARN_POSIX_ERROR(err, "Failed to open %s : %s", url, errText(err)));
-        return false;
-    }
+    if (int err = FsOpenItem(-1, url, &fd))
+        return TARN_POSIX_ERROR(err, "Failed to open %s : %s", url, errText(err));
     int32_t cls = 0;
-    if (int err = FsGetProtectionClass(fd.get(), &cls)) {
-        setError(error, TARN_POSIX_ERROR(err, "Failed to getclass of file %s: %s", url, errText(err)));
-        return false;
-    }
-    if (dataProtectionClass) *dataProtectionClass = cls;
-    return true;
+    if (int err = FsGetProtectionClass(fd.get(), &cls))
+        return TARN_POSIX_ERROR(err, "Failed to getclass of file %s: %s", url, errText(err));
+    return cls;
 }
 
-bool TarnFileManager::setDataProtectionClassOfItemAtURL(const FileURL& url, int32_t toClass,
-                                                        const TarnDataProtectionPredicate& ifPredicate,
-                                                        TarnErrorRef* error) {
+TarnStatus TarnFileManager::setDataProtectionClassOfItemAtURL(
+    const FileURL& url, int32_t toClass, const TarnDataProtectionPredicate& ifPredicate) {
     FsFd fd;
-    if (int err = FsOpenItem(-1, url, &fd)) {
-        setError(error, TARN_POSIX_ERROR(err, "Failed to open %s : %s", url, errText(err)));
-        return false;
-    }
+    if (int err = FsOpenItem(-1, url, &fd))
+        return TARN_POSIX_ERROR(err, "Failed to open %s : %s", url, errText(err));
     if (ifPredicate) {
         int32_t current = 0;
-        if (int err = FsGetProtectionClass(fd.get(), &current)) {
-            setError(error, TARN_POSIX_ERROR(err, "Failed to getclass of file %s: %s", url, errText(err)));
-            return false;
-        }
-        if (!ifPredicate(current)) return true;
+        if (int err = FsGetProtectionClass(fd.get(), &current))
+            return TARN_POSIX_ERROR(err, "Failed to getclass of file %s: %s", url, errText(err));
+        if (!ifPredicate(current)) return {};
     }
     int err = 0;
     if (auto fp = TARN_FAILPOINT("fm.setDataProtectionClass"))
         err = *fp;
     else
         err = setProtectionClassChecked(fd.get(), toClass);
-    if (err) {
-        setError(error, TARN_POSIX_ERROR(err, "Failed to setclass(%d) on file %s: %s", toClass, url, errText(err)));
-        return false;
-    }
-    return true;
+    if (err)
+        return TARN_POSIX_ERROR(err, "Failed to setclass(%d) on file %s: %s", toClass, url,
+                                errText(err));
+    return {};
 }
 
 // ---- Ownership ----
 
-bool TarnFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t toUID, gid_t GID, TarnErrorRef* error) {
+TarnStatus TarnFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t toUID, gid_t GID) {
     const char* tag = __func__;
-    if (auto fp = TARN_FAILPOINT("fm.standardizeOwnership")) {
-        setError(error, TARN_POSIX_ERROR(*fp, "Could not stat %s: %s", url, errText(*fp)));
-        return false;
-    }
+    if (auto fp = TARN_FAILPOINT("fm.standardizeOwnership"))
+        return TARN_POSIX_ERROR(*fp, "Could not stat %s: %s", url, errText(*fp));
     bool privileged = ProcessIsPrivileged();
     bool skipNoted = false;
     // Owner first: chown clears set-id bits, and the mode set next is final.
@@ -749,10 +683,10 @@ bool TarnFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t toUID,
         if (int err = FsChmodAt(parentFd, name, mode))
             TarnLog(kLogError, tag, "Could not chmod %s: %s", path, errText(err));
     };
-    bool ok = _traverseDirectory(url, error, [&](const TarnTraversalEntry& e, TarnErrorRef*) {
-        if (e.type == FsWalkType::DirectoryPost || containsMetadataName(e.path)) return true;
-        standardize(e.parentFd, e.name, e.path, e.st, true);
-        return true;
+    TarnStatus walked = _traverseDirectory(url, [&](const TarnTraversalEntry& e) -> TarnStatus {
+        if (e.type == FsWalkType::DirectoryPost || containsMetadataName(e.path)) return {};
+        standardize(e.parentFd, e.name, e.path, e.st, /*compareGroup=*/true);
+        return {};
     });
     // The root once more, as it stands now.
     FsFd parent;
@@ -760,39 +694,34 @@ bool TarnFileManager::standardizeOwnershipAtURL(const FileURL& url, uid_t toUID,
     FsStat st;
     int err = FsOpenParent(url, &parent, &name);
     if (err == 0) err = FsStatAt(parent.get(), name, &st);
-    if (err) {
-        setError(error, TARN_POSIX_ERROR(err, "Could not stat %s: %s", url, errText(err)));
-        return false;
-    }
-    if (!containsMetadataName(url)) standardize(parent.get(), name, url, st, false);
-    return ok;
+    if (err) return TARN_POSIX_ERROR(err, "Could not stat %s: %s", url, errText(err));
+    if (!containsMetadataName(url))
+        standardize(parent.get(), name, url, st, /*compareGroup=*/false);
+    return walked;
 }
 
 // ---- ACLs ----
 
-bool TarnFileManager::_CreateSystemUserACEInACL(TarnACL* acl, uint32_t withPermissions, uint32_t andFlags,
-                                                TarnErrorRef* withError) {
-    if (!acl) {
-        setError(withError, TARN_ERROR(TarnErrorACLFailed, nullptr, "acl_create_entry() failed: %s",
-                                       errText(EINVAL)));
-        return false;
-    }
+TarnStatus TarnFileManager::_CreateSystemUserACEInACL(TarnACL* acl, uint32_t withPermissions,
+                                                      uint32_t andFlags) {
+    if (!acl)
+        return TARN_ERROR(TarnErrorACLFailed, nullptr, "acl_create_entry() failed: %s",
+                          errText(EINVAL));
     auto group = AccountGroupByName(kSystemUsersGroup);
-    if (!group) {
-        setError(withError, TARN_ERROR(TarnErrorACLFailed, nullptr, "group lookup for systemusers failed: %s",
-                                       errText(ENOENT)));
-        return false;
-    }
+    if (!group)
+        return TARN_ERROR(TarnErrorACLFailed, nullptr, "group lookup for systemusers failed: %s",
+                          errText(ENOENT));
     TarnACLEntry entry;
     entry.qualifier = group->gid;
     entry.permissions = withPermissions;
     entry.flags = andFlags;
     acl->entries.push_back(entry);
-    return true;
+    return {};
 }
 
-TarnACLRef TarnFileManager::_CopySystemContainerACLWithNumACEs(size_t numACEs, bool isDir, bool inheritOnly,
-                                                               TarnErrorRef* withError) {
+TarnResult<TarnACLRef> TarnFileManager::_CopySystemContainerACLWithNumACEs(size_t numACEs,
+                                                                           bool isDir,
+                                                                           bool inheritOnly) {
     auto acl = std::make_unique<TarnACL>();
     acl->capacity = numACEs;
     acl->entries.reserve(numACEs);
@@ -801,20 +730,19 @@ TarnACLRef TarnFileManager::_CopySystemContainerACLWithNumACEs(size_t numACEs, b
                                                 kTarnACLFlagFileInherit
                                           : kTarnACLFlagDirectoryInherit | kTarnACLFlagFileInherit)
                            : kTarnACLFlagInherited;
-    if (!_CreateSystemUserACEInACL(acl.get(), perms, flags, withError)) return nullptr;
+    TARN_TRY(_CreateSystemUserACEInACL(acl.get(), perms, flags));
     return acl;
 }
 
-TarnACLRef TarnFileManager::_CopyTopLevelSystemContainerACLWithError(TarnErrorRef* error) {
-    auto acl = _CopySystemContainerACLWithNumACEs(2, true, true, error);
-    if (!acl) return nullptr;
-    if (!_CreateSystemUserACEInACL(acl.get(), kTarnACLPermsTopLevelSelf, 0, error)) return nullptr;
+TarnResult<TarnACLRef> TarnFileManager::_CopyTopLevelSystemContainerACLWithError() {
+    TarnACLRef acl =
+        TARN_TRY(_CopySystemContainerACLWithNumACEs(2, /*isDir=*/true, /*inheritOnly=*/true));
+    TARN_TRY(_CreateSystemUserACEInACL(acl.get(), kTarnACLPermsTopLevelSelf, 0));
     return acl;
 }
 
-bool TarnFileManager::setTopLevelSystemContainerACLAtURL(const FileURL& url, TarnErrorRef* error) {
-    auto acl = _CopyTopLevelSystemContainerACLWithError(error);
-    if (!acl) return false;
+TarnStatus TarnFileManager::setTopLevelSystemContainerACLAtURL(const FileURL& url) {
+    const TarnACLRef acl = TARN_TRY(_CopyTopLevelSystemContainerACLWithError());
     int err = 0;
     if (auto fp = TARN_FAILPOINT("fm.setTopLevelACL")) err = *fp;
     FsFd parent;
@@ -823,34 +751,30 @@ bool TarnFileManager::setTopLevelSystemContainerACLAtURL(const FileURL& url, Tar
     if (!err) err = FsOpenParent(url, &parent, &name);
     if (!err) err = FsStatAt(parent.get(), name, &st);
     if (!err) err = applyACL(parent.get(), name, *acl, st);
-    if (err) {
-        setError(error, TARN_ERROR(TarnErrorACLFailed, nullptr, "Failed to set ACL on %@: %s", url, errText(err)));
-        return false;
-    }
-    return true;
+    if (err)
+        return TARN_ERROR(TarnErrorACLFailed, nullptr, "Failed to set ACL on %@: %s", url,
+                          errText(err));
+    return {};
 }
 
-bool TarnFileManager::standardizeACLsAtURL(const FileURL& url, bool isSystemContainer, TarnErrorRef* error) {
+TarnStatus TarnFileManager::standardizeACLsAtURL(const FileURL& url, bool isSystemContainer) {
     const char* tag = __func__;
-    auto topLevel = _CopyTopLevelSystemContainerACLWithError(error);
-    if (!topLevel) return false;
-    auto dirACL = _CopySystemContainerACLWithNumACEs(1, true, false, error);
-    if (!dirACL) return false;
-    auto fileACL = _CopySystemContainerACLWithNumACEs(1, false, false, error);
-    if (!fileACL) return false;
-    if (auto fp = TARN_FAILPOINT("fm.standardizeACLs")) {
-        setError(error, TARN_POSIX_ERROR(*fp, "Error for path %s: %s", url, errText(*fp)));
-        return false;
-    }
+    const TarnACLRef topLevel = TARN_TRY(_CopyTopLevelSystemContainerACLWithError());
+    const TarnACLRef dirACL =
+        TARN_TRY(_CopySystemContainerACLWithNumACEs(1, /*isDir=*/true, /*inheritOnly=*/false));
+    const TarnACLRef fileACL =
+        TARN_TRY(_CopySystemContainerACLWithNumACEs(1, /*isDir=*/false, /*inheritOnly=*/false));
+    if (auto fp = TARN_FAILPOINT("fm.standardizeACLs"))
+        return TARN_POSIX_ERROR(*fp, "Error for path %s: %s", url, errText(*fp));
     bool privileged = ProcessIsPrivileged();
     bool skipNoted = false;
-    return _traverseDirectory(url, error, [&](const TarnTraversalEntry& e, TarnErrorRef*) {
-        if (e.type == FsWalkType::DirectoryPost || containsMetadataName(e.path)) return true;
+    return _traverseDirectory(url, [&](const TarnTraversalEntry& e) -> TarnStatus {
+        if (e.type == FsWalkType::DirectoryPost || containsMetadataName(e.path)) return {};
         bool isDir = e.type == FsWalkType::Directory;
         if (e.level == 0 && isSystemContainer && isDir) {
             if (int err = applyACL(e.parentFd, e.name, *topLevel, e.st))
                 TarnLog(kLogError, tag, "Failed to set top level ACL on dir %s: %s", e.path, errText(err));
-            return true;
+            return {};
         }
         if (e.type != FsWalkType::Symlink) {
             // Mode before ACL: chmod rewrites the ACL mask.
@@ -869,35 +793,33 @@ bool TarnFileManager::standardizeACLsAtURL(const FileURL& url, bool isSystemCont
         } else if (int err = FsChownAt(e.parentFd, e.name, kNobodyID, kNobodyID)) {
             TarnLog(kLogError, tag, "Could not chown %s: %s", e.path, errText(err));
         }
-        return true;
+        return {};
     });
 }
 
-bool TarnFileManager::standardizeACLsForSystemContainerAtURL(const FileURL& url, TarnErrorRef* error) {
-    return standardizeACLsAtURL(url, true, error);
+TarnStatus TarnFileManager::standardizeACLsForSystemContainerAtURL(const FileURL& url) {
+    return standardizeACLsAtURL(url, /*isSystemContainer=*/true);
 }
 
-bool TarnFileManager::standardizeAllSystemContainerACLsAtURL(const FileURL& url, TarnErrorRef* error) {
-    TarnErrorRef listError;
-    auto items = urlsForItemsInDirectoryAtURL(url, &listError);
-    if (!items) {
-        if (listError && listError->posixCode() == ENOENT) return true;
-        TarnLog(kLogError, __func__, "Failed to get items at URL%@ : %@", url, listError);
-        setError(error, listError);
-        return false;
+TarnStatus TarnFileManager::standardizeAllSystemContainerACLsAtURL(const FileURL& url) {
+    auto items = urlsForItemsInDirectoryAtURL(url);
+    if (!items.ok()) {
+        if (items.error() && items.error()->posixCode() == ENOENT) return {};
+        TarnLog(kLogError, __func__, "Failed to get items at URL%@ : %@", url, items.error());
+        return items.error();
     }
-    if (items->empty()) return true;
+    if (items->empty()) return {};
     TarnLog(kLogNotice, __func__, "Potential containers requiring ACL migration: %@", describeURLs(*items));
-    bool ok = true;
+    TarnStatus result;
     for (const auto& item : *items) {
-        TarnErrorRef itemError;
-        if (!standardizeACLsForSystemContainerAtURL(item, &itemError)) {
-            TarnLog(kLogError, __func__, "Failed to set system container ACL at %@: %@", item, itemError);
-            setError(error, itemError);
-            ok = false;
+        if (TarnStatus standardized = standardizeACLsForSystemContainerAtURL(item);
+            !standardized.ok()) {
+            TarnLog(kLogError, __func__, "Failed to set system container ACL at %@: %@", item,
+                    standardized.error());
+            result = standardized;
         }
     }
-    return ok;
+    return result;
 }
 
 // ---- Disk usage ----

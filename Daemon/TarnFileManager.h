@@ -13,10 +13,14 @@
 // container with the identifier locks. URLs are FileURL host paths with the
 // root prefix applied; an empty FileURL stands for "no URL" (nil).
 //
-// Errors: operations that take `TarnErrorRef* error` write it only on
-// failure; the pointer may be null. File-layer errors are POSIX error values
-// (code = errno) except the ACL builders (TarnErrorACLFailed). No operation
-// throws.
+// Errors: every operation that can fail returns a TarnResult (TarnStatus
+// when there is no value), by the convention in Daemon/TarnResult.h.
+// File-layer errors are POSIX error values (code = errno) except the ACL
+// builders (TarnErrorACLFailed). Two kinds answer otherwise, on purpose: the
+// real-path checks answer nullopt and log why, and the descriptor calls of a
+// cache rebuild (openDirectoryAtURL, readDataInDirectory,
+// forEachNameInDirectory) answer a bare errno, since a rebuild meets many
+// unreadable entries and wants no error value for them. No operation throws.
 //
 // Every mutating operation has a failpoint (Platform/Failpoints.h) that tests
 // use to inject errors or crashes.
@@ -30,6 +34,7 @@
 #include <vector>
 
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnResult.h"
 #include "Platform/FileSystem.h"
 #include "Platform/Path.h"
 
@@ -63,8 +68,9 @@ enum : uint64_t {
 // the FileSystem calls taking a directory descriptor) for anything that
 // changes the entry.
 using TarnTraversalEntry = FsWalkEntry;
-// Returns true to go on; false (optionally filling the error) stops the walk.
-using TarnTraversalBlock = std::function<bool(const TarnTraversalEntry& entry, TarnErrorRef* error)>;
+// Success goes on; a failure stops the walk with its error (ECANCELED when
+// it has no error value).
+using TarnTraversalBlock = std::function<TarnStatus(const TarnTraversalEntry& entry)>;
 // Given the current class, answers whether to change it.
 using TarnDataProtectionPredicate = std::function<bool(int32_t currentClass)>;
 
@@ -129,46 +135,42 @@ public:
     // Owner 0 leaves the owner alone (it is used as user and group id);
     // class -1 leaves the class alone. An existing directory is not an error
     // and still gets class and owner.
-    bool createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
-                              TarnErrorRef* error);
-    bool createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
-                              TarnDataProtectionClass dataProtectionClass, TarnErrorRef* error);
-    bool createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
-                              uid_t owner, TarnErrorRef* error);
-    bool createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories, mode_t mode,
-                              uid_t owner, TarnDataProtectionClass dataProtectionClass,
-                              TarnErrorRef* error);
+    TarnStatus createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories,
+                                    mode_t mode);
+    TarnStatus createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories,
+                                    mode_t mode, TarnDataProtectionClass dataProtectionClass);
+    TarnStatus createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories,
+                                    mode_t mode, uid_t owner);
+    TarnStatus createDirectoryAtURL(const FileURL& url, bool withIntermediateDirectories,
+                                    mode_t mode, uid_t owner,
+                                    TarnDataProtectionClass dataProtectionClass);
 
     // A new owner-only directory named prefix + 6 random characters ("temp."
     // by default) inside `url`.
-    std::optional<FileURL> createTemporaryDirectoryInDirectoryURL(const FileURL& url,
-                                                                  TarnErrorRef* error);
-    std::optional<FileURL> createTemporaryDirectoryInDirectoryURL(const FileURL& url,
-                                                                  const std::string& withNamePrefix,
-                                                                  TarnErrorRef* error);
+    TarnResult<FileURL> createTemporaryDirectoryInDirectoryURL(const FileURL& url);
+    TarnResult<FileURL> createTemporaryDirectoryInDirectoryURL(const FileURL& url,
+                                                               const std::string& withNamePrefix);
 
     // ---- Move, copy, remove ----
 
     // rename(); across volumes a copy followed by removal of the source.
-    bool moveItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
+    TarnStatus moveItemAtURL(const FileURL& url, const FileURL& toURL);
     // A missing source succeeds and moves nothing.
-    bool moveItemIfExistsAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
+    TarnStatus moveItemIfExistsAtURL(const FileURL& url, const FileURL& toURL);
     // One rename and nothing else: across volumes it fails (EXDEV) rather
     // than copy. For an item whose removal failed, a copy would only leave a
     // second one behind.
-    bool renameItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
+    TarnStatus renameItemAtURL(const FileURL& url, const FileURL& toURL);
     // Recursive copy: data, mode, owner, times, xattrs, ACLs; links as links.
-    bool copyItemAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
-    bool copyItemIfExistsAtURL(const FileURL& url, const FileURL& toURL, TarnErrorRef* error);
-    bool _moveItemAtURL(const FileURL& url, const FileURL& toURL, bool failIfSrcMissing,
-                        TarnErrorRef* error);
-    bool _copyItemAtURL(const FileURL& url, const FileURL& toURL, bool failIfSrcMissing,
-                        TarnErrorRef* error);
+    TarnStatus copyItemAtURL(const FileURL& url, const FileURL& toURL);
+    TarnStatus copyItemIfExistsAtURL(const FileURL& url, const FileURL& toURL);
+    TarnStatus _moveItemAtURL(const FileURL& url, const FileURL& toURL, bool failIfSrcMissing);
+    TarnStatus _copyItemAtURL(const FileURL& url, const FileURL& toURL, bool failIfSrcMissing);
 
     // Recursive removal, children first, never following links; immutable
     // items are cleared and unlinked; a missing path succeeds. The first
     // error met decides the result (the rest of the tree is still tried).
-    bool removeItemAtURL(const FileURL& url, TarnErrorRef* error);
+    TarnStatus removeItemAtURL(const FileURL& url);
 
     // ---- Files the daemon writes for itself ----
 
@@ -178,13 +180,11 @@ public:
     // the old or the new contents, never a torn file. Without file protection
     // the file gets class 0 (readable while locked); otherwise it is left to
     // inherit.
-    bool writeData(const std::string& data, const FileURL& toURL, uint64_t options,
-                   TarnErrorRef* error);
-    bool writeData(const std::string& data, const FileURL& toURL, uint64_t options, mode_t mode,
-                   TarnErrorRef* error);
+    TarnStatus writeData(const std::string& data, const FileURL& toURL, uint64_t options);
+    TarnStatus writeData(const std::string& data, const FileURL& toURL, uint64_t options,
+                         mode_t mode);
     // Reads a whole regular file (not through a link), at most `maxBytes`.
-    std::optional<std::string> readDataAtURL(const FileURL& url, size_t maxBytes,
-                                             TarnErrorRef* error);
+    TarnResult<std::string> readDataAtURL(const FileURL& url, size_t maxBytes);
     // The same for `relativePath` below `directory`, a directory held open
     // (openDirectoryAtURL) so that many reads below it do not walk its path
     // again. On failure the POSIX error value; no error object is made.
@@ -204,12 +204,10 @@ public:
 
     // Names not starting with "." in directory order, as URLs below `url`.
     // A missing directory fails with code ENOENT.
-    std::optional<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& url,
-                                                                      TarnErrorRef* error);
+    TarnResult<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& url);
     // Pre-order walk with post-order directory visits, physical, one file
     // system. Entries with unreadable metadata stop the walk with their errno.
-    bool _traverseDirectory(const FileURL& url, TarnErrorRef* error,
-                            const TarnTraversalBlock& withBlock);
+    TarnStatus _traverseDirectory(const FileURL& url, const TarnTraversalBlock& withBlock);
     // Logs every item of the tree at error level (orphaned data).
     void printDirectoryStructureAtURL(const FileURL& url);
 
@@ -220,23 +218,25 @@ public:
 
     // ---- Data protection ----
 
-    bool dataProtectionClassOfItemAtURL(const FileURL& url, int32_t* dataProtectionClass,
-                                        TarnErrorRef* error);
+    TarnResult<int32_t> dataProtectionClassOfItemAtURL(const FileURL& url);
     // Fails with EPERM while the device is locked when the current or the new
     // class is 1. A predicate answering false ends with success and no change.
-    bool setDataProtectionClassOfItemAtURL(const FileURL& url, int32_t toClass,
-                                           const TarnDataProtectionPredicate& ifPredicate,
-                                           TarnErrorRef* error);
+    TarnStatus setDataProtectionClassOfItemAtURL(const FileURL& url, int32_t toClass,
+                                                 const TarnDataProtectionPredicate& ifPredicate);
 
     // ---- Ownership, ACLs, disk usage ----
 
     // Owner/group of every item to uid/gid, mode 0755 for directories and
-    // executables, 0644 otherwise. Per-item failures are logged only.
-    bool standardizeOwnershipAtURL(const FileURL& url, uid_t toUID, gid_t GID, TarnErrorRef* error);
-    bool setTopLevelSystemContainerACLAtURL(const FileURL& url, TarnErrorRef* error);
-    bool standardizeACLsAtURL(const FileURL& url, bool isSystemContainer, TarnErrorRef* error);
-    bool standardizeACLsForSystemContainerAtURL(const FileURL& url, TarnErrorRef* error);
-    bool standardizeAllSystemContainerACLsAtURL(const FileURL& url, TarnErrorRef* error);
+    // executables, 0644 otherwise. Per-item failures are logged only; a walk
+    // that stops part way still fails, after the root has been seen to.
+    TarnStatus standardizeOwnershipAtURL(const FileURL& url, uid_t toUID, gid_t GID);
+    TarnStatus setTopLevelSystemContainerACLAtURL(const FileURL& url);
+    TarnStatus standardizeACLsAtURL(const FileURL& url, bool isSystemContainer);
+    TarnStatus standardizeACLsForSystemContainerAtURL(const FileURL& url);
+    // Every item of `url` as a system container; a missing `url` succeeds.
+    // The other items are still tried after a failure; the last failure is
+    // the result.
+    TarnStatus standardizeAllSystemContainerACLsAtURL(const FileURL& url);
     // Bytes allocated to the tree; 0 when no size can be had.
     uint64_t fastDiskUsageForURL(const FileURL& url);
     uint64_t diskUsageForURL(const FileURL& url);
@@ -244,13 +244,12 @@ public:
     static uint64_t TEST_diskUsageMeasurementCount();
 
     // ACL builders (callers own the result). Failures are TarnErrorACLFailed.
-    bool _CreateSystemUserACEInACL(TarnACL* acl, uint32_t withPermissions, uint32_t andFlags,
-                                   TarnErrorRef* withError);
-    TarnACLRef _CopySystemContainerACLWithNumACEs(size_t numACEs, bool isDir, bool inheritOnly,
-                                                  TarnErrorRef* withError);
-    TarnACLRef _CopyTopLevelSystemContainerACLWithError(TarnErrorRef* error);
+    TarnStatus _CreateSystemUserACEInACL(TarnACL* acl, uint32_t withPermissions, uint32_t andFlags);
+    TarnResult<TarnACLRef> _CopySystemContainerACLWithNumACEs(size_t numACEs, bool isDir,
+                                                              bool inheritOnly);
+    TarnResult<TarnACLRef> _CopyTopLevelSystemContainerACLWithError();
 
-private:
+  private:
     TarnFileManager() = default;
 };
 

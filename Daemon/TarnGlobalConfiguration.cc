@@ -57,11 +57,11 @@ FileURL TarnGlobalConfiguration::directoryGetter(const char* tag, std::optional<
                                                  int32_t protectionClass) {
     std::lock_guard<std::recursive_mutex> guard(lock_);
     if (!*slot) *slot = RootPath(absolutePath);
-    TarnErrorRef error;
-    if (!TarnFileManager::defaultManager().createDirectoryAtURL(
-            **slot, true, kDirectoryMode, owner,
-            static_cast<TarnDataProtectionClass>(protectionClass), &error)) {
-        TarnLog(kLogError, tag, failureFormat, **slot, error);
+    if (const TarnStatus created = TarnFileManager::defaultManager().createDirectoryAtURL(
+            **slot, /*withIntermediateDirectories=*/true, kDirectoryMode, owner,
+            static_cast<TarnDataProtectionClass>(protectionClass));
+        !created.ok()) {
+        TarnLog(kLogError, tag, failureFormat, **slot, created.error());
     }
     return **slot;
 }
@@ -107,11 +107,11 @@ FileURL TarnGlobalConfiguration::logDirectory() {
     // Computed anew and without the lock: logging must never wait on the
     // configuration.
     FileURL url = homeChild("Library/Logs/TarnKeeper");
-    TarnErrorRef error;
-    if (!TarnFileManager::defaultManager().createDirectoryAtURL(url, true, kDirectoryMode,
-                                                                kTarnDataProtectionClassD, &error)) {
-        TarnLog(kLogError, "logDirectory",
-                "Failed to create log directory at \"%@\": %@", url, error);
+    if (const TarnStatus created = TarnFileManager::defaultManager().createDirectoryAtURL(
+            url, /*withIntermediateDirectories=*/true, kDirectoryMode, kTarnDataProtectionClassD);
+        !created.ok()) {
+        TarnLog(kLogError, "logDirectory", "Failed to create log directory at \"%@\": %@", url,
+                created.error());
     }
     return url;
 }
@@ -170,12 +170,11 @@ std::optional<FileURL> TarnGlobalConfiguration::containerDirectoryURLForUserIden
         FileURL url = *globalContainerBaseURLWithContentClass(contentClass, transient);
         uid_t owner = TarnContainerClassIsBundle(contentClass) ? CONTAINER_INSTALLATION_UID
                                                                 : kNoOwnerChange;
-        TarnErrorRef error;
-        if (!TarnFileManager::defaultManager().createDirectoryAtURL(url, true, kDirectoryMode, owner,
-                                                                    &error)) {
-            TarnLog(kLogError,
-                    "containerDirectoryURLForUserIdentity",
-                    "Failed to create container dir at \"%@\": %@", url, error);
+        if (const TarnStatus created = TarnFileManager::defaultManager().createDirectoryAtURL(
+                url, /*withIntermediateDirectories=*/true, kDirectoryMode, owner);
+            !created.ok()) {
+            TarnLog(kLogError, "containerDirectoryURLForUserIdentity",
+                    "Failed to create container dir at \"%@\": %@", url, created.error());
         }
         return url;
     }

@@ -108,11 +108,11 @@ PlistValue TarnMetadata::dictionaryRepresentation() const {
     return PlistValue(std::move(d));
 }
 
-bool TarnMetadata::writeMetadataToDiskWithError(TarnErrorRef* error) const {
-    return writeMetadataToFileURL(PathJoin(url_, kTarnMetadataFileName), error);
+TarnStatus TarnMetadata::writeMetadataToDiskWithError() const {
+    return writeMetadataToFileURL(PathJoin(url_, kTarnMetadataFileName));
 }
 
-bool TarnMetadata::writeMetadataToFileURL(const FileURL& fileURL, TarnErrorRef* error) const {
+TarnStatus TarnMetadata::writeMetadataToFileURL(const FileURL& fileURL) const {
     const PlistValue dictionary = dictionaryRepresentation();
     // Staged on the container's own volume so that the final move is one rename.
     const FileURL temp = PathJoin(
@@ -124,51 +124,52 @@ bool TarnMetadata::writeMetadataToFileURL(const FileURL& fileURL, TarnErrorRef* 
 
     // Atomic as well as unprotected: the bytes are fsynced before any rename,
     // so a power cut cannot leave an empty metadata file behind the final move.
-    TarnErrorRef underlying;
-    if (!Tarn_writeToURL(dictionary, temp, kTarnWriteAtomic | kTarnWriteNoFileProtection,
-                         &underlying)) {
-        auto e = TARN_ERROR(TarnErrorWriteFailed, underlying,
-                            "Failed to write metadata dictionary to URL %@ : %@:%ld", temp,
-                            underlying ? underlying->domain() : std::string("(null)"),
-                            underlying ? static_cast<long>(underlying->code()) : 0L);
-        if (error) *error = std::move(e);
-        return false;
+    if (TarnStatus written =
+            Tarn_writeToURL(dictionary, temp, kTarnWriteAtomic | kTarnWriteNoFileProtection);
+        !written.ok()) {
+        const TarnErrorRef& underlying = written.error();
+        return TARN_ERROR(TarnErrorWriteFailed, underlying,
+                          "Failed to write metadata dictionary to URL %@ : %@:%ld", temp,
+                          underlying ? underlying->domain() : std::string("(null)"),
+                          underlying ? static_cast<long>(underlying->code()) : 0L);
     }
-    if (!TarnFileManager::defaultManager().moveItemAtURL(temp, fileURL, &underlying)) {
-        auto e = TARN_ERROR(TarnErrorWriteFailed, underlying,
-                            "Failed to move metadata from staging: %@ to final: %@", temp, fileURL);
+    if (TarnStatus moved = TarnFileManager::defaultManager().moveItemAtURL(temp, fileURL);
+        !moved.ok()) {
+        TarnErrorRef e =
+            TARN_ERROR(TarnErrorWriteFailed, moved.error(),
+                       "Failed to move metadata from staging: %@ to final: %@", temp, fileURL);
         // The old file is still in place; the stray temporary one is only litter.
-        (void)TarnFileManager::defaultManager().removeItemAtURL(temp, nullptr);
-        if (error) *error = std::move(e);
-        return false;
+        (void)TarnFileManager::defaultManager().removeItemAtURL(temp);
+        return e;
     }
-    return true;
+    return {};
 }
 
 FileURL TarnMetadata::MetadataLocation::fileURL() const {
     return file ? *file : PathJoin(container, kTarnMetadataFileName);
 }
 
-TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtUrl(
+TarnResult<TarnMutableMetadataRef> TarnMetadata::readAndValidateMetadataAtUrl(
     const FileURL& url, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
-    TarnErrorRef* error) {
+    TarnMetadataUnreadable unreadable) {
     return readAndValidateMetadataAtFileUrl(PathJoin(url, kTarnMetadataFileName), forUserIdentity,
-                                            checkClassPath, error);
+                                            checkClassPath, unreadable);
 }
 
-TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataAtFileUrl(
+TarnResult<TarnMutableMetadataRef> TarnMetadata::readAndValidateMetadataAtFileUrl(
     const FileURL& fileURL, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
-    TarnErrorRef* error) {
+    TarnMetadataUnreadable unreadable) {
     std::string bytes;
-    auto data = TarnFileManager::defaultManager().readDataAtURL(fileURL, kMaxPlistBytes, nullptr);
-    if (data) bytes = std::move(*data);
-    return validate(data ? 0 : EIO, bytes, MetadataLocation{PathParent(fileURL), &fileURL},
-                    forUserIdentity, checkClassPath, error);
+    // Why the read failed makes no difference: the file is unreadable either way.
+    auto data = TarnFileManager::defaultManager().readDataAtURL(fileURL, kMaxPlistBytes);
+    if (data.ok()) bytes = std::move(data).value();
+    return validate(data.ok() ? 0 : EIO, bytes, MetadataLocation{PathParent(fileURL), &fileURL},
+                    forUserIdentity, checkClassPath, unreadable);
 }
 
-TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataInClassDirectory(
+TarnResult<TarnMutableMetadataRef> TarnMetadata::readAndValidateMetadataInClassDirectory(
     const FsFd& classDirectory, FileURL url, const TarnUserIdentityRef& forUserIdentity,
-    bool checkClassPath, TarnErrorRef* error) {
+    bool checkClassPath, TarnMetadataUnreadable unreadable) {
     // A rebuild calls this once per container on one thread: the name and the
     // bytes reuse this thread's buffers instead of allocating per file.
     thread_local std::string relative;
@@ -177,7 +178,7 @@ TarnMutableMetadataRef TarnMetadata::readAndValidateMetadataInClassDirectory(
     int err = TarnFileManager::defaultManager().readDataInDirectory(classDirectory, relative,
                                                                     kMaxPlistBytes, &bytes);
     auto metadata = validate(err, bytes, MetadataLocation{std::move(url), nullptr}, forUserIdentity,
-                             checkClassPath, error);
+                             checkClassPath, unreadable);
     // One odd large file must not keep its size for the thread's lifetime.
     if (bytes.capacity() > 64 * 1024) std::string().swap(bytes);
     return metadata;
@@ -218,10 +219,10 @@ struct TarnMetadata::ParsedFields {
     }
 };
 
-TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& bytes,
-                                              MetadataLocation where,
-                                              const TarnUserIdentityRef& forUserIdentity,
-                                              bool checkClassPath, TarnErrorRef* error) {
+TarnResult<TarnMutableMetadataRef> TarnMetadata::validate(
+    int readError, const std::string& bytes, MetadataLocation where,
+    const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
+    TarnMetadataUnreadable unreadable) {
     // A rebuild reads thousands of these files: their few entries are decoded
     // into this thread's reused list, without a dictionary. Anything that
     // reader leaves alone (and the debug line, which shows the whole
@@ -234,8 +235,7 @@ TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& 
         PlistBinaryRootEntries(bytes.data(), bytes.size(), &entries, kTarnMetadataUserIdentityKey,
                                &identity)) {
         ParsedFields fields{&entries, nullptr, &identity};
-        auto metadata = validateFields(fields, std::move(where), forUserIdentity, checkClassPath,
-                                       error);
+        auto metadata = validateFields(fields, std::move(where), forUserIdentity, checkClassPath);
         // The keys point into `bytes`.
         entries.clear();
         identity.clear();
@@ -245,175 +245,240 @@ TarnMutableMetadataRef TarnMetadata::validate(int readError, const std::string& 
     std::optional<PlistValue> dictionary;
     if (readError == 0) dictionary = PlistValue::fromBytes(bytes.data(), bytes.size());
     if (!dictionary || !dictionary->isDict()) {
-        if (error)
-            *error = TARN_ERROR(TarnErrorReadFailed, nullptr, "Failed to read metadata at URL %@",
-                                where.fileURL());
-        return nullptr;
+        if (unreadable == TarnMetadataUnreadable::kQuiet) return TarnErrorRef();
+        return TARN_ERROR(TarnErrorReadFailed, nullptr, "Failed to read metadata at URL %@",
+                          where.fileURL());
     }
     ParsedFields fields{nullptr, &*dictionary};
-    return validateFields(fields, std::move(where), forUserIdentity, checkClassPath, error);
+    return validateFields(fields, std::move(where), forUserIdentity, checkClassPath);
 }
 
-TarnMutableMetadataRef TarnMetadata::validateFields(ParsedFields& fields, MetadataLocation where,
-                                                    const TarnUserIdentityRef& forUserIdentity,
-                                                    bool checkClassPath, TarnErrorRef* error) {
-    auto fail = [error](TarnErrorRef e) -> TarnMutableMetadataRef {
-        if (error) *error = std::move(e);
-        return nullptr;
-    };
-    // Only a failure names the file, so only a failure pays for its path.
-    auto fileURL = [&where] { return where.fileURL(); };
-    // The debug lines show the whole dictionary, when there is one.
-    const bool showDictionary = fields.dict && PlatformLogVerbose();
+namespace {
 
-    const PlistValue* identifierValue = fields.find(kTarnMetadataIdentifierKey);
-    if (!identifierValue || !identifierValue->isString()) {
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Invalid metadata Identifier: %@ at %@", describe(identifierValue),
-                               fileURL()));
-    }
-    // The parsed tree is ours and not shared: take the identifier out of it
-    // unless the debug line at the end is going to show the whole dictionary.
-    std::string identifier = showDictionary
-                                 ? *identifierValue->asString()
-                                 : std::move(const_cast<std::string&>(*identifierValue->asString()));
+// The field validators are steps of validateFields(): their errors and lines
+// carry its name.
+constexpr const char* kValidateFields = "validateFields";
 
-    const PlistValue* uuidValue = fields.find(kTarnMetadataUUIDKey);
-    if (!uuidValue || !uuidValue->isString()) {
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Invalid metadata UUID String: %@ at %@", describe(uuidValue),
-                               fileURL()));
-    }
-    std::optional<Uuid> uuid = Uuid::parse(*uuidValue->asString());
-    if (!uuid) {
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr, "Invalid metadata UUID: %@ at %@",
-                               *uuidValue->asString(), fileURL()));
-    }
+}  // namespace
 
-    const PlistValue* classValue = fields.find(kTarnMetadataContentClassKey);
-    if (!classValue || !classValue->isNumber()) {
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Invalid metadata Class: %@ at %@", describe(classValue),
-                               fileURL()));
-    }
-    auto classNumber = integralValue(*classValue);
-    if (!classNumber || !TarnContainerClassIsValid(*classNumber)) {
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Invalid metadata Content Class: %ld at %@",
-                               static_cast<long>(classNumber.value_or(-1)), fileURL()));
-    }
-    const TarnContainerClass containerClass = static_cast<TarnContainerClass>(*classNumber);
+// What validateFields() has read so far, and one validator per field. Each
+// validator fails with code 29 and a line naming the field and the file, or
+// keeps the field's value.
+struct TarnMetadata::FieldValidator {
+    FieldValidator(ParsedFields& fields, const MetadataLocation& where,
+                   const TarnUserIdentityRef& forUserIdentity)
+        : fields(fields),
+          where(where),
+          forUserIdentity(forUserIdentity),
+          showDictionary(fields.dict && PlatformLogVerbose()) {}
 
-    TarnUserIdentityCache& cache = TarnUserIdentitySharedCache::sharedInstance();
+    ParsedFields& fields;
+    const MetadataLocation& where;
+    const TarnUserIdentityRef& forUserIdentity;
+    // The debug lines show the whole dictionary, when there is one: values
+    // are then copied out of it, not taken.
+    const bool showDictionary;
+
+    std::string identifier;
+    Uuid uuid;
+    TarnContainerClass containerClass = 0;
     TarnUserIdentityRef owner;
-    if (!TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
-        owner = TarnUserIdentityCache::defaultUserIdentity();
-    } else {
+    std::optional<PlistValue> info;
+    std::optional<std::string> userManagedAssetsDirName;
+
+    // Only a failure names the file, so only a failure pays for its path.
+    FileURL fileURL() const { return where.fileURL(); }
+
+    TarnStatus identifierField() {
+        const PlistValue* value = fields.find(kTarnMetadataIdentifierKey);
+        if (!value || !value->isString()) {
+            return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                                 "Invalid metadata Identifier: %@ at %@", describe(value),
+                                 fileURL());
+        }
+        // The parsed tree is ours and not shared: take the identifier out of
+        // it unless the debug line at the end is going to show the whole
+        // dictionary.
+        identifier = showDictionary ? *value->asString()
+                                    : std::move(const_cast<std::string&>(*value->asString()));
+        return {};
+    }
+
+    TarnStatus uuidField() {
+        const PlistValue* value = fields.find(kTarnMetadataUUIDKey);
+        if (!value || !value->isString()) {
+            return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                                 "Invalid metadata UUID String: %@ at %@", describe(value),
+                                 fileURL());
+        }
+        std::optional<Uuid> parsed = Uuid::parse(*value->asString());
+        if (!parsed) {
+            return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                                 "Invalid metadata UUID: %@ at %@", *value->asString(), fileURL());
+        }
+        uuid = *parsed;
+        return {};
+    }
+
+    TarnStatus classField() {
+        const PlistValue* value = fields.find(kTarnMetadataContentClassKey);
+        if (!value || !value->isNumber()) {
+            return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                                 "Invalid metadata Class: %@ at %@", describe(value), fileURL());
+        }
+        auto number = integralValue(*value);
+        if (!number || !TarnContainerClassIsValid(*number)) {
+            return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                                 "Invalid metadata Content Class: %ld at %@",
+                                 static_cast<long>(number.value_or(-1)), fileURL());
+        }
+        containerClass = static_cast<TarnContainerClass>(*number);
+        return {};
+    }
+
+    // The owner: the default identity for a class without one; otherwise the
+    // persona and the stored user identity, checked against the expected one.
+    TarnStatus ownerFields() {
+        TarnUserIdentityCache& cache = TarnUserIdentitySharedCache::sharedInstance();
+        if (!TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
+            owner = TarnUserIdentityCache::defaultUserIdentity();
+            return {};
+        }
         if (!forUserIdentity) {
             PlistValue scratch;
-            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                   "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
-                                   describe(fields.storedIdentity(&scratch)), "(null)",
-                                   identifier, fileURL(), uint64_t{TarnSuccess}));
+            return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                                 "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
+                                 describe(fields.storedIdentity(&scratch)), "(null)", identifier,
+                                 fileURL(), uint64_t{TarnSuccess});
         }
         const uint32_t expectedUID = forUserIdentity->posixUIDForContainerClass(containerClass);
+        const PlistValue* persona = TARN_TRY(personaField(expectedUID));
+        return userIdentityField(cache, persona, expectedUID);
+    }
+
+    // The stored uid of a per-user class, when there is one, is the expected
+    // user's. Answers the entry (null when absent) for userIdentityField().
+    TarnResult<const PlistValue*> personaField(uint32_t expectedUID) {
         const PlistValue* persona = fields.find(kTarnMetadataPersonaKey);
-        if (TarnContainerClassIsPerUser(containerClass)) {
-            if (!persona) {
-                // Absent means the expected user (see below); only the debug
-                // line needs to show it filled in.
-                if (showDictionary) fields.dict->set(kTarnMetadataPersonaKey, PlistValue(expectedUID));
-            } else if (integralValue(*persona) != std::optional<int64_t>(expectedUID)) {
-                return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                       "Incorrect UserId: %@, expecting: %u for %@ at %@",
-                                       persona->description(), expectedUID, identifier, fileURL()));
-            }
+        if (!TarnContainerClassIsPerUser(containerClass)) return persona;
+        if (!persona) {
+            // Absent means the expected user (see userIdentityField()); only
+            // the debug line needs to show it filled in.
+            if (showDictionary) fields.dict->set(kTarnMetadataPersonaKey, PlistValue(expectedUID));
+        } else if (integralValue(*persona) != std::optional<int64_t>(expectedUID)) {
+            return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                                 "Incorrect UserId: %@, expecting: %u for %@ at %@",
+                                 persona->description(), expectedUID, identifier, fileURL());
         }
+        return persona;
+    }
+
+    TarnStatus userIdentityField(TarnUserIdentityCache& cache, const PlistValue* persona,
+                                 uint32_t expectedUID) {
         const PlistValue* stored = fields.find(kTarnMetadataUserIdentityKey);
         if (!stored) {
-            // Written before identities were stored: the owner's uid is all we have.
-            // No such identity leaves the owner missing: the identity made
-            // below then reports it, with its own code.
+            // Written before identities were stored: the owner's uid is all we
+            // have. No such identity leaves the owner missing: ownerExists()
+            // then reports it.
             const uint32_t uid =
                 persona ? static_cast<uint32_t>(integralValue(*persona).value_or(0)) : expectedUID;
             owner = cache.userIdentityForPersonalPersonaWithUID(uid, uid);
-        } else {
-            uint64_t code = TarnSuccess;
-            PlistValue scratch;
-            if (!fields.identityInlined(stored) ||
-                !TarnUserIdentity::userIdentityWithEntries(*fields.identity, cache, &owner)) {
-                TarnResult<TarnUserIdentityRef> read = TarnUserIdentity::userIdentityWithPlist(
-                    *fields.storedIdentity(&scratch), cache);
-                code = read.code(TarnErrorInvalidUserIdentityData);
-                if (read.ok()) owner = std::move(*read);
-            }
-            if (!owner) {
-                return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                       "Invalid metadata User Identity: %@ for %@ at %@: %llu",
-                                       *fields.storedIdentity(&scratch), identifier, fileURL(),
-                                       code));
-            }
-            if (!owner->isEqualToUserIdentity(*forUserIdentity)) {
-                return fail(
-                    TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
-                               owner, forUserIdentity, identifier, fileURL(), code));
-            }
+            return {};
         }
+        uint64_t code = TarnSuccess;
+        PlistValue scratch;
+        if (!fields.identityInlined(stored) ||
+            !TarnUserIdentity::userIdentityWithEntries(*fields.identity, cache, &owner)) {
+            TarnResult<TarnUserIdentityRef> read =
+                TarnUserIdentity::userIdentityWithPlist(*fields.storedIdentity(&scratch), cache);
+            code = read.code(TarnErrorInvalidUserIdentityData);
+            owner = read.ok() ? std::move(*read) : nullptr;
+        }
+        if (!owner) {
+            return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                                 "Invalid metadata User Identity: %@ for %@ at %@: %llu",
+                                 *fields.storedIdentity(&scratch), identifier, fileURL(), code);
+        }
+        if (!owner->isEqualToUserIdentity(*forUserIdentity)) {
+            return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                                 "Incorrect User Identity: %@, expecting: %@ for %@ at %@: %llu",
+                                 owner, forUserIdentity, identifier, fileURL(), code);
+        }
+        return {};
     }
 
-    std::optional<PlistValue> info;
-    if (const PlistValue* infoValue = fields.find(kTarnMetadataInfoKey)) {
-        if (!infoValue->isDict()) {
-            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                   "Invalid metadata Info: %@ at %@", *infoValue, fileURL()));
+    TarnStatus infoField() {
+        PlistValue* value = fields.find(kTarnMetadataInfoKey);
+        if (!value) return {};
+        if (!value->isDict()) {
+            return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                                 "Invalid metadata Info: %@ at %@", *value, fileURL());
         }
-        // The parsed tree is ours: move the info out unless the debug line below
-        // is going to show the whole dictionary.
+        // The parsed tree is ours: move the info out unless the debug line is
+        // going to show the whole dictionary.
         if (showDictionary)
-            info = *infoValue;
+            info = *value;
         else
-            info = std::move(*fields.find(kTarnMetadataInfoKey));
+            info = std::move(*value);
+        return {};
     }
 
-    std::optional<std::string> userManagedAssetsDirName;
-    if (const PlistValue* name = fields.find(kTarnMetadataUserManagedAssetsDirNameKey)) {
-        if (!name->isString()) {
-            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                   "Invalid metadata User Managed Dir Name String: %@ at %@", *name,
-                                   fileURL()));
+    TarnStatus userManagedAssetsDirNameField() {
+        const PlistValue* value = fields.find(kTarnMetadataUserManagedAssetsDirNameKey);
+        if (!value) return {};
+        if (!value->isString()) {
+            return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                                 "Invalid metadata User Managed Dir Name String: %@ at %@", *value,
+                                 fileURL());
         }
-        userManagedAssetsDirName = *name->asString();
+        userManagedAssetsDirName = *value->asString();
+        return {};
     }
 
-    if (checkClassPath) {
+    // The container sits in the directory of its class.
+    TarnStatus classPath() const {
         const char* relative = TarnContainerClassRelativeDirectory(containerClass);
-        if (!isInClassDirectory(where.container, relative ? relative : "")) {
-            const FileURL classDirectory = PathParent(where.container);
-            const FileURL expected =
-                PathJoin(PathParent(PathParent(classDirectory)), relative ? relative : "");
-            return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                                   "Invalid metadata-URLs should match: %@ : %@", fileURL(),
-                                   expected));
-        }
+        if (isInClassDirectory(where.container, relative ? relative : "")) return {};
+        const FileURL classDirectory = PathParent(where.container);
+        const FileURL expected =
+            PathJoin(PathParent(PathParent(classDirectory)), relative ? relative : "");
+        return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                             "Invalid metadata-URLs should match: %@ : %@", fileURL(), expected);
     }
 
     // Identifier and class are checked above, so only a missing owner can
     // fail the identity; the factory then reports it (log line and code) as
     // ever. A good file needs no identity object, only its fields.
-    if (!owner) {
+    TarnStatus ownerExists() {
+        if (owner) return {};
         const uint64_t code = TarnConcreteContainerIdentity::containerIdentityWithUUID(
-                                  *uuid, owner, std::move(identifier), containerClass)
+                                  uuid, owner, std::move(identifier), containerClass)
                                   .code(TarnErrorInvalidArgument);
-        return fail(TARN_ERROR(TarnErrorInvalidMetadata, nullptr,
-                               "Could not create user identity from %@: %llu", fileURL(), code));
+        return TARN_ERROR_IN(kValidateFields, TarnErrorInvalidMetadata, nullptr,
+                             "Could not create user identity from %@: %llu", fileURL(), code);
     }
+};
+
+TarnResult<TarnMutableMetadataRef> TarnMetadata::validateFields(
+    ParsedFields& fields, MetadataLocation where, const TarnUserIdentityRef& forUserIdentity,
+    bool checkClassPath) {
+    FieldValidator check(fields, where, forUserIdentity);
+    TARN_TRY(check.identifierField());
+    TARN_TRY(check.uuidField());
+    TARN_TRY(check.classField());
+    TARN_TRY(check.ownerFields());
+    TARN_TRY(check.infoField());
+    TARN_TRY(check.userManagedAssetsDirNameField());
+    if (checkClassPath) TARN_TRY(check.classPath());
+    TARN_TRY(check.ownerExists());
+
     auto metadata = std::make_shared<TarnMetadata>(
-        FieldsTag{}, containerClass, std::move(owner), std::move(identifier), *uuid,
-        std::move(info), std::move(where.container), std::move(userManagedAssetsDirName));
-    if (showDictionary)
+        FieldsTag{}, check.containerClass, std::move(check.owner), std::move(check.identifier),
+        check.uuid, std::move(check.info), std::move(where.container),
+        std::move(check.userManagedAssetsDirName));
+    if (check.showDictionary)
         PlatformLog("metadata", PlatformLogType::Debug, "[%s] Read metadata from [%@]: %@ <= %@",
-                    "readAndValidateMetadataAtFileUrl", fileURL(), *metadata, *fields.dict);
+                    "readAndValidateMetadataAtFileUrl", check.fileURL(), *metadata, *fields.dict);
     return metadata;
 }
 

@@ -19,6 +19,7 @@
 #include "Daemon/TarnContainerClass.h"
 #include "Daemon/TarnContainerIdentity.h"
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnResult.h"
 #include "Daemon/TarnUserIdentity.h"
 #include "Platform/Path.h"
 #include "Platform/PropertyList.h"
@@ -47,6 +48,12 @@ inline constexpr const char* kTarnInfoCachedCodeSigningInfoKey =
     "com.ostrea.Pallet.CachedCodeSigningInfo";
 inline constexpr const char* kTarnInfoGroupContainerIDsKey = "com.ostrea.Pallet.GroupContainerIDs";
 
+// What a metadata reader answers for a file it cannot read or parse at all
+// (missing, unreadable, not a property-list dictionary). A cache rebuild meets
+// such entries among the containers and has no use for them: kQuiet fails
+// without an error value and without a line; kReport fails with code 12.
+enum class TarnMetadataUnreadable { kReport, kQuiet };
+
 class TarnMetadata {
     struct FieldsTag {};
 
@@ -70,25 +77,26 @@ public:
     // A new concrete identity from the fields; nullptr when that fails.
     TarnConcreteContainerIdentityRef containerIdentity() const;
 
-    // Writes to url() + the metadata file name.
-    bool writeMetadataToDiskWithError(TarnErrorRef* error) const;
-    bool writeMetadataToFileURL(const FileURL& fileURL, TarnErrorRef* error) const;
+    // Writes to url() + the metadata file name. Failures are code 34.
+    TarnStatus writeMetadataToDiskWithError() const;
+    TarnStatus writeMetadataToFileURL(const FileURL& fileURL) const;
     // The dictionary that would be written.
     PlistValue dictionaryRepresentation() const;
 
-    // Reads the metadata of the container directory `url`.
-    static TarnMutableMetadataRef readAndValidateMetadataAtUrl(const FileURL& url,
-                                                        const TarnUserIdentityRef& forUserIdentity,
-                                                        bool checkClassPath, TarnErrorRef* error);
-    static TarnMutableMetadataRef readAndValidateMetadataAtFileUrl(
+    // Reads the metadata of the container directory `url`. On success the
+    // record is never null.
+    static TarnResult<TarnMutableMetadataRef> readAndValidateMetadataAtUrl(
+        const FileURL& url, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
+        TarnMetadataUnreadable unreadable = TarnMetadataUnreadable::kReport);
+    static TarnResult<TarnMutableMetadataRef> readAndValidateMetadataAtFileUrl(
         const FileURL& fileURL, const TarnUserIdentityRef& forUserIdentity, bool checkClassPath,
-        TarnErrorRef* error);
+        TarnMetadataUnreadable unreadable = TarnMetadataUnreadable::kReport);
     // The reader of a class rebuild: the answer of readAndValidateMetadataAtUrl
     // for a container directory `url` directly inside the class directory held
     // open as `classDirectory`; the file is opened relative to that.
-    static TarnMutableMetadataRef readAndValidateMetadataInClassDirectory(
+    static TarnResult<TarnMutableMetadataRef> readAndValidateMetadataInClassDirectory(
         const FsFd& classDirectory, FileURL url, const TarnUserIdentityRef& forUserIdentity,
-        bool checkClassPath, TarnErrorRef* error);
+        bool checkClassPath, TarnMetadataUnreadable unreadable = TarnMetadataUnreadable::kReport);
 
     bool transient() const { return transient_; }
     bool existed() const { return existed_; }
@@ -123,15 +131,19 @@ private:
       FileURL fileURL() const;
   };
   // Parses and checks `bytes` (readError: how reading them failed, or 0).
-  static TarnMutableMetadataRef validate(int readError, const std::string& bytes,
-                                         MetadataLocation where,
-                                         const TarnUserIdentityRef& forUserIdentity,
-                                         bool checkClassPath, TarnErrorRef* error);
+  static TarnResult<TarnMutableMetadataRef> validate(int readError, const std::string& bytes,
+                                                     MetadataLocation where,
+                                                     const TarnUserIdentityRef& forUserIdentity,
+                                                     bool checkClassPath,
+                                                     TarnMetadataUnreadable unreadable);
   struct ParsedFields;
-  // The checks of validate() on the decoded entries; takes values out of them.
-  static TarnMutableMetadataRef validateFields(ParsedFields& fields, MetadataLocation where,
-                                               const TarnUserIdentityRef& forUserIdentity,
-                                               bool checkClassPath, TarnErrorRef* error);
+  // One validator per field, each taking what it checks out of the entries.
+  struct FieldValidator;
+  // The checks of validate() on the decoded entries, one field after
+  // another; takes values out of them.
+  static TarnResult<TarnMutableMetadataRef> validateFields(
+      ParsedFields& fields, MetadataLocation where, const TarnUserIdentityRef& forUserIdentity,
+      bool checkClassPath);
 
   bool transient_ = false;
   bool existed_ = false;

@@ -31,11 +31,11 @@ FileURL TarnPerUserConfiguration::directoryGetter(const char* tag, std::optional
     if (userHomeDirectory_.empty()) return FileURL();
     std::lock_guard<std::recursive_mutex> guard(lock_);
     if (!*slot) *slot = url;
-    TarnErrorRef error;
     const uid_t owner = userIdentity_ ? userIdentity_->posixUID() : 0;
-    if (!TarnFileManager::defaultManager().createDirectoryAtURL(**slot, true, kDirectoryMode, owner,
-                                                                &error)) {
-        TarnLog(kLogError, tag, failureFormat, **slot, error);
+    if (const TarnStatus created = TarnFileManager::defaultManager().createDirectoryAtURL(
+            **slot, /*withIntermediateDirectories=*/true, kDirectoryMode, owner);
+        !created.ok()) {
+        TarnLog(kLogError, tag, failureFormat, **slot, created.error());
     }
     return **slot;
 }
@@ -94,10 +94,11 @@ std::optional<FileURL> TarnPerUserConfiguration::containerDirectoryURLForContent
     std::lock_guard<std::recursive_mutex> guard(lock_);
     FileURL parent = transient ? transientDirectory() : userBaseDirectory();
     FileURL url = PathJoin(parent, TarnContainerClassRelativeDirectory(contentClass));
-    TarnErrorRef error;
-    if (!TarnFileManager::defaultManager().createDirectoryAtURL(url, true, kDirectoryMode,
-                                                                userIdentity_->posixUID(), &error)) {
-        TarnLog(kLogError, tag, "Failed to create container dir at \"%@\": %@", url, error);
+    if (const TarnStatus created = TarnFileManager::defaultManager().createDirectoryAtURL(
+            url, /*withIntermediateDirectories=*/true, kDirectoryMode, userIdentity_->posixUID());
+        !created.ok()) {
+        TarnLog(kLogError, tag, "Failed to create container dir at \"%@\": %@", url,
+                created.error());
     }
     return url;
 }

@@ -15,36 +15,26 @@ TarnErrorRef formatError(const char* function, int line, std::string description
 
 }  // namespace
 
-bool Tarn_writeToURL(const PlistValue& dictionary, const FileURL& url, uint64_t withOptions,
-                     TarnErrorRef* error) {
+TarnStatus Tarn_writeToURL(const PlistValue& dictionary, const FileURL& url, uint64_t withOptions) {
     std::vector<uint8_t> bytes = dictionary.toBinary();
-    if (bytes.empty()) {
-        if (error) *error = formatError(__func__, __LINE__, "Property list could not be serialised");
-        return false;
-    }
+    if (bytes.empty())
+        return formatError(__func__, __LINE__, "Property list could not be serialised");
     return TarnFileManager::defaultManager().writeData(
-        std::string(reinterpret_cast<const char*>(bytes.data()), bytes.size()), url, withOptions,
-        error);
+        std::string(reinterpret_cast<const char*>(bytes.data()), bytes.size()), url, withOptions);
 }
 
-std::optional<PlistValue> Tarn_dictionaryWithContentsOfURL(const FileURL& url, uint64_t options,
-                                                           TarnErrorRef* error) {
-    auto bytes = TarnFileManager::defaultManager().readDataAtURL(url, kMaxPlistBytes, error);
-    if (!bytes) return std::nullopt;
+TarnResult<PlistValue> Tarn_dictionaryWithContentsOfURL(const FileURL& url, uint64_t options) {
+    const std::string bytes =
+        TARN_TRY(TarnFileManager::defaultManager().readDataAtURL(url, kMaxPlistBytes));
     std::string why;
-    auto value = PlistValue::fromBytes(bytes->data(), bytes->size(), &why);
-    if (!value) {
-        if (error) *error = formatError(__func__, __LINE__, Format("Malformed property list at %@: %@", url, why));
-        return std::nullopt;
-    }
-    if (!value->isDict()) {
-        if (error) {
-            *error = formatError(__func__, __LINE__,
-                                 Format("Property list at %@ is not a dictionary", url));
-        }
-        return std::nullopt;
-    }
-    return value;
+    auto value = PlistValue::fromBytes(bytes.data(), bytes.size(), &why);
+    if (!value)
+        return formatError(__func__, __LINE__,
+                           Format("Malformed property list at %@: %@", url, why));
+    if (!value->isDict())
+        return formatError(__func__, __LINE__,
+                           Format("Property list at %@ is not a dictionary", url));
+    return std::move(*value);
 }
 
 bool containsDotDotPathComponents(std::string_view path) {

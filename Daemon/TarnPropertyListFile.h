@@ -9,11 +9,11 @@
 #pragma once
 
 #include <cstdint>
-#include <optional>
 #include <string>
 #include <string_view>
 
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnResult.h"
 #include "Platform/Path.h"
 #include "Platform/PropertyList.h"
 
@@ -26,15 +26,13 @@ inline constexpr uint64_t kPlatformErrorPropertyListReadCorrupt = 2048;
 
 // Serialises `dictionary` (binary) and writes it to `url`. `withOptions` are
 // TarnFileManager write options (kTarnWriteAtomic, kTarnWriteNoFileProtection).
-bool Tarn_writeToURL(const PlistValue& dictionary, const FileURL& url, uint64_t withOptions,
-                     TarnErrorRef* error);
+TarnStatus Tarn_writeToURL(const PlistValue& dictionary, const FileURL& url, uint64_t withOptions);
 
 // Reads `url` (uncached) and parses it. A top level that is not a dictionary
 // fails with kPlatformErrorPropertyListReadCorrupt; a missing or unreadable file
 // with the POSIX error; a malformed one with kPlatformErrorPropertyListReadCorrupt.
 // `options` is reserved for the platform's read options (mutability); 0.
-std::optional<PlistValue> Tarn_dictionaryWithContentsOfURL(const FileURL& url, uint64_t options,
-                                                           TarnErrorRef* error);
+TarnResult<PlistValue> Tarn_dictionaryWithContentsOfURL(const FileURL& url, uint64_t options);
 
 // True when any component of `path` is exactly "..".
 bool containsDotDotPathComponents(std::string_view path);

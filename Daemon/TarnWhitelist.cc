@@ -212,14 +212,14 @@ TarnWhitelist& TarnWhitelist::sharedWhitelist() {
     std::unique_ptr<TarnWhitelist> made;
     const FileURL file = RootPath(kTableFile);
     if (TarnFileManager::defaultManager().itemExistsAtURL(file)) {
-        TarnErrorRef error;
         std::string why;
-        auto table = Tarn_dictionaryWithContentsOfURL(file, 0, &error);
-        if (table) made = whitelistWithTable(*table, internal, &why);
+        const TarnResult<PlistValue> table = Tarn_dictionaryWithContentsOfURL(file, 0);
+        if (table.ok()) made = whitelistWithTable(*table, internal, &why);
         if (!made) {
+            const TarnErrorRef& error = table.error();
             TarnLog(kLogError, "+[TarnWhitelist sharedWhitelist]",
                     "Ignoring well-known containers table at %@: %@", file,
-                    table ? why : (error ? error->description() : std::string("unreadable")));
+                    table.ok() ? why : (error ? error->description() : std::string("unreadable")));
         }
     }
     if (!made) made = whitelistWithTable(builtInTable(), internal, nullptr);

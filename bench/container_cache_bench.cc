@@ -105,7 +105,7 @@ int main(int argc, char** argv) {
                             .value();
         auto m = tarn::TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir,
                                                                std::nullopt);
-        if (!m->writeMetadataToDiskWithError(nullptr)) return 1;
+        if (!m->writeMetadataToDiskWithError().ok()) return 1;
         identifiers.push_back(identifier);
         metadataFiles.push_back(dir + "/" + tarn::kTarnMetadataFileName);
     }
@@ -116,9 +116,10 @@ int main(int argc, char** argv) {
         auto identity =
             tarn::TarnContainerIdentity::containerIdentityWithUserIdentity(user, identifiers[i], 2)
                 .value();
-        tarn::TarnErrorRef error;
         // No kernel read-back: this measures the scan.
-        return cache.containerForContainerIdentity(identity, false, true, false, &error);
+        return cache.containerForContainerIdentity(identity, /*transient=*/false,
+                                                   /*updateSandbox=*/true,
+                                                   /*allowKernelLookup=*/false);
     };
 
     (void)bareReads(base);  // warm the page cache for both sides
@@ -128,7 +129,7 @@ int main(int argc, char** argv) {
     for (int r = 0; r < rounds; ++r) {
         cache = tarn::TarnContainerCache::initWithUserIdentityCache(identities, nullptr, state);
         auto t0 = Clock::now();
-        bool ok = probe(*cache, 0) != nullptr;
+        bool ok = probe(*cache, 0).ok();
         auto t1 = Clock::now();
         bareBytes = bareReads(base);
         auto t2 = Clock::now();
@@ -154,9 +155,10 @@ int main(int argc, char** argv) {
     for (int done = 0; done < lookups; done += chunk) {
         auto t0 = Clock::now();
         for (int i = 0; i < chunk; ++i) {
-            tarn::TarnErrorRef error;
-            hits += cache->containerForContainerIdentity(probes[(done + i) % containers], false,
-                                                         true, &error) != nullptr;
+            auto found = cache->containerForContainerIdentity(probes[(done + i) % containers],
+                                                              /*transient=*/false,
+                                                              /*updateSandbox=*/true);
+            hits += found.ok();
         }
         auto t1 = Clock::now();
         for (int i = 0; i < chunk; ++i) {
@@ -185,9 +187,12 @@ int main(int argc, char** argv) {
             return 1;
         auto t1 = Clock::now();
         std::vector<tarn::TarnMetadataRef> read;
-        for (const auto& url : urls)
-            read.push_back(tarn::TarnMetadata::readAndValidateMetadataInClassDirectory(
-                directory, url, user, true, nullptr));
+        for (const auto& url : urls) {
+            auto m = tarn::TarnMetadata::readAndValidateMetadataInClassDirectory(
+                directory, url, user, /*checkClassPath=*/true,
+                tarn::TarnMetadataUnreadable::kQuiet);
+            read.push_back(m.ok() ? std::move(m).value() : nullptr);
+        }
         auto t2 = Clock::now();
         size_t yes = 0;
         for (const auto& m : read)

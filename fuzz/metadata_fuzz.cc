@@ -47,19 +47,23 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     writeBytes(gFile, data, size);
     const TarnUserIdentityRef owner = TarnUserIdentityCache::defaultUserIdentity();
-    TarnErrorRef error;
-    auto read = TarnMetadata::readAndValidateMetadataAtUrl(gContainer, owner, true, &error);
-    if (!read) {
+    auto result =
+        TarnMetadata::readAndValidateMetadataAtUrl(gContainer, owner, /*checkClassPath=*/true);
+    if (!result.ok()) {
+        const TarnErrorRef& error = result.error();
         if (!error || error->code() == TarnSuccess) std::abort();  // a refusal names its reason
         return 0;
     }
+    const TarnMetadataRef read = *result;
     if (!TarnContainerClassIsValid(read->containerClass()) || read->url() != gContainer)
         std::abort();
     // Written back as the daemon writes it, the same container reads back.
     const auto bytes = read->dictionaryRepresentation().toBinary();
     if (bytes.empty()) std::abort();
     writeBytes(gFile, bytes.data(), bytes.size());
-    auto again = TarnMetadata::readAndValidateMetadataAtUrl(gContainer, owner, true, &error);
+    auto reread =
+        TarnMetadata::readAndValidateMetadataAtUrl(gContainer, owner, /*checkClassPath=*/true);
+    const TarnMetadataRef again = reread.valueOr(nullptr);
     if (!again || again->identifier() != read->identifier() || again->uuid() != read->uuid() ||
         again->containerClass() != read->containerClass() || again->info() != read->info() ||
         again->userManagedAssetsDirName() != read->userManagedAssetsDirName() ||

@@ -109,12 +109,12 @@ class CreateDeleteCrashTest : public test::ScratchRootTest {
         for (const auto& entry : fs::directory_iterator(parent)) {
             const std::string path = entry.path().string();
             EXPECT_TRUE(entry.is_directory()) << path;
-            TarnErrorRef error;
-            auto metadata = TarnMetadata::readAndValidateMetadataAtUrl(
-                path, TarnUserIdentityCache::defaultUserIdentity(), false, &error);
-            EXPECT_TRUE(metadata) << "half-built container at " << path << ": "
-                                  << (error ? error->description() : "");
-            if (!metadata) continue;
+            auto read = TarnMetadata::readAndValidateMetadataAtUrl(
+                path, TarnUserIdentityCache::defaultUserIdentity(), false);
+            EXPECT_TRUE(read.ok()) << "half-built container at " << path << ": "
+                                   << (read.error() ? read.error()->description() : "");
+            if (!read.ok()) continue;
+            const TarnMetadataRef metadata = *read;
             EXPECT_EQ(metadata->containerClass(), 2u) << path;
             EXPECT_TRUE(live.emplace(metadata->identifier(), path).second)
                 << metadata->identifier() << " is live twice: " << path;

@@ -50,10 +50,10 @@ class PerContainerCommandsTest : public test::ScratchRootTest {
         auto identity =
             TarnConcreteContainerIdentity::containerIdentityWithUUID(made.uuid, user, identifier, c)
                 .value();
-        TarnErrorRef error;
         EXPECT_TRUE(
             TarnMetadata::initWithContainerIdentity(identity, std::nullopt, made.url, std::nullopt)
-                ->writeMetadataToDiskWithError(&error));
+                ->writeMetadataToDiskWithError()
+                .ok());
         return made;
     }
 
@@ -67,9 +67,9 @@ class PerContainerCommandsTest : public test::ScratchRootTest {
 
     std::optional<PlistValue> infoOnDisk(const FileURL& url) {
         auto m = TarnMetadata::readAndValidateMetadataAtUrl(
-            url, TarnUserIdentityCache::defaultUserIdentity(), false, nullptr);
-        EXPECT_TRUE(m) << "the metadata file stays readable";
-        return m ? m->info() : std::nullopt;
+            url, TarnUserIdentityCache::defaultUserIdentity(), false);
+        EXPECT_TRUE(m.ok()) << "the metadata file stays readable";
+        return m.ok() ? (*m)->info() : std::nullopt;
     }
     // One value of it; empty when the file or the key is missing.
     std::optional<PlistValue> infoValueOnDisk(const FileURL& url, const char* key) {

@@ -90,8 +90,8 @@ class TarnContainerCacheTest : public test::ScratchRootTest {
                             uuid, user ? user : mobile(), identifier, c)
                             .value();
         auto m = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir, std::nullopt);
-        TarnErrorRef error;
-        EXPECT_TRUE(m->writeMetadataToDiskWithError(&error)) << (error ? error->description() : "");
+        TarnStatus written = m->writeMetadataToDiskWithError();
+        EXPECT_TRUE(written.ok()) << (written.error() ? written.error()->description() : "");
         return m;
     }
 
@@ -104,11 +104,10 @@ class TarnContainerCacheTest : public test::ScratchRootTest {
 
     TarnMetadataRef lookup(TarnContainerClass c, const std::string& identifier, uint64_t* code,
                            bool transient = false) {
-        TarnErrorRef error;
-        auto m =
-            cache_->containerForContainerIdentity(identity(c, identifier), transient, true, &error);
-        *code = m ? TarnSuccess : (error ? error->code() : 0);
-        return m;
+        auto m = cache_->containerForContainerIdentity(identity(c, identifier), transient,
+                                                       /*updateSandbox=*/true);
+        *code = m.code(0);
+        return m.valueOr(nullptr);
     }
 
     std::unique_ptr<FaultySandboxUserState> state_;
@@ -163,8 +162,8 @@ TEST_F(TarnContainerCacheTest, KeyPartsHashAndCompareLikeTheKeyText) {
 TEST_F(TarnContainerCacheTest, RebuildKeepsTheLastOfTwoDirectoriesClaimingOneIdentifier) {
     makeContainer(2, "com.ostrea.twice");
     makeContainer(2, "com.ostrea.twice");
-    auto listing = TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(base(2), nullptr);
-    ASSERT_TRUE(listing && listing->size() == 2);
+    auto listing = TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(base(2));
+    ASSERT_TRUE(listing.ok() && listing->size() == 2);
     uint64_t code = 0;
     auto found = lookup(2, "com.ostrea.twice", &code);
     ASSERT_TRUE(found) << code;
@@ -197,8 +196,9 @@ TEST_F(TarnContainerCacheTest, OnlyUUIDNamesCountExceptWellKnownSystemContainers
 
 TEST_F(TarnContainerCacheTest, AddBeforeTheClassWasBuiltRecordsNothing) {
     auto made = makeContainer(2, "com.ostrea.early");
-    TarnErrorRef error;
-    EXPECT_TRUE(cache_->addContainerMetadata(made, made->url(), false, false, &error));
+    TarnStatus added = cache_->addContainerMetadata(made, made->url(), /*transient=*/false,
+                                                    /*updateSandbox=*/false);
+    EXPECT_TRUE(added.ok());
     EXPECT_EQ(cache_->TEST_rebuildCount(), 0u);
     EXPECT_EQ(state_->sets, 0);
     // The next lookup finds it on disk.
@@ -207,12 +207,13 @@ TEST_F(TarnContainerCacheTest, AddBeforeTheClassWasBuiltRecordsNothing) {
     EXPECT_EQ(cache_->TEST_rebuildCount(), 1u);
 
     // Bad input is refused with 47, never recorded.
-    EXPECT_FALSE(cache_->addContainerMetadata(made, "relative/path", false, true, &error));
-    EXPECT_EQ(error->code(), TarnErrorCacheInvalidInput);
-    EXPECT_FALSE(cache_->removeContainerForUserIdentity(mobile(), 14, "x", false, &error));
-    EXPECT_EQ(error->code(), TarnErrorCacheInvalidInput);
-    EXPECT_FALSE(cache_->allContainersForUserIdentity(mobile(), 0, false, &error));
-    EXPECT_EQ(error->code(), TarnErrorCacheInvalidInput);
+    added = cache_->addContainerMetadata(made, "relative/path", /*transient=*/false,
+                                         /*updateSandbox=*/true);
+    EXPECT_EQ(added.code(0), uint64_t{TarnErrorCacheInvalidInput});
+    EXPECT_EQ(cache_->removeContainerForUserIdentity(mobile(), 14, "x", false).code(0),
+              uint64_t{TarnErrorCacheInvalidInput});
+    EXPECT_EQ(cache_->allContainersForUserIdentity(mobile(), 0, false).code(0),
+              uint64_t{TarnErrorCacheInvalidInput});
 }
 
 TEST_F(TarnContainerCacheTest, TransientContainersAreNeverPushed) {
@@ -220,10 +221,10 @@ TEST_F(TarnContainerCacheTest, TransientContainersAreNeverPushed) {
     uint64_t code = 0;
     ASSERT_TRUE(lookup(2, "com.ostrea.temp", &code, true)) << code;
     auto extra = makeContainer(2, "com.ostrea.temp2", true);
-    TarnErrorRef error;
-    ASSERT_TRUE(cache_->addContainerMetadata(extra, extra->url(), true, true, &error));
-    ASSERT_TRUE(
-        cache_->removeContainerForUserIdentity(mobile(), 2, "com.ostrea.temp", true, &error));
+    TarnStatus added = cache_->addContainerMetadata(extra, extra->url(), /*transient=*/true,
+                                                    /*updateSandbox=*/true);
+    ASSERT_TRUE(added.ok());
+    ASSERT_TRUE(cache_->removeContainerForUserIdentity(mobile(), 2, "com.ostrea.temp", true).ok());
     EXPECT_EQ(state_->sets, 0);
     EXPECT_FALSE(lookup(2, "com.ostrea.temp", &code, false)) << "live and transient are apart";
 }
@@ -244,9 +245,11 @@ TEST_F(TarnContainerCacheTest, RestartAnswersFromTheSandboxStateWithoutARescan) 
     EXPECT_EQ(cache_->TEST_kernelHitCount(), 1u);
 
     // Transient lookups and lookups without kernel access scan.
-    TarnErrorRef error;
-    EXPECT_TRUE(cache_->containerForContainerIdentity(identity(2, "com.ostrea.mail"), false, true,
-                                                      false, &error));
+    auto scanned = cache_->containerForContainerIdentity(identity(2, "com.ostrea.mail"),
+                                                         /*transient=*/false,
+                                                         /*updateSandbox=*/true,
+                                                         /*allowKernelLookup=*/false);
+    EXPECT_TRUE(scanned.ok());
     EXPECT_EQ(cache_->TEST_rebuildCount(), 1u);
 }
 
@@ -297,9 +300,11 @@ TEST_F(TarnContainerCacheTest, ARebuildOfRecordedMappingsWritesNothingButLogsEve
     ASSERT_EQ(state_->setUserStateItemWithPersona(501, 501, 1, "com.ostrea.two", "/stale"), 0);
     const int setsBefore = state_->sets;
     cache_ = makeCache();
-    TarnErrorRef error;
-    ASSERT_TRUE(cache_->containerForContainerIdentity(identity(2, "com.ostrea.one"), false, true,
-                                                      false, &error));
+    auto rebuilt = cache_->containerForContainerIdentity(identity(2, "com.ostrea.one"),
+                                                         /*transient=*/false,
+                                                         /*updateSandbox=*/true,
+                                                         /*allowKernelLookup=*/false);
+    ASSERT_TRUE(rebuilt.ok());
     EXPECT_EQ(state_->sets - setsBefore, 2) << "only the stale mapping is cleared and set";
     auto items = itemsOf(*state_, 501);
     EXPECT_EQ(items["1:com.ostrea.one:501"], a->url());
@@ -333,13 +338,12 @@ TEST_F(TarnContainerCacheTest, AClassDirectoryReachedThroughALinkIsScannedByPath
 TEST_F(TarnContainerCacheTest, AllContainersDropsEntriesWhoseMetadataIsGone) {
     auto a = makeContainer(4, "com.ostrea.a.ext");
     makeContainer(4, "com.ostrea.b.ext");
-    TarnErrorRef error;
-    auto all = cache_->allContainersForUserIdentity(mobile(), 4, false, &error);
-    ASSERT_TRUE(all);
+    auto all = cache_->allContainersForUserIdentity(mobile(), 4, false);
+    ASSERT_TRUE(all.ok());
     EXPECT_EQ(all->size(), 2u);
     std::filesystem::remove(PathJoin(a->url(), kTarnMetadataFileName));
-    all = cache_->allContainersForUserIdentity(mobile(), 4, false, &error);
-    ASSERT_TRUE(all);
+    all = cache_->allContainersForUserIdentity(mobile(), 4, false);
+    ASSERT_TRUE(all.ok());
     ASSERT_EQ(all->size(), 1u);
     EXPECT_EQ(all->front()->identifier(), "com.ostrea.b.ext");
     uint64_t code = 0;
@@ -408,8 +412,7 @@ TEST_F(TarnContainerCacheTest, PublicOperationsOnTheMappingQueueStopTheProcess) 
     auto cache = TarnContainerCache::initWithUserIdentityCache(
         TarnUserIdentitySharedCache::sharedInstance(), mapping.get(), *state_);
     // Off the queue everything works.
-    TarnErrorRef error;
-    EXPECT_TRUE(cache->allContainersForUserIdentity(mobile(), 2, false, &error));
+    EXPECT_TRUE(cache->allContainersForUserIdentity(mobile(), 2, false).ok());
     // On it, the rule would wait for the queue it runs on.
     EXPECT_DEATH(mapping->queue()->sync([&] {
         (void)cache->shouldRegisterSandboxMappingWithUserIdentity(mobile(), "com.x", 2);
@@ -495,9 +498,9 @@ TEST_F(TarnContainerCacheRegistrationTest, EnterpriseGroupIsPushedUnderItsPerson
                         Uuid::generate(), enterprise_, "group.corp", 7)
                         .value();
     auto m = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir, std::nullopt);
-    TarnErrorRef error;
-    ASSERT_TRUE(cache_->addContainerMetadata(m, dir, false, true, &error))
-        << (error ? error->description() : "");
+    TarnStatus added =
+        cache_->addContainerMetadata(m, dir, /*transient=*/false, /*updateSandbox=*/true);
+    ASSERT_TRUE(added.ok()) << (added.error() ? added.error()->description() : "");
     auto items = itemsOf(*state_, enterprise_->posixUID());
     EXPECT_EQ(items.at("2:group.corp:" + std::to_string(enterprise_->kernelPersonaID())), dir);
 

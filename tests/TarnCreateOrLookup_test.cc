@@ -142,11 +142,10 @@ TEST_F(TarnCreateOrLookupTest, NewContainersAreStagedThenLiveWithTheirClassesOwn
         auto directoryUuid = Uuid::parse(PathLastComponent(made->url()));
         ASSERT_TRUE(directoryUuid);
         EXPECT_NE(*directoryUuid, made->uuid());
-        TarnErrorRef readError;
         auto onDisk = TarnMetadata::readAndValidateMetadataAtUrl(
-            made->url(), TarnUserIdentityCache::defaultUserIdentity(), false, &readError);
-        ASSERT_TRUE(onDisk) << (readError ? readError->description() : "");
-        EXPECT_EQ(onDisk->uuid(), made->uuid());
+            made->url(), TarnUserIdentityCache::defaultUserIdentity(), false);
+        ASSERT_TRUE(onDisk.ok()) << (onDisk.error() ? onDisk.error()->description() : "");
+        EXPECT_EQ((*onDisk)->uuid(), made->uuid());
         EXPECT_EQ(directoriesIn(stagingFor(c.containerClass)), 0u);
 
         struct stat top = statOf(made->url());
@@ -209,9 +208,10 @@ TEST_F(TarnCreateOrLookupTest, AnEmptyIdentifierMakesOneContainer) {
     EXPECT_TRUE(SandboxUserState::sharedInstance().userStateItemIsRecordedWithPersona(
         mobile->posixUID(), mobile->kernelPersonaID(), TarnContainerClassSandboxItemType(2), "",
         made->url().c_str()));
-    TarnErrorRef error;
-    EXPECT_TRUE(TarnContainerCache::sharedInstance().removeContainerForUserIdentity(
-        TarnUserIdentityCache::defaultUserIdentity(), 2, "", false, &error));
+    EXPECT_TRUE(TarnContainerCache::sharedInstance()
+                    .removeContainerForUserIdentity(TarnUserIdentityCache::defaultUserIdentity(), 2,
+                                                    "", false)
+                    .ok());
 }
 
 TEST_F(TarnCreateOrLookupTest, ConcurrentCreationsOfOneIdentityMakeOneContainer) {

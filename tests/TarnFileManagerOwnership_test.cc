@@ -62,13 +62,12 @@ protected:
     }
 
     TarnFileManager& fm_ = TarnFileManager::defaultManager();
-    TarnErrorRef error_;
 };
 
 TEST_F(TarnFileManagerOwnershipTest, OwnershipAndModes) {
     TARN_REQUIRE_ROOT();
     makeTree("/c");
-    ASSERT_TRUE(fm_.standardizeOwnershipAtURL(p("/c"), 501, 501, &error_));
+    ASSERT_TRUE(fm_.standardizeOwnershipAtURL(p("/c"), 501, 501).ok());
     for (auto* item : {"/c", "/c/Library", "/c/Library/Prefs", "/c/Library/Prefs/plain", "/c/tool",
                        "/c/Library/escape"}) {
         EXPECT_EQ(501u, lst(item).uid) << item;
@@ -81,14 +80,16 @@ TEST_F(TarnFileManagerOwnershipTest, OwnershipAndModes) {
     EXPECT_EQ(0u, lst("/c/.com.ostrea.tarn_keeper.metadata.plist").uid);
     EXPECT_EQ(0600u, lst("/c/.com.ostrea.tarn_keeper.metadata.plist").mode & 07777);
     expectOutsideUntouched();
-    EXPECT_FALSE(fm_.standardizeOwnershipAtURL(p("/none"), 501, 501, &error_));
+    EXPECT_FALSE(fm_.standardizeOwnershipAtURL(p("/none"), 501, 501).ok());
 }
 
 TEST_F(TarnFileManagerOwnershipTest, SystemContainerACLs) {
     TARN_REQUIRE_ROOT();
     makeTree("/sys");
     stdfs::permissions(p("/sys"), stdfs::perms(0755));
-    ASSERT_TRUE(fm_.standardizeACLsForSystemContainerAtURL(p("/sys"), &error_)) << error_->description();
+    TarnStatus standardized = fm_.standardizeACLsForSystemContainerAtURL(p("/sys"));
+    ASSERT_TRUE(standardized.ok())
+        << (standardized.error() ? standardized.error()->description() : "");
     // The root keeps mode and owner; the group may add items and inherits rwx.
     // (With an ACL the group bits of the mode show the mask.)
     EXPECT_EQ(0705u, lst("/sys").mode & 07707);
@@ -119,41 +120,44 @@ TEST_F(TarnFileManagerOwnershipTest, SystemContainerACLs) {
     expectOutsideUntouched();
     // Outside a system container the root is just another directory.
     makeTree("/plain");
-    ASSERT_TRUE(fm_.standardizeACLsAtURL(p("/plain"), false, &error_));
+    ASSERT_TRUE(fm_.standardizeACLsAtURL(p("/plain"), false).ok());
     EXPECT_EQ(07, acl("/plain").access);
     EXPECT_EQ(kNobody, lst("/plain").uid);
 }
 
 TEST_F(TarnFileManagerOwnershipTest, TopLevelACLAndMissingGroup) {
     root_.mkdirs("/sc");
-    ASSERT_TRUE(fm_.setTopLevelSystemContainerACLAtURL(p("/sc"), &error_));
+    ASSERT_TRUE(fm_.setTopLevelSystemContainerACLAtURL(p("/sc")).ok());
     EXPECT_EQ(03, acl("/sc").access);
     EXPECT_EQ(07, acl("/sc").def);
     // New items below inherit the group's full access.
     root_.writeFile("/sc/new", "n");
     EXPECT_EQ(06, acl("/sc/new").access & 06);
     root_.writeFile("/etc/group", "wheel:x:0:\n");
-    EXPECT_FALSE(fm_.setTopLevelSystemContainerACLAtURL(p("/sc"), &error_));
-    ASSERT_TRUE(error_);
-    EXPECT_EQ(TarnErrorACLFailed, error_->code());
-    EXPECT_FALSE(fm_.standardizeACLsAtURL(p("/sc"), true, &error_));
-    EXPECT_EQ(TarnErrorACLFailed, error_->code());
+    EXPECT_EQ(TarnErrorACLFailed,
+              fm_.setTopLevelSystemContainerACLAtURL(p("/sc")).code(TarnSuccess));
+    EXPECT_EQ(TarnErrorACLFailed, fm_.standardizeACLsAtURL(p("/sc"), true).code(TarnSuccess));
 }
 
 TEST_F(TarnFileManagerOwnershipTest, AllSystemContainers) {
     TARN_REQUIRE_ROOT();
-    EXPECT_TRUE(fm_.standardizeAllSystemContainerACLsAtURL(p("/private/var/containers/System"), &error_));
+    EXPECT_TRUE(
+        fm_.standardizeAllSystemContainerACLsAtURL(p("/private/var/containers/System")).ok());
     root_.mkdirs("/private/var/containers/System");
-    EXPECT_TRUE(fm_.standardizeAllSystemContainerACLsAtURL(p("/private/var/containers/System"), &error_));
+    EXPECT_TRUE(
+        fm_.standardizeAllSystemContainerACLsAtURL(p("/private/var/containers/System")).ok());
     root_.writeFile("/private/var/containers/System/A/f", "x");
     root_.writeFile("/private/var/containers/System/B/g", "x");
-    ASSERT_TRUE(fm_.standardizeAllSystemContainerACLsAtURL(p("/private/var/containers/System"), &error_));
+    ASSERT_TRUE(
+        fm_.standardizeAllSystemContainerACLsAtURL(p("/private/var/containers/System")).ok());
     EXPECT_EQ(03, acl("/private/var/containers/System/A").access);
     EXPECT_EQ(06, acl("/private/var/containers/System/B/g").access);
     // A listing error other than "missing" is the pass's error.
     root_.writeFile("/notadir", "");
-    EXPECT_FALSE(fm_.standardizeAllSystemContainerACLsAtURL(p("/notadir"), &error_));
-    EXPECT_EQ(ENOTDIR, error_->posixCode());
+    TarnStatus notADirectory = fm_.standardizeAllSystemContainerACLsAtURL(p("/notadir"));
+    ASSERT_FALSE(notADirectory.ok());
+    ASSERT_TRUE(notADirectory.error());
+    EXPECT_EQ(ENOTDIR, notADirectory.error()->posixCode());
 }
 
 // A directory in the tree is swapped for a link to /outside while the passes
@@ -178,9 +182,9 @@ TEST_F(TarnFileManagerOwnershipTest, LinkSwappedInDuringWalkIsNotFollowed) {
                 }
             }
         });
-        (void)fm_.standardizeOwnershipAtURL(p("/t"), 501, 501, nullptr);
-        (void)fm_.standardizeACLsAtURL(p("/t"), false, nullptr);
-        (void)fm_.removeItemAtURL(p("/t"), nullptr);
+        (void)fm_.standardizeOwnershipAtURL(p("/t"), 501, 501);
+        (void)fm_.standardizeACLsAtURL(p("/t"), false);
+        (void)fm_.removeItemAtURL(p("/t"));
         stop = true;
         swapper.join();
         ASSERT_TRUE(stdfs::exists(p("/outside/secret")));

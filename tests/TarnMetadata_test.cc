@@ -51,16 +51,20 @@ protected:
     // Reads `dir`, expecting failure with `code`; returns the message.
     std::string expectRejected(const FileURL& dir, uint64_t code,
                                TarnUserIdentityRef expected = nullptr, bool checkClassPath = false) {
-        TarnErrorRef error;
         auto m = TarnMetadata::readAndValidateMetadataAtUrl(dir, expected ? expected : mobile(),
-                                                            checkClassPath, &error);
-        EXPECT_FALSE(m);
+                                                            checkClassPath);
+        EXPECT_FALSE(m.ok());
+        const TarnErrorRef error = m.error();
         if (!error) {
             ADD_FAILURE() << "no error";
             return "";
         }
         EXPECT_EQ(error->code(), code);
         EXPECT_TRUE(error->isTarn());
+        // The error and its line name the step that refused the file, as they
+        // always have: log readers search for these names.
+        EXPECT_EQ(error->functionName(),
+                  code == TarnErrorReadFailed ? "validate" : "validateFields");
         return error->localizedDescription().value_or("");
     }
 };
@@ -68,11 +72,12 @@ protected:
 TEST_F(TarnMetadataTest, WriteThenReadKeepsEveryField) {
     PlistValue info(PlistDict{{kTarnInfoContentProtectionClassKey, PlistValue(uint64_t{3})}});
     auto m = make(2, info);
-    TarnErrorRef error;
-    ASSERT_TRUE(m->writeMetadataToDiskWithError(&error)) << (error ? error->description() : "");
+    TarnStatus written = m->writeMetadataToDiskWithError();
+    ASSERT_TRUE(written.ok()) << (written.error() ? written.error()->description() : "");
 
-    auto read = TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true, &error);
-    ASSERT_TRUE(read) << (error ? error->description() : "");
+    auto readBack = TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true);
+    ASSERT_TRUE(readBack.ok()) << (readBack.error() ? readBack.error()->description() : "");
+    const TarnMetadataRef read = *readBack;
     EXPECT_EQ(read->uuid(), m->uuid());
     EXPECT_EQ(read->identifier(), "com.ostrea.app");
     EXPECT_EQ(read->containerClass(), 2u);
@@ -90,9 +95,9 @@ TEST_F(TarnMetadataTest, WriteThenReadKeepsEveryField) {
 
 TEST_F(TarnMetadataTest, StoredFormAndGlobalClassesWithoutUserIdentity) {
     auto m = make(12);
-    ASSERT_TRUE(m->writeMetadataToDiskWithError(nullptr));
-    auto stored = Tarn_dictionaryWithContentsOfURL(PathJoin(m->url(), kTarnMetadataFileName), 0, nullptr);
-    ASSERT_TRUE(stored);
+    ASSERT_TRUE(m->writeMetadataToDiskWithError().ok());
+    auto stored = Tarn_dictionaryWithContentsOfURL(PathJoin(m->url(), kTarnMetadataFileName), 0);
+    ASSERT_TRUE(stored.ok());
     EXPECT_EQ(stored->find(kTarnMetadataUserIdentityKey), nullptr);
     EXPECT_EQ(stored->find(kTarnMetadataInfoKey), nullptr);
     EXPECT_EQ(*stored->find(kTarnMetadataVersionKey)->asString(), "2");
@@ -109,7 +114,7 @@ TEST_F(TarnMetadataTest, IndependentReaderSeesABinaryPlist) {
         GTEST_SKIP() << "python3 with plistlib not available";
     }
     auto m = make(2, PlistValue(PlistDict{{"k", PlistValue("v")}}));
-    ASSERT_TRUE(m->writeMetadataToDiskWithError(nullptr));
+    ASSERT_TRUE(m->writeMetadataToDiskWithError().ok());
     const FileURL file = PathJoin(m->url(), kTarnMetadataFileName);
     const std::string out = root_.at("/python.txt");
     const std::string cmd =
@@ -183,7 +188,7 @@ TEST_F(TarnMetadataTest, EveryMalformedFieldRejectsTheContainer) {
         if (version) dict.set(kTarnMetadataVersionKey, *version);
         else dict.erase(kTarnMetadataVersionKey);
         writeDict(dir, dict);
-        EXPECT_TRUE(TarnMetadata::readAndValidateMetadataAtUrl(dir, mobile(), true, nullptr));
+        EXPECT_TRUE(TarnMetadata::readAndValidateMetadataAtUrl(dir, mobile(), true).ok());
     }
 }
 
@@ -200,9 +205,9 @@ TEST_F(TarnMetadataTest, AFileTheEntriesReaderDeclinesReadsTheSame) {
         std::vector<uint8_t> bytes = dict.toBinary();
         PlistEntries entries;
         ASSERT_EQ(PlistBinaryRootEntries(bytes.data(), bytes.size(), &entries), !declined);
-        TarnErrorRef error;
-        auto read = TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true, &error);
-        ASSERT_TRUE(read) << (error ? error->description() : "");
+        auto readBack = TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true);
+        ASSERT_TRUE(readBack.ok()) << (readBack.error() ? readBack.error()->description() : "");
+        const TarnMetadataRef read = *readBack;
         EXPECT_EQ(read->identifier(), m->identifier());
         EXPECT_EQ(read->uuid(), m->uuid());
         EXPECT_EQ(read->info(), info);
@@ -217,10 +222,10 @@ TEST_F(TarnMetadataTest, OldFormatWithoutUserIdentity) {
     dict.erase(kTarnMetadataUserIdentityKey);
     dict.set(kTarnMetadataPersonaKey, PlistValue(uint64_t{501}));
     writeDict(m->url(), dict);
-    auto read = TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true, nullptr);
-    ASSERT_TRUE(read);
-    EXPECT_EQ(read->userIdentity()->posixUID(), 501u);
-    EXPECT_EQ(read->userIdentity()->personaType(), TarnPersonaTypePersonal);
+    auto read = TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true);
+    ASSERT_TRUE(read.ok());
+    EXPECT_EQ((*read)->userIdentity()->posixUID(), 501u);
+    EXPECT_EQ((*read)->userIdentity()->personaType(), TarnPersonaTypePersonal);
 
     auto other = TarnUserIdentity::initWithUID(502, 502, root_.at("/private/var/u502"), std::nullopt,
                                                0, 502);
@@ -231,18 +236,18 @@ TEST_F(TarnMetadataTest, OldFormatWithoutUserIdentity) {
     dict.set(kTarnMetadataPersonaKey, PlistValue(501.0));
     dict.set(kTarnMetadataContentClassKey, PlistValue(2.0));
     writeDict(m->url(), dict);
-    EXPECT_TRUE(TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true, nullptr));
+    EXPECT_TRUE(TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true).ok());
     dict.set(kTarnMetadataContentClassKey, PlistValue(uint64_t{2}));
 
     // Without either key the expected user is assumed.
     dict.erase(kTarnMetadataPersonaKey);
     writeDict(m->url(), dict);
-    EXPECT_TRUE(TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true, nullptr));
+    EXPECT_TRUE(TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true).ok());
 }
 
 TEST_F(TarnMetadataTest, StoredIdentityMustMatchTheExpectedOne) {
     auto m = make(2);
-    ASSERT_TRUE(m->writeMetadataToDiskWithError(nullptr));
+    ASSERT_TRUE(m->writeMetadataToDiskWithError().ok());
     // Same uid, different identity: an enterprise persona of the same user.
     auto enterprise = TarnUserIdentity::initWithUID(501, 501, root_.at("/private/var/ent"), "E-1",
                                                     TarnPersonaTypeEnterprise, 77);
@@ -258,29 +263,31 @@ TEST_F(TarnMetadataTest, ClassPathMustMatchTheClassDirectory) {
     // A bundle container found below the user's Data/Application.
     FileURL misplaced = containerDir(2, uuid);
     auto m = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, misplaced, std::nullopt);
-    ASSERT_TRUE(m->writeMetadataToDiskWithError(nullptr));
+    ASSERT_TRUE(m->writeMetadataToDiskWithError().ok());
     std::string message = expectRejected(misplaced, TarnErrorInvalidMetadata, nullptr, true);
     EXPECT_NE(message.find("Invalid metadata-URLs should match"), std::string::npos) << message;
-    EXPECT_TRUE(TarnMetadata::readAndValidateMetadataAtUrl(misplaced, mobile(), false, nullptr));
+    EXPECT_TRUE(TarnMetadata::readAndValidateMetadataAtUrl(misplaced, mobile(), false).ok());
 
     FileURL proper = containerDir(1, uuid);
     auto placed = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, proper, std::nullopt);
-    ASSERT_TRUE(placed->writeMetadataToDiskWithError(nullptr));
-    EXPECT_TRUE(TarnMetadata::readAndValidateMetadataAtUrl(proper, mobile(), true, nullptr));
+    ASSERT_TRUE(placed->writeMetadataToDiskWithError().ok());
+    EXPECT_TRUE(TarnMetadata::readAndValidateMetadataAtUrl(proper, mobile(), true).ok());
 }
 
 TEST_F(TarnMetadataTest, TheClassDirectoryReaderAnswersAsThePathReader) {
     auto m = make(2, PlistValue(PlistDict{{kTarnInfoContentProtectionClassKey, PlistValue(3)}}));
-    ASSERT_TRUE(m->writeMetadataToDiskWithError(nullptr));
+    ASSERT_TRUE(m->writeMetadataToDiskWithError().ok());
     const FileURL classDirectory = PathParent(m->url());
     FsFd directory;
     ASSERT_EQ(TarnFileManager::defaultManager().openDirectoryAtURL(classDirectory, &directory), 0);
 
-    auto byPath = TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true, nullptr);
-    auto byDirectory = TarnMetadata::readAndValidateMetadataInClassDirectory(
-        directory, m->url(), mobile(), true, nullptr);
-    ASSERT_TRUE(byPath);
-    ASSERT_TRUE(byDirectory);
+    auto pathRead = TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true);
+    auto directoryRead =
+        TarnMetadata::readAndValidateMetadataInClassDirectory(directory, m->url(), mobile(), true);
+    ASSERT_TRUE(pathRead.ok());
+    ASSERT_TRUE(directoryRead.ok());
+    const TarnMetadataRef byPath = *pathRead;
+    const TarnMetadataRef byDirectory = *directoryRead;
     EXPECT_EQ(byDirectory->url(), byPath->url());
     EXPECT_EQ(byDirectory->uuid(), byPath->uuid());
     EXPECT_EQ(byDirectory->identifier(), byPath->identifier());
@@ -292,14 +299,21 @@ TEST_F(TarnMetadataTest, TheClassDirectoryReaderAnswersAsThePathReader) {
     // What stands in place of the file is refused, never waited on.
     const FileURL file = PathJoin(m->url(), kTarnMetadataFileName);
     auto expectUnreadable = [&](const char* what) {
-        TarnErrorRef error;
-        EXPECT_FALSE(TarnMetadata::readAndValidateMetadataInClassDirectory(directory, m->url(),
-                                                                           mobile(), true, &error))
-            << what;
-        ASSERT_TRUE(error) << what;
-        EXPECT_EQ(error->code(), TarnErrorReadFailed) << what;
-        EXPECT_FALSE(TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true, nullptr))
+        auto read = TarnMetadata::readAndValidateMetadataInClassDirectory(directory, m->url(),
+                                                                          mobile(), true);
+        EXPECT_FALSE(read.ok()) << what;
+        ASSERT_TRUE(read.error()) << what;
+        EXPECT_EQ(read.error()->code(), TarnErrorReadFailed) << what;
+        EXPECT_FALSE(TarnMetadata::readAndValidateMetadataAtUrl(m->url(), mobile(), true).ok())
             << what << ": the path reader agrees";
+        // Asked to stay quiet (as a rebuild does), both fail without an error value.
+        for (auto quiet : {TarnMetadata::readAndValidateMetadataInClassDirectory(
+                               directory, m->url(), mobile(), true, TarnMetadataUnreadable::kQuiet),
+                           TarnMetadata::readAndValidateMetadataAtUrl(
+                               m->url(), mobile(), true, TarnMetadataUnreadable::kQuiet)}) {
+            EXPECT_FALSE(quiet.ok()) << what;
+            EXPECT_FALSE(quiet.error()) << what;
+        }
     };
     const FileURL kept = PathJoin(classDirectory, "kept.plist");
     std::filesystem::rename(file, kept);
@@ -321,27 +335,27 @@ TEST_F(TarnMetadataTest, TheClassDirectoryReaderAnswersAsThePathReader) {
     std::filesystem::rename(kept, file);
     auto big = m->copy();
     big->setInfo(PlistValue(PlistDict{{"Padding", PlistValue(std::string(100000, 'p'))}}));
-    ASSERT_TRUE(big->writeMetadataToDiskWithError(nullptr));
-    auto read = TarnMetadata::readAndValidateMetadataInClassDirectory(directory, m->url(), mobile(),
-                                                                      true, nullptr);
-    ASSERT_TRUE(read);
-    EXPECT_EQ(read->info(), big->info());
+    ASSERT_TRUE(big->writeMetadataToDiskWithError().ok());
+    auto read =
+        TarnMetadata::readAndValidateMetadataInClassDirectory(directory, m->url(), mobile(), true);
+    ASSERT_TRUE(read.ok());
+    EXPECT_EQ((*read)->info(), big->info());
 }
 
 TEST_F(TarnMetadataTest, FailedWriteKeepsTheOldFile) {
     auto m = make(2);
-    ASSERT_TRUE(m->writeMetadataToDiskWithError(nullptr));
-    auto before = Tarn_dictionaryWithContentsOfURL(PathJoin(m->url(), kTarnMetadataFileName), 0, nullptr);
+    ASSERT_TRUE(m->writeMetadataToDiskWithError().ok());
+    auto before = Tarn_dictionaryWithContentsOfURL(PathJoin(m->url(), kTarnMetadataFileName), 0);
+    ASSERT_TRUE(before.ok());
     // The container directory vanished: the move fails, nothing partial appears.
     auto gone = m->copy();
     gone->setUrl(PathJoin(m->url(), "missing/dir"));
     gone->setUserManagedAssetsDirName("Other");
-    TarnErrorRef error;
-    EXPECT_FALSE(gone->writeMetadataToDiskWithError(&error));
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->code(), TarnErrorWriteFailed);
-    auto after = Tarn_dictionaryWithContentsOfURL(PathJoin(m->url(), kTarnMetadataFileName), 0, nullptr);
-    EXPECT_EQ(before, after);
+    EXPECT_EQ(gone->writeMetadataToDiskWithError().code(TarnSuccess),
+              uint64_t{TarnErrorWriteFailed});
+    auto after = Tarn_dictionaryWithContentsOfURL(PathJoin(m->url(), kTarnMetadataFileName), 0);
+    ASSERT_TRUE(after.ok());
+    EXPECT_EQ(*before, *after);
     auto staging = TarnGlobalConfiguration::sharedInstance().stagingDirectoryURLForUserIdentity(mobile(), 2);
     EXPECT_TRUE(std::filesystem::is_empty(staging)) << "the temporary file is cleaned up";
 }

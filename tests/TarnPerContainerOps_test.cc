@@ -93,11 +93,11 @@ class TarnPerContainerOpsTest : public test::ScratchRootTest {
             TarnConcreteContainerIdentity::containerIdentityWithUUID(uuid, mobile(), identifier, c)
                 .value();
         auto m = TarnMetadata::initWithContainerIdentity(identity, std::nullopt, dir, std::nullopt);
-        TarnErrorRef error;
-        EXPECT_TRUE(m->writeMetadataToDiskWithError(&error)) << (error ? error->description() : "");
-        EXPECT_TRUE(
-            TarnContainerCache::sharedInstance().addContainerMetadata(m, dir, false, true, &error))
-            << (error ? error->description() : "");
+        TarnStatus written = m->writeMetadataToDiskWithError();
+        EXPECT_TRUE(written.ok()) << (written.error() ? written.error()->description() : "");
+        TarnStatus added = TarnContainerCache::sharedInstance().addContainerMetadata(
+            m, dir, /*transient=*/false, /*updateSandbox=*/true);
+        EXPECT_TRUE(added.ok()) << (added.error() ? added.error()->description() : "");
         return identity;
     }
 
@@ -114,10 +114,9 @@ class TarnPerContainerOpsTest : public test::ScratchRootTest {
 
     // The info dictionary as the metadata file holds it.
     std::optional<PlistValue> infoOnDisk(const FileURL& url) {
-        TarnErrorRef error;
-        auto m = TarnMetadata::readAndValidateMetadataAtUrl(url, mobile(), false, &error);
-        EXPECT_TRUE(m) << (error ? error->description() : "");
-        return m ? m->info() : std::nullopt;
+        auto m = TarnMetadata::readAndValidateMetadataAtUrl(url, mobile(), false);
+        EXPECT_TRUE(m.ok()) << (m.error() ? m.error()->description() : "");
+        return m.ok() ? (*m)->info() : std::nullopt;
     }
     // One value of it; empty when the file or the key is missing.
     std::optional<PlistValue> infoValueOnDisk(const FileURL& url, const char* key) {
@@ -366,10 +365,9 @@ TEST_F(TarnPerContainerOpsTest, RegeneratingRenamesTheDirectoryButKeepsTheUUID) 
     EXPECT_TRUE(Uuid::parse(PathLastComponent(after)));
     EXPECT_NE(*Uuid::parse(PathLastComponent(after)), app->uuid());
     EXPECT_FALSE(fs::exists(before));
-    TarnErrorRef readError;
-    auto onDisk = TarnMetadata::readAndValidateMetadataAtUrl(after, mobile(), false, &readError);
-    ASSERT_TRUE(onDisk);
-    EXPECT_EQ(onDisk->uuid(), app->uuid()) << "only the directory name changes";
+    auto onDisk = TarnMetadata::readAndValidateMetadataAtUrl(after, mobile(), false);
+    ASSERT_TRUE(onDisk.ok());
+    EXPECT_EQ((*onDisk)->uuid(), app->uuid()) << "only the directory name changes";
     EXPECT_EQ(connection_.infoValueForKey(key("k"), app, true, &error), PlistValue("kept"));
 
     // A rename that fails leaves the container where it was.
