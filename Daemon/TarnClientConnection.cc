@@ -9,11 +9,11 @@
 #include "Daemon/TarnDaemon.h"
 #include "Daemon/TarnDataProtectionManager.h"
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnExceptionFence.h"
 #include "Daemon/TarnFileManager.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnLocks.h"
 #include "Daemon/TarnLog.h"
-#include "Daemon/TarnRequestProcessor.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Daemon/TarnWhitelist.h"
 #include "Platform/ContainerLibrary.h"
@@ -127,56 +127,46 @@ bool TarnClientConnection::_lookupRuleCommon(TarnContainerClass containerClass,
         bundleIdentifier, containerClass, identifier);
 }
 
-bool TarnClientConnection::_passesLookupRuleForContainerClass(TarnContainerClass containerClass,
-                                                              const std::string& identifier,
-                                                              TarnErrorRef* error) {
-    if (_lookupRuleCommon(containerClass, identifier, true)) return true;
-    if (error)
-        *error =
-            TARN_ERROR(TarnErrorNotEntitled, nullptr,
-                       "%@ not entitled to retrieve container class %ld with identifier %@",
-                       clientBundleIdentifier(), static_cast<int64_t>(containerClass), identifier);
-    return false;
+TarnStatus TarnClientConnection::_passesLookupRuleForContainerClass(
+    TarnContainerClass containerClass, const std::string& identifier) {
+    if (_lookupRuleCommon(containerClass, identifier, /*withGroupRule=*/true)) return {};
+    return TARN_ERROR(TarnErrorNotEntitled, nullptr,
+                      "%@ not entitled to retrieve container class %ld with identifier %@",
+                      clientBundleIdentifier(), static_cast<int64_t>(containerClass), identifier);
 }
 
-bool TarnClientConnection::_passesSystemDataGateForContainerClass(TarnContainerClass containerClass,
-                                                                  const std::string& identifier,
-                                                                  TarnErrorRef* error) {
+TarnStatus TarnClientConnection::_passesSystemDataGateForContainerClass(
+    TarnContainerClass containerClass, const std::string& identifier) {
     if (allowOtherIdLookup_ || containerClass != TarnContainerClassSystemData || unrestricted_ ||
         isEntitledForLookupWithClass(TarnContainerClassSystemData, identifier))
-        return true;
+        return {};
     const std::string bundleIdentifier = clientBundleIdentifier();
     if (TarnWhitelist::sharedWhitelist().isLookupWhitelistedFromCodeSignIdentifier(
             bundleIdentifier, TarnContainerClassSystemData, identifier))
-        return true;
+        return {};
     // Only a client whose signature asks for a system container gets its own.
     TarnCodeSigningMapping* mapping = TarnCodeSigningMapping::sharedInstance();
     if (mapping && identifier == bundleIdentifier &&
         mapping->identifierHasSystemContainer(identifier))
-        return true;
-    if (error)
-        *error = TARN_ERROR(TarnErrorNotEntitled, nullptr,
-                            "%@ not entitled for system container with identifier %@",
-                            bundleIdentifier, identifier);
-    return false;
+        return {};
+    return TARN_ERROR(TarnErrorNotEntitled, nullptr,
+                      "%@ not entitled for system container with identifier %@", bundleIdentifier,
+                      identifier);
 }
 
-bool TarnClientConnection::_passesGroupOwnerRuleForContainerClass(
-    TarnContainerClass groupContainerClass, const std::string& ownerIdentifier,
-    TarnErrorRef* error) {
-    if (_lookupRuleCommon(groupContainerClass, ownerIdentifier, false)) return true;
-    if (error)
-        *error = TARN_ERROR(
-            TarnErrorNotEntitled, nullptr,
-            "%@ not entitled to retrieve group container class %ld with identifier %@",
-            clientBundleIdentifier(), static_cast<int64_t>(groupContainerClass), ownerIdentifier);
-    return false;
+TarnStatus TarnClientConnection::_passesGroupOwnerRuleForContainerClass(
+    TarnContainerClass groupContainerClass, const std::string& ownerIdentifier) {
+    if (_lookupRuleCommon(groupContainerClass, ownerIdentifier, /*withGroupRule=*/false)) return {};
+    return TARN_ERROR(TarnErrorNotEntitled, nullptr,
+                      "%@ not entitled to retrieve group container class %ld with identifier %@",
+                      clientBundleIdentifier(), static_cast<int64_t>(groupContainerClass),
+                      ownerIdentifier);
 }
 
 // ---- Death row ----
 
-bool TarnClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, bool isDir,
-                                                    bool startDeletionThread, TarnErrorRef* error) {
+TarnStatus TarnClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, bool isDir,
+                                                          bool startDeletionThread) {
     auto& fm = TarnFileManager::defaultManager();
     // A deletion pass running meanwhile may remove the still empty slot before
     // the rename lands; the item is then still here and needs a new slot.
@@ -186,26 +176,22 @@ bool TarnClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, bool isD
         auto unique = fm.createTemporaryDirectoryInDirectoryURL(
             TarnGlobalConfiguration::sharedInstance().deathrowDirectory());
         if (!unique.ok()) {
-            if (error)
-                *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, unique.error(),
-                                    "Failed to create unique directory at: %@", url);
-            return false;
+            return TARN_ERROR(TarnErrorDeathRowMoveFailed, unique.error(),
+                              "Failed to create unique directory at: %@", url);
         }
         const FileURL destination = PathJoin(*unique, PathLastComponent(url));
         const TarnStatus moved = fm.moveItemAtURL(url, destination);
         if (moved.ok()) break;
         if (moved.error() && moved.error()->posixCode() == ENOENT) {
             // Already gone; the empty slot goes with the next pass.
-            if (fm.itemDoesNotExistAtURL(url)) return true;
+            if (fm.itemDoesNotExistAtURL(url)) return {};
             if (attempt < kAttempts) continue;
         }
-        if (error)
-            *error = TARN_ERROR(TarnErrorDeathRowMoveFailed, moved.error(),
-                                "Failed to move item at: %@ to: %@", url, destination);
-        return false;
+        return TARN_ERROR(TarnErrorDeathRowMoveFailed, moved.error(),
+                          "Failed to move item at: %@ to: %@", url, destination);
     }
     if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
-    return true;
+    return {};
 }
 
 void TarnClientConnection::deleteContainersOnDeathRowWithCompletion(
@@ -213,41 +199,34 @@ void TarnClientConnection::deleteContainersOnDeathRowWithCompletion(
     // The pass owns nothing of the connection, which may be gone when it runs.
     transactionAsync(TarnDeathRowQueue(), [completion = std::move(completion)] {
         static constexpr const char* kOperation = "deleteContainersOnDeathRowWithCompletion";
-        uint64_t result = TarnSuccess;
-        try {
+        // A queue item: nothing it throws may end the daemon.
+        const TarnStatus pass = TarnFenceExceptions(kOperation, [&]() -> TarnStatus {
             const FileURL deathRow = TarnGlobalConfiguration::sharedInstance().deathrowDirectory();
             auto items = TarnFileManager::defaultManager().urlsForItemsInDirectoryAtURL(deathRow);
             if (!items.ok()) {
                 const TarnErrorRef listError = items.error();
-                if (!(listError && listError->posixCode() == ENOENT)) {
-                    TarnErrorRef e = TARN_ERROR_IN(kOperation, TarnErrorDeleteFailed, listError,
-                                                   "Failed to get items for deletion: %@ : %@",
-                                                   deathRow, listError);
-                    result = e->code();
-                }
-            } else {
-                for (const FileURL& item : *items) {
-                    TarnErrorRef removeError;
-                    if (!_removeItemOrMoveToTempAtURL(item, &removeError)) {
-                        TarnErrorRef e = TARN_ERROR_IN(kOperation, TarnErrorDestroyFailed, removeError,
-                                                       "Failed to destroy item at: %@", item);
-                        result = e->code();
-                    }
-                }
+                if (listError && listError->posixCode() == ENOENT) return {};
+                return TARN_ERROR_IN(kOperation, TarnErrorDeleteFailed, listError,
+                                     "Failed to get items for deletion: %@ : %@", deathRow,
+                                     listError);
             }
-        } catch (const std::exception& e) {
-            result = TarnHandleCaughtException(kOperation, &e);
-        } catch (...) {
-            result = TarnHandleCaughtException(kOperation, nullptr);
-        }
-        if (completion) completion(result);
+            // Every item is tried; the pass answers its last failure.
+            TarnStatus last;
+            for (const FileURL& item : *items) {
+                if (const TarnStatus removed = _removeItemOrMoveToTempAtURL(item); !removed.ok())
+                    last = TARN_ERROR_IN(kOperation, TarnErrorDestroyFailed, removed.error(),
+                                         "Failed to destroy item at: %@", item);
+            }
+            return last;
+        });
+        if (completion) completion(pass.code(TarnErrorDeleteFailed));
     });
 }
 
-bool TarnClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& url, TarnErrorRef* error) {
+TarnStatus TarnClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& url) {
     auto& fm = TarnFileManager::defaultManager();
     const TarnStatus removed = fm.removeItemAtURL(url);
-    if (removed.ok() || (removed.error() && removed.error()->posixCode() == ENOENT)) return true;
+    if (removed.ok() || (removed.error() && removed.error()->posixCode() == ENOENT)) return {};
     TarnLog(kLogDebug, __func__, "Couldn't remove, so moving item to /tmp: %@ : %@", url,
             removed.error());
 
@@ -267,13 +246,11 @@ bool TarnClientConnection::_removeItemOrMoveToTempAtURL(const FileURL& url, Tarn
         const TarnErrorRef& moveError = renamed.error();
         // Gone meanwhile is done; a missing /tmp is not.
         if (moveError && moveError->posixCode() == ENOENT && fm.itemDoesNotExistAtURL(url))
-            return true;
-        if (error)
-            *error = TARN_ERROR(TarnErrorMoveFailed, moveError, "Failed to move dir: %@ to: %@",
-                                url, "/tmp");
-        return false;
+            return {};
+        return TARN_ERROR(TarnErrorMoveFailed, moveError, "Failed to move dir: %@ to: %@", url,
+                          "/tmp");
     }
-    return true;
+    return {};
 }
 
 TarnClientConnection& TarnClientConnection::sharedClientConnection() {
@@ -304,33 +281,26 @@ mode_t subdirectoryModeForClass(TarnContainerClass c) {
 
 }  // namespace
 
-bool TarnClientConnection::_createTopLevelContainerDirectory(const FileURL& url,
-                                                             TarnContainerClass containerClass,
-                                                             uint32_t owner, TarnErrorRef* error) {
+TarnStatus TarnClientConnection::_createTopLevelContainerDirectory(
+    const FileURL& url, TarnContainerClass containerClass, uint32_t owner) {
     // System containers keep the daemon as owner (0 leaves it alone); bundles
     // always go to the installer.
     uint32_t topLevelOwner = owner;
     if (TarnContainerClassIsBundle(containerClass)) topLevelOwner = CONTAINER_INSTALLATION_UID;
     if (TarnContainerClassIsSystem(containerClass)) topLevelOwner = 0;
-    const TarnStatus created = TarnFileManager::defaultManager().createDirectoryAtURL(
+    return TarnFileManager::defaultManager().createDirectoryAtURL(
         url, /*withIntermediateDirectories=*/true, 0755, topLevelOwner,
         kTarnDataProtectionClassNone);
-    if (!created.ok() && error) *error = created.error();
-    return created.ok();
 }
 
-bool TarnClientConnection::_createSubDirectories(const FileURL& url,
-                                                 const TarnMetadataRef& containerMetadata,
-                                                 TarnErrorRef* error) {
+TarnStatus TarnClientConnection::_createSubDirectories(const FileURL& url,
+                                                       const TarnMetadataRef& containerMetadata) {
     const TarnContainerClass containerClass = containerMetadata->containerClass();
     std::vector<std::string> names;
     uint64_t libraryCode = kContainerLibraryErrorNoSubdirectories;
     if (!ContainerLibrarySubdirectoriesForClass(containerClass, &names, &libraryCode)) {
-        TarnErrorRef e =
-            TARN_ERROR(libraryCode, nullptr, "Failed to get subdirectory names for %llu : %llu",
-                       containerClass, libraryCode);
-        if (error) *error = e;
-        return false;
+        return TARN_ERROR(libraryCode, nullptr, "Failed to get subdirectory names for %llu : %llu",
+                          containerClass, libraryCode);
     }
 
     const int32_t protectionClass = _dataProtectionClassForContainerMetadata(containerMetadata);
@@ -352,15 +322,12 @@ bool TarnClientConnection::_createSubDirectories(const FileURL& url,
                 subdirectory, /*withIntermediateDirectories=*/true, mode, owner,
                 static_cast<TarnDataProtectionClass>(subdirectoryClass));
             !created.ok()) {
-            TarnErrorRef e =
-                TARN_ERROR(TarnErrorCreateDirectoryFailed, created.error(),
-                           "Failed to create sub-dir for %@ at %@ (protClass: %d)",
-                           containerMetadata->identifier(), subdirectory, subdirectoryClass);
-            if (error) *error = e;
-            return false;
+            return TARN_ERROR(TarnErrorCreateDirectoryFailed, created.error(),
+                              "Failed to create sub-dir for %@ at %@ (protClass: %d)",
+                              containerMetadata->identifier(), subdirectory, subdirectoryClass);
         }
     }
-    return true;
+    return {};
 }
 
 int TarnClientConnection::_dataProtectionClassForContainerMetadata(
@@ -384,32 +351,6 @@ int TarnClientConnection::_dataProtectionClassForContainerMetadata(
 
 namespace {
 
-// Holds one global identifier lock (read or write) until released or destroyed,
-// so that no return path or exception leaves it taken.
-class GlobalLockHolder {
-  public:
-    GlobalLockHolder() = default;
-    ~GlobalLockHolder() { release(); }
-    GlobalLockHolder(const GlobalLockHolder&) = delete;
-    GlobalLockHolder& operator=(const GlobalLockHolder&) = delete;
-
-    void readLock() {
-        gTarnLocks.read_lock_all_identifiers();
-        held_ = true;
-    }
-    void writeLock() {
-        gTarnLocks.write_lock_all_identifiers();
-        held_ = true;
-    }
-    void release() {
-        if (held_) gTarnLocks.unlock_all_identifiers();
-        held_ = false;
-    }
-
-  private:
-    bool held_ = false;
-};
-
 bool isNotFound(const TarnErrorRef& e) {
     return e && e->isTarn() && e->code() == TarnErrorNotFound;
 }
@@ -431,9 +372,9 @@ std::string liveDirectoryName(const std::string& identifier, TarnContainerClass 
 // The operation these helpers do the work of: their errors and lines carry its name.
 constexpr const char* kCreateOrLookup = "createOrLookupContainerWithContainerIdentity";
 
-TarnMetadataRef createContainer(TarnClientConnection& connection,
-                                const TarnContainerIdentityRef& identity, bool transient,
-                                TarnErrorRef* error) {
+TarnResult<TarnMetadataRef> createContainer(TarnClientConnection& connection,
+                                            const TarnContainerIdentityRef& identity,
+                                            bool transient) {
     const std::string& identifier = identity->identifier();
     const TarnContainerClass containerClass = identity->containerClass();
     const TarnUserIdentityRef& userIdentity = identity->userIdentity();
@@ -451,46 +392,37 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
         configuration.stagingDirectoryURLForUserIdentity(userIdentity, containerClass);
     // An identity without a home has no staging directory: nothing is built.
     const FileURL stagingURL = stagingParent.empty() ? FileURL() : PathJoin(stagingParent, directoryName);
-    TarnErrorRef underlying;
-    if (stagingURL.empty() || !connection._createTopLevelContainerDirectory(
-            stagingURL, containerClass, userIdentity->posixUIDForContainerClass(containerClass),
-            &underlying)) {
-        *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorCreateStagingFailed, underlying,
-                            "Failed to create staging dir at %@ : %@", stagingURL, underlying);
-        return nullptr;
+    // No staging directory fails with no underlying error.
+    const TarnStatus staged = stagingURL.empty()
+                                  ? TarnStatus(TarnErrorRef())
+                                  : connection._createTopLevelContainerDirectory(
+                                        stagingURL, containerClass,
+                                        userIdentity->posixUIDForContainerClass(containerClass));
+    if (!staged.ok()) {
+        return TARN_ERROR_IN(kCreateOrLookup, TarnErrorCreateStagingFailed, staged.error(),
+                             "Failed to create staging dir at %@ : %@", stagingURL, staged.error());
     }
 
     // From here on a failure leaves a staging directory that must go to death row.
-    TarnErrorRef failure;
     TarnMutableMetadataRef metadata;
     FileURL liveURL;
-    [&] {
+    const TarnStatus built = [&]() -> TarnStatus {
         // The metadata's UUID is independent of the directory's name, so that
         // neither can be derived from the other.
         TarnResult<TarnConcreteContainerIdentityRef> made =
             TarnConcreteContainerIdentity::containerIdentityWithUUID(Uuid::generate(), userIdentity,
                                                                      identifier, containerClass);
-        if (!made.ok()) {
-            failure =
-                TARN_ERROR_CODE_IN(kCreateOrLookup, made.code(TarnErrorInvalidArgument), nullptr);
-            return;
-        }
+        if (!made.ok())
+            return TARN_ERROR_CODE_IN(kCreateOrLookup, made.code(TarnErrorInvalidArgument),
+                                      nullptr);
         TarnConcreteContainerIdentityRef concrete = std::move(*made);
         metadata = TarnMetadata::initWithContainerIdentity(concrete, std::nullopt, stagingURL,
                                                            std::nullopt);
         metadata->setTransient(transient);
-        if (const TarnStatus written = metadata->writeMetadataToDiskWithError(); !written.ok()) {
-            failure = written.error();
-            return;
-        }
-        if (TarnContainerClassIsSystem(containerClass)) {
-            if (const TarnStatus acl = fm.setTopLevelSystemContainerACLAtURL(stagingURL);
-                !acl.ok()) {
-                failure = acl.error();
-                return;
-            }
-        }
-        if (!connection._createSubDirectories(stagingURL, metadata, &failure)) return;
+        TARN_TRY(metadata->writeMetadataToDiskWithError());
+        if (TarnContainerClassIsSystem(containerClass))
+            TARN_TRY(fm.setTopLevelSystemContainerACLAtURL(stagingURL));
+        TARN_TRY(connection._createSubDirectories(stagingURL, metadata));
 
         std::optional<FileURL> liveParent = configuration.containerDirectoryURLForUserIdentity(
             userIdentity, containerClass, transient);
@@ -500,18 +432,19 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
         const TarnStatus moved =
             liveParent ? fm.moveItemAtURL(stagingURL, liveURL) : TarnStatus(TarnErrorRef());
         if (!moved.ok())
-            failure = TARN_ERROR_IN(kCreateOrLookup, TarnErrorMoveStagingFailed, moved.error(),
-                                    "Failed to move staging dir: %@ to live dir: %@", stagingURL,
-                                    liveURL);
+            return TARN_ERROR_IN(kCreateOrLookup, TarnErrorMoveStagingFailed, moved.error(),
+                                 "Failed to move staging dir: %@ to live dir: %@", stagingURL,
+                                 liveURL);
+        return {};
     }();
 
-    if (failure) {
-        TarnErrorRef cleanupError;
-        if (!connection._moveItemAtURLToDeathRow(stagingURL, true, true, &cleanupError))
-            failure = TARN_ERROR_IN(kCreateOrLookup, TarnErrorRemoveStagingFailed, cleanupError,
+    if (!built.ok()) {
+        const TarnStatus cleaned = connection._moveItemAtURLToDeathRow(
+            stagingURL, /*isDir=*/true, /*startDeletionThread=*/true);
+        if (!cleaned.ok())
+            return TARN_ERROR_IN(kCreateOrLookup, TarnErrorRemoveStagingFailed, cleaned.error(),
                                  "Failed to remove staging dir: %@", stagingURL);
-        *error = failure;
-        return nullptr;
+        return built.error();
     }
 
     if (HostConfiguration::shared().featureEnabled("fast_container_sizing"))
@@ -522,12 +455,11 @@ TarnMetadataRef createContainer(TarnClientConnection& connection,
     if (const TarnStatus added = TarnContainerCache::sharedInstance().addContainerMetadata(
             metadata, liveURL, transient, /*updateSandbox=*/true);
         !added.ok()) {
-        *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorCacheAddFailed, added.error(),
-                               "Failed to add to cache : %@, url: %@, transient: %d",
-                               metadata->description(), liveURL, transient);
-        return nullptr;
+        return TARN_ERROR_IN(kCreateOrLookup, TarnErrorCacheAddFailed, added.error(),
+                             "Failed to add to cache : %@, url: %@, transient: %d",
+                             metadata->description(), liveURL, transient);
     }
-    return metadata;
+    return TarnMetadataRef(std::move(metadata));
 }
 
 // Copies a cached record and marks it as found.
@@ -537,25 +469,23 @@ TarnMetadataRef foundContainer(const TarnMetadataRef& cached) {
     return found;
 }
 
-TarnMetadataRef createOrLookup(TarnClientConnection& connection,
-                               const TarnContainerIdentityRef& identity, bool createIfNecessary,
-                               bool transient, bool useLocking, GlobalLockHolder& globalLock,
-                               TarnErrorRef* error) {
+TarnResult<TarnMetadataRef> createOrLookup(TarnClientConnection& connection,
+                                           const TarnContainerIdentityRef& identity,
+                                           bool createIfNecessary, bool transient, bool useLocking,
+                                           TarnGlobalLockHolder& globalLock) {
     PlatformLog("unspecified", PlatformLogType::Debug,
                 "createOrLookup; identity: %@, createIfNecessary: %d, transient: %d, "
                 "allowOtherIdLookup: %d, unrestricted: %d, clientBundleIdentifier: %@",
                 identity, createIfNecessary, transient, connection.allowOtherIdLookup(),
                 connection.unrestricted(), connection.clientBundleIdentifier());
     if (!identity) {
-        *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorBadInput, nullptr,
-                               "Cannot lookup a nil container identity.");
-        return nullptr;
+        return TARN_ERROR_IN(kCreateOrLookup, TarnErrorBadInput, nullptr,
+                             "Cannot lookup a nil container identity.");
     }
     const std::string& identifier = identity->identifier();
     const TarnContainerClass containerClass = identity->containerClass();
-    if (!connection._passesLookupRuleForContainerClass(containerClass, identifier, error) ||
-        !connection._passesSystemDataGateForContainerClass(containerClass, identifier, error))
-        return nullptr;
+    TARN_TRY(connection._passesLookupRuleForContainerClass(containerClass, identifier));
+    TARN_TRY(connection._passesSystemDataGateForContainerClass(containerClass, identifier));
 
     auto& cache = TarnContainerCache::sharedInstance();
     const bool allowKernelLookup =
@@ -566,16 +496,12 @@ TarnMetadataRef createOrLookup(TarnClientConnection& connection,
             identity, /*transient=*/false, /*updateSandbox=*/true, allowKernelLookup);
         globalLock.release();
         if (cached.ok()) return foundContainer(*cached);
-        if (!isNotFound(cached.error())) {
-            *error = cached.error();
-            return nullptr;
-        }
+        if (!isNotFound(cached.error())) return cached.error();
     }
 
     if (!createIfNecessary) {
-        *error = TARN_ERROR_SILENT_IN(kCreateOrLookup, TarnErrorNotFound, nullptr,
-                                   "Container with identifier: \"%@\" Not Found", identifier);
-        return nullptr;
+        return TARN_ERROR_SILENT_IN(kCreateOrLookup, TarnErrorNotFound, nullptr,
+                                    "Container with identifier: \"%@\" Not Found", identifier);
     }
 
     // Look again under the write lock: another request may have created it
@@ -587,122 +513,68 @@ TarnMetadataRef createOrLookup(TarnClientConnection& connection,
     if (cached.ok()) {
         // A transient container is made anew on every request.
         const FileURL& cachedURL = (*cached)->url();
-        TarnErrorRef moveError;
-        if (!connection._moveItemAtURLToDeathRow(cachedURL, /*isDir=*/true,
-                                                 /*startDeletionThread=*/true, &moveError)) {
-            *error = TARN_ERROR_IN(kCreateOrLookup, TarnErrorRemoveTransientFailed, moveError,
-                                   "Failed to remove transient container at %@", cachedURL);
-            return nullptr;
+        if (const TarnStatus moved = connection._moveItemAtURLToDeathRow(
+                cachedURL, /*isDir=*/true, /*startDeletionThread=*/true);
+            !moved.ok()) {
+            return TARN_ERROR_IN(kCreateOrLookup, TarnErrorRemoveTransientFailed, moved.error(),
+                                 "Failed to remove transient container at %@", cachedURL);
         }
     } else if (!isNotFound(cached.error())) {
-        *error = cached.error();
-        return nullptr;
+        return cached.error();
     }
-    return createContainer(connection, identity, transient, error);
+    return createContainer(connection, identity, transient);
 }
 
 }  // namespace
 
-TarnMetadataRef TarnClientConnection::createOrLookupContainerWithContainerIdentity(
+TarnResult<TarnMetadataRef> TarnClientConnection::createOrLookupContainerWithContainerIdentity(
     const TarnContainerIdentityRef& identity, bool createIfNecessary, bool transient,
-    bool useLocking, uint64_t* error) {
-    GlobalLockHolder globalLock;
-    TarnErrorRef failure;
-    TarnMetadataRef result;
-    try {
-        result = createOrLookup(*this, identity, createIfNecessary, transient, useLocking,
-                                globalLock, &failure);
-    } catch (const std::exception& e) {
-        globalLock.release();
-        TarnSetError(error, TarnHandleCaughtException(__func__, &e));
-        return nullptr;
-    } catch (...) {
-        globalLock.release();
-        TarnSetError(error, TarnHandleCaughtException(__func__, nullptr));
-        return nullptr;
-    }
-    globalLock.release();
-    if (!result) TarnSetError(error, TarnErrorCodeOf(failure, TarnErrorInvalidArgument));
-    return result;
+    bool useLocking) {
+    // Whatever leaves, the holder lets the global lock go.
+    TarnGlobalLockHolder globalLock;
+    return createOrLookup(*this, identity, createIfNecessary, transient, useLocking, globalLock);
 }
 
-std::optional<std::vector<TarnMetadataRef>> TarnClientConnection::containersWithClass(
-    TarnContainerClass containerClass, bool transient, uint64_t* error) {
+TarnResult<std::vector<TarnMetadataRef>> TarnClientConnection::containersWithClass(
+    TarnContainerClass containerClass, bool transient) {
     if (!TarnContainerClassIsValid(containerClass)) {
-        TarnErrorRef e = TARN_ERROR(TarnErrorInvalidArgument, nullptr,
-                                    "Can't act on an invalid container class: %ld",
-                                    static_cast<int64_t>(containerClass));
-        TarnSetError(error, e->code());
-        return std::nullopt;
+        return TARN_ERROR(TarnErrorInvalidArgument, nullptr,
+                          "Can't act on an invalid container class: %ld",
+                          static_cast<int64_t>(containerClass));
     }
-    GlobalLockHolder globalLock;
-    try {
-        TarnUserIdentityRef userIdentity =
-            clientIdentity_ ? clientIdentity_->userIdentity() : nullptr;
-        if (!userIdentity) userIdentity = TarnUserIdentityCache::defaultUserIdentity();
-        globalLock.readLock();
-        auto containers = TarnContainerCache::sharedInstance().allContainersForUserIdentity(
-            userIdentity, containerClass, transient);
-        globalLock.release();
-        if (!containers.ok()) {
-            TarnSetError(error, containers.code(TarnErrorInvalidArgument));
-            return std::nullopt;
-        }
-        return std::move(containers).value();
-    } catch (const std::exception& e) {
-        globalLock.release();
-        TarnSetError(error, TarnHandleCaughtException(__func__, &e));
-    } catch (...) {
-        globalLock.release();
-        TarnSetError(error, TarnHandleCaughtException(__func__, nullptr));
-    }
-    return std::nullopt;
+    TarnUserIdentityRef userIdentity = clientIdentity_ ? clientIdentity_->userIdentity() : nullptr;
+    if (!userIdentity) userIdentity = TarnUserIdentityCache::defaultUserIdentity();
+    TarnGlobalLockHolder globalLock;
+    globalLock.readLock();
+    return TarnContainerCache::sharedInstance().allContainersForUserIdentity(
+        userIdentity, containerClass, transient);
 }
 
 // ---- Deletion ----
 
-void TarnClientConnection::deleteContainerWithContainerIdentity(
-    const TarnContainerIdentityRef& identity, bool transient, uint64_t* error) {
-    try {
-        _deleteContainerWithContainerIdentity(identity, transient, error);
-    } catch (const std::exception& e) {
-        TarnSetError(error, TarnHandleCaughtException(__func__, &e));
-    } catch (...) {
-        TarnSetError(error, TarnHandleCaughtException(__func__, nullptr));
-    }
-}
-
-void TarnClientConnection::_deleteContainerWithContainerIdentity(
-    const TarnContainerIdentityRef& identity, bool transient, uint64_t* error) {
-    static constexpr const char* kOperation = "deleteContainerWithContainerIdentity";
-    uint64_t code = TarnSuccess;
-    TarnMetadataRef metadata =
-        createOrLookupContainerWithContainerIdentity(identity, false, transient, true, &code);
-    TarnConcreteContainerIdentityRef concrete = metadata ? metadata->containerIdentity() : nullptr;
+TarnStatus TarnClientConnection::deleteContainerWithContainerIdentity(
+    const TarnContainerIdentityRef& identity, bool transient) {
+    TarnResult<TarnMetadataRef> found = createOrLookupContainerWithContainerIdentity(
+        identity, /*createIfNecessary=*/false, transient, /*useLocking=*/true);
+    TarnConcreteContainerIdentityRef concrete =
+        found.ok() ? (*found)->containerIdentity() : nullptr;
     if (!concrete) {
-        TarnLog(kLogError, kOperation,
+        TarnLog(kLogError, __func__,
                 "Failed to lookup existing container to delete-identity: %@, transient: %d",
                 identity, transient);
-        TarnSetError(error, code == TarnSuccess ? TarnErrorInvalidArgument : code);
-        return;
+        // A record without an identity of its own answers as a bad argument.
+        if (found.ok()) return TARN_ERROR_CODE(TarnErrorInvalidArgument, nullptr);
+        return found.error();
     }
     commandQueue_->insertCommand(
-        TarnCommandStageForDelete::commandForStageForDeleteWithContainerIdentities({concrete}, true,
-                                                                                   nullptr));
-    TarnSetError(error, TarnSuccess);
+        TarnCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+            {concrete}, /*useLocking=*/true, nullptr));
+    return {};
 }
 
 bool TarnClientConnection::completeWithError(uint64_t* error) {
-    // A command that throws fails on its own (the queue catches it); this
-    // catches what the queue itself may throw, out of memory for one.
-    try {
-        return commandQueue_->executeAllUntilExhaustedOrError(error);
-    } catch (const std::exception& e) {
-        TarnSetError(error, TarnHandleCaughtException(__func__, &e));
-    } catch (...) {
-        TarnSetError(error, TarnHandleCaughtException(__func__, nullptr));
-    }
-    return false;
+    return TarnReport(commandQueue_->executeAllUntilExhaustedOrError(), error,
+                      TarnErrorInvalidArgument);
 }
 
 // Boot set-up and clean-up steps arrive with the boot maintenance work; start-up

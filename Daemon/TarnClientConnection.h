@@ -15,6 +15,12 @@
 // transaction. An item that cannot be removed is moved out of the way into
 // the temporary directory under the root prefix. ENOENT counts as success
 // wherever the aim is that an item be gone.
+//
+// Errors: every operation answers a TarnResult (Daemon/TarnResult.h) whose
+// error carries the code the client gets; completeWithError() alone takes the
+// request's error slot, where the request processor hands it over. No
+// operation fences exceptions itself: the handler, the queued command and the
+// death-row pass are the boundaries (Daemon/TarnExceptionFence.h).
 #pragma once
 
 #include <cstdint>
@@ -30,8 +36,9 @@
 #include "Daemon/TarnCommandQueue.h"
 #include "Daemon/TarnContainerClass.h"
 #include "Daemon/TarnContainerIdentity.h"
-#include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnMetadata.h"
+#include "Daemon/TarnResult.h"
 #include "Platform/Dispatch.h"
 #include "Platform/Path.h"
 #include "Platform/PropertyList.h"
@@ -100,31 +107,29 @@ class TarnClientConnection {
     static std::set<std::string> _setOfStringsFromArray(const PlistArray& array);
 
     // Whether the caller may look up (and create) a container of the class
-    // with the identifier; on refusal error 55 in *error.
-    bool _passesLookupRuleForContainerClass(TarnContainerClass containerClass,
-                                            const std::string& identifier, TarnErrorRef* error);
+    // with the identifier; a refusal is TarnErrorNotEntitled.
+    TarnStatus _passesLookupRuleForContainerClass(TarnContainerClass containerClass,
+                                                  const std::string& identifier);
     // The second gate of system data containers (class 12); other classes pass.
-    bool _passesSystemDataGateForContainerClass(TarnContainerClass containerClass,
-                                                const std::string& identifier, TarnErrorRef* error);
+    TarnStatus _passesSystemDataGateForContainerClass(TarnContainerClass containerClass,
+                                                      const std::string& identifier);
     // Whether the caller may list the groups of `ownerIdentifier`.
-    bool _passesGroupOwnerRuleForContainerClass(TarnContainerClass groupContainerClass,
-                                                const std::string& ownerIdentifier,
-                                                TarnErrorRef* error);
+    TarnStatus _passesGroupOwnerRuleForContainerClass(TarnContainerClass groupContainerClass,
+                                                      const std::string& ownerIdentifier);
 
     // ---- Death row ----
 
     // Renames the item into a new unique directory on death row; a missing
-    // item succeeds without starting a pass. Errors: 41.
-    bool _moveItemAtURLToDeathRow(const FileURL& url, bool isDir, bool startDeletionThread,
-                                  TarnErrorRef* error);
+    // item succeeds without starting a pass. Fails with TarnErrorDeathRowMoveFailed.
+    TarnStatus _moveItemAtURLToDeathRow(const FileURL& url, bool isDir, bool startDeletionThread);
     // Queues a deletion pass and returns at once; `completion` (may be empty)
-    // gets 1, or the code of the pass's last failure (17 or 28), on the
-    // death-row queue.
+    // gets TarnSuccess, or the code of the pass's last failure
+    // (TarnErrorDestroyFailed or TarnErrorDeleteFailed), on the death-row queue.
     void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
     // Removes the item or, failing that, moves it into the temporary
     // directory under the root prefix (into a fresh unique directory there
-    // when its name is taken). Errors: 4.
-    static bool _removeItemOrMoveToTempAtURL(const FileURL& url, TarnErrorRef* error);
+    // when its name is taken). Fails with TarnErrorMoveFailed.
+    static TarnStatus _removeItemOrMoveToTempAtURL(const FileURL& url);
 
     // ---- Create or look up ----
 
@@ -132,46 +137,47 @@ class TarnClientConnection {
     // when missing and `createIfNecessary`. `existed()` of the result tells a
     // found container from a new one. With `useLocking` a lookup holds the
     // global read lock and a creation the global write lock; callers that
-    // already hold the write lock pass false. Failure: nullptr, code in *error.
-    TarnMetadataRef createOrLookupContainerWithContainerIdentity(
+    // already hold the write lock pass false. Never answers a null record.
+    TarnResult<TarnMetadataRef> createOrLookupContainerWithContainerIdentity(
         const TarnContainerIdentityRef& identity, bool createIfNecessary, bool transient,
-        bool useLocking, uint64_t* error);
+        bool useLocking);
     // Every container of the class for the client's user identity.
-    std::optional<std::vector<TarnMetadataRef>> containersWithClass(
-        TarnContainerClass containerClass, bool transient, uint64_t* error);
-    bool _createTopLevelContainerDirectory(const FileURL& url, TarnContainerClass containerClass,
-                                           uint32_t owner, TarnErrorRef* error);
-    bool _createSubDirectories(const FileURL& url, const TarnMetadataRef& containerMetadata,
-                               TarnErrorRef* error);
+    TarnResult<std::vector<TarnMetadataRef>> containersWithClass(TarnContainerClass containerClass,
+                                                                 bool transient);
+    TarnStatus _createTopLevelContainerDirectory(const FileURL& url,
+                                                 TarnContainerClass containerClass, uint32_t owner);
+    TarnStatus _createSubDirectories(const FileURL& url, const TarnMetadataRef& containerMetadata);
     static int _dataProtectionClassForContainerMetadata(const TarnMetadataRef& containerMetadata);
 
     // ---- Deletion ----
 
     // Looks the container up and queues its staged deletion on the command
-    // queue; *error always receives a code, 1 when queued.
-    void deleteContainerWithContainerIdentity(const TarnContainerIdentityRef& identity,
-                                              bool transient, uint64_t* error);
+    // queue; succeeds once it is queued.
+    TarnStatus deleteContainerWithContainerIdentity(const TarnContainerIdentityRef& identity,
+                                                    bool transient);
 
     // ---- Per-container operations (TarnClientConnectionOperations.cc) ----
 
-    TarnMetadataRef metadataWithContainerIdentity(const TarnConcreteContainerIdentityRef& identity,
-                                                  uint64_t* error);
-    // `key` empty: the key was missing or not a string (error 38).
-    std::optional<PlistValue> infoValueForKey(const std::optional<std::string>& key,
-                                              const TarnConcreteContainerIdentityRef& containerIdentity,
-                                              bool useLocking, uint64_t* error);
+    TarnResult<TarnMetadataRef> metadataWithContainerIdentity(
+        const TarnConcreteContainerIdentityRef& identity);
+    // `key` empty: the key was missing or not a string (TarnErrorBadInput).
+    TarnResult<PlistValue> infoValueForKey(
+        const std::optional<std::string>& key,
+        const TarnConcreteContainerIdentityRef& containerIdentity, bool useLocking);
     // An empty `value` removes the key.
-    void setInfoValue(const std::optional<PlistValue>& value, const std::optional<std::string>& forKey,
-                      const TarnConcreteContainerIdentityRef& containerIdentity, bool useLocking,
-                      uint64_t* error);
-    uint64_t diskUsageWithContainerIdentity(const TarnConcreteContainerIdentityRef& identity,
-                                            uint64_t* error);
-    void recreateDefaultStructureWithContainerIdentity(
-        const TarnConcreteContainerIdentityRef& identity, uint64_t* error);
-    void regenerateDirectoryUUIDWithContainerIdentity(
-        const TarnConcreteContainerIdentityRef& identity, uint64_t* error);
+    TarnStatus setInfoValue(const std::optional<PlistValue>& value,
+                            const std::optional<std::string>& forKey,
+                            const TarnConcreteContainerIdentityRef& containerIdentity,
+                            bool useLocking);
+    TarnResult<uint64_t> diskUsageWithContainerIdentity(
+        const TarnConcreteContainerIdentityRef& identity);
+    TarnStatus recreateDefaultStructureWithContainerIdentity(
+        const TarnConcreteContainerIdentityRef& identity);
+    TarnStatus regenerateDirectoryUUIDWithContainerIdentity(
+        const TarnConcreteContainerIdentityRef& identity);
 
-    // Runs the command queue until it is exhausted or a command fails.
+    // Runs the command queue until it is exhausted or a command fails; the
+    // failing command's code goes into the request's error slot.
     bool completeWithError(uint64_t* error);
 
     // Boot work run by start-up on the shared connection.
@@ -187,9 +193,6 @@ class TarnClientConnection {
     const PlistValue* lookupValueForKey(const std::string& key) const;
     bool _lookupRuleCommon(TarnContainerClass containerClass, const std::string& identifier,
                            bool withGroupRule);
-    // deleteContainerWithContainerIdentity without its exception guard.
-    void _deleteContainerWithContainerIdentity(const TarnContainerIdentityRef& identity,
-                                               bool transient, uint64_t* error);
 
     // Read-only after construction, except the rights a handler adjusts
     // (booleans, client bundle identifier) on the request's own thread.

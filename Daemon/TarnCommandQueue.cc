@@ -1,7 +1,7 @@
 #include "Daemon/TarnCommandQueue.h"
 
 #include "Daemon/TarnError.h"
-#include "Daemon/TarnRequestProcessor.h"
+#include "Daemon/TarnExceptionFence.h"
 #include "Platform/PlatformLog.h"
 
 namespace tarn {
@@ -15,50 +15,40 @@ void TarnCommandQueue::insertCommand(std::shared_ptr<TarnCommand> command) {
     commands_.push_back(std::move(command));
 }
 
-bool TarnCommandQueue::executeNextCommandWithError(uint64_t* error) {
+TarnStatus TarnCommandQueue::executeNextCommandWithError() {
     std::shared_ptr<TarnCommand> next;
     DispatchQueueRef queue;
     {
         MutexLock lock(mu_);
-        if (commands_.empty()) {
-            TarnSetError(error, TarnErrorQueueEmpty);
-            return false;
-        }
+        if (commands_.empty()) return TARN_ERROR_CODE(TarnErrorQueueEmpty, nullptr);
         next = std::move(commands_.front());
         commands_.pop_front();
         if (!queue_) queue_ = DispatchQueue::createSerial("com.ostrea.tarnkeeperd.TarnCommandQueue");
         queue = queue_;
     }
-    bool ok = false;
-    uint64_t code = TarnSuccess;
+    TarnStatus result;
     queue->sync([&] {
         const void* p = next.get();
         PlatformLog("unspecified", PlatformLogType::Info, "Executing command <%p; %llu>...", p,
                     next->command());
-        // A command that throws fails with 40; nothing escapes the work item.
-        try {
-            ok = next->fromQueue(this, &code);
-        } catch (const std::exception& e) {
-            ok = false;
-            code = TarnHandleCaughtException("fromQueue", &e);
-        } catch (...) {
-            ok = false;
-            code = TarnHandleCaughtException("fromQueue", nullptr);
-        }
+        // Nothing escapes the work item.
+        result = TarnFenceExceptions("fromQueue", [&] { return next->fromQueue(this); });
+        // A command that fails without an error value reads as 1 here, as it
+        // always has; the request's slot never does (completeWithError).
         PlatformLog("unspecified", PlatformLogType::Info,
                     "Completed command <%p; %llu>: success = %d, error = %llu", p, next->command(),
-                    ok, code);
+                    result.ok(), result.code(TarnSuccess));
     });
-    if (!ok) TarnSetError(error, code);
-    return ok;
+    return result;
 }
 
-bool TarnCommandQueue::executeAllUntilExhaustedOrError(uint64_t* error) {
-    uint64_t code = TarnSuccess;
-    while (executeNextCommandWithError(&code)) code = TarnSuccess;
-    if (code == TarnErrorQueueEmpty) return true;
-    TarnSetError(error, code);
-    return false;
+TarnStatus TarnCommandQueue::executeAllUntilExhaustedOrError() {
+    for (;;) {
+        TarnStatus ran = executeNextCommandWithError();
+        if (ran.ok()) continue;
+        if (ran.code(TarnSuccess) == TarnErrorQueueEmpty) return {};
+        return ran;
+    }
 }
 
 std::vector<std::shared_ptr<TarnCommand>> TarnCommandQueue::commands() {

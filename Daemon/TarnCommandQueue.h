@@ -11,6 +11,7 @@
 #include <memory>
 #include <vector>
 
+#include "Daemon/TarnResult.h"
 #include "Platform/Dispatch.h"
 #include "Platform/ThreadAnnotations.h"
 
@@ -23,9 +24,8 @@ class TarnCommand {
 public:
     virtual ~TarnCommand() = default;
     virtual uint64_t command() const = 0;
-    // Runs the command on `queue`'s serial queue; returns true on success,
-    // otherwise writes a code to *error.
-    virtual bool fromQueue(TarnCommandQueue* queue, uint64_t* error) = 0;
+    // Runs the command on `queue`'s serial queue.
+    virtual TarnStatus fromQueue(TarnCommandQueue* queue) = 0;
 };
 
 class TarnCommandQueue {
@@ -33,12 +33,13 @@ public:
     TarnCommandQueue();
 
     void insertCommand(std::shared_ptr<TarnCommand> command);
-    // Runs the first command. True when one ran and succeeded; *error gets 77
-    // when there was none, the command's code (1 if it set none) on failure.
-    bool executeNextCommandWithError(uint64_t* error);
-    // Runs commands until the queue is empty (true, *error untouched) or one
-    // fails (false, its code in *error; later commands stay queued).
-    bool executeAllUntilExhaustedOrError(uint64_t* error);
+    // Runs the first command and answers its result; TarnErrorQueueEmpty when
+    // there was none. A command that throws fails with the caught-exception
+    // error: the work item is a fence.
+    TarnStatus executeNextCommandWithError();
+    // Runs commands until the queue is empty (success) or one fails (its
+    // error; later commands stay queued).
+    TarnStatus executeAllUntilExhaustedOrError();
     // The commands still queued, first to run first.
     std::vector<std::shared_ptr<TarnCommand>> commands();
     // Drops what is still queued: a request whose queue failed ends there.

@@ -1,15 +1,13 @@
 #include "Daemon/TarnCommandStageForDelete.h"
 
-#include <exception>
-
 #include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnContainerCache.h"
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnExceptionFence.h"
 #include "Daemon/TarnFileManager.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnLocks.h"
 #include "Daemon/TarnLog.h"
-#include "Daemon/TarnRequestProcessor.h"
 #include "Platform/PlatformLog.h"
 
 namespace tarn {
@@ -68,31 +66,24 @@ TarnCommandStageForDelete::TarnCommandStageForDelete(
       containerIdentities_(std::move(containerIdentities)),
       onError_(std::move(onError)) {}
 
-bool TarnCommandStageForDelete::fromQueue(TarnCommandQueue* queue, uint64_t* error) {
-    if (useLocking_) gTarnLocks.write_lock_all_identifiers();
-    uint64_t code = TarnSuccess;
-    bool ok = false;
-    try {
-        ok = stageAll(queue, &code);
-    } catch (const std::exception& e) {
-        code = TarnHandleCaughtException(__func__, &e);
-    } catch (...) {
-        code = TarnHandleCaughtException(__func__, nullptr);
-    }
-    if (useLocking_) gTarnLocks.unlock_all_identifiers();
-    if (ok) return true;
-    try {
+TarnStatus TarnCommandStageForDelete::fromQueue(TarnCommandQueue* queue) {
+    // A fence of its own, inside the queue's: an exception is a failed run
+    // that onError must hear of, with the global lock let go first.
+    const TarnStatus staged = TarnFenceExceptions(__func__, [&] {
+        TarnGlobalLockHolder lock(useLocking_ ? TarnGlobalLockHolder::Mode::Write
+                                              : TarnGlobalLockHolder::Mode::None);
+        return stageAll(queue);
+    });
+    if (staged.ok()) return {};
+    const uint64_t code = staged.code(TarnErrorCacheRemoveFailed);
+    // What the callback throws is reported; the staging's own error is the answer.
+    (void)TarnFenceExceptions(__func__, [&] {
         if (onError_) onError_(code);
-    } catch (const std::exception& e) {
-        (void)TarnHandleCaughtException(__func__, &e);  // the staging's own code is the answer
-    } catch (...) {
-        (void)TarnHandleCaughtException(__func__, nullptr);
-    }
-    TarnSetError(error, code);
-    return false;
+    });
+    return staged;
 }
 
-bool TarnCommandStageForDelete::stageAll(TarnCommandQueue* queue, uint64_t* error) {
+TarnStatus TarnCommandStageForDelete::stageAll(TarnCommandQueue* queue) {
     auto& cache = TarnContainerCache::sharedInstance();
     auto& fm = TarnFileManager::defaultManager();
     const FileURL deathRow = TarnGlobalConfiguration::sharedInstance().deathrowDirectory();
@@ -127,16 +118,14 @@ bool TarnCommandStageForDelete::stageAll(TarnCommandQueue* queue, uint64_t* erro
                 container->userIdentity(), container->containerClass(), container->identifier(),
                 container->transient());
             !removed.ok()) {
-            TarnErrorRef e = TARN_ERROR_IN(
-                "fromQueue", TarnErrorCacheRemoveFailed, removed.error(),
-                "Failed to remove from cache id: %@, class: %ld, transient: %d",
-                container->identifier(), static_cast<int64_t>(container->containerClass()),
-                container->transient());
-            TarnSetError(error, e->code());
-            return false;
+            return TARN_ERROR_IN("fromQueue", TarnErrorCacheRemoveFailed, removed.error(),
+                                 "Failed to remove from cache id: %@, class: %ld, transient: %d",
+                                 container->identifier(),
+                                 static_cast<int64_t>(container->containerClass()),
+                                 container->transient());
         }
     }
-    return true;
+    return {};
 }
 
 }  // namespace tarn

@@ -40,9 +40,10 @@ class TarnCommandStageForDelete : public TarnCommand {
 
     uint64_t command() const override { return kCommand; }
     // A container that is already gone is skipped without failing; one that
-    // can be neither moved nor removed is logged and stays. Fails (46) only
-    // when the cache refuses to forget a container, leaving later ones alone.
-    bool fromQueue(TarnCommandQueue* queue, uint64_t* error) override;
+    // can be neither moved nor removed is logged and stays. Fails
+    // (TarnErrorCacheRemoveFailed) only when the cache refuses to forget a
+    // container, leaving later ones alone.
+    TarnStatus fromQueue(TarnCommandQueue* queue) override;
 
     const std::vector<TarnContainerIdentityRef>& containerIdentities() const {
         return containerIdentities_;
@@ -51,7 +52,7 @@ class TarnCommandStageForDelete : public TarnCommand {
     const ErrorCallback& onError() const { return onError_; }
 
   private:
-    bool stageAll(TarnCommandQueue* queue, uint64_t* error);
+    TarnStatus stageAll(TarnCommandQueue* queue);
 
     const bool useLocking_;
     const std::vector<TarnContainerIdentityRef> containerIdentities_;

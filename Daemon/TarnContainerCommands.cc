@@ -2,6 +2,7 @@
 
 #include <functional>
 #include <memory>
+#include <type_traits>
 #include <utility>
 #include <vector>
 
@@ -82,10 +83,9 @@ std::optional<std::string> identifierWithDefault(const PlistValue& request,
     return own;
 }
 
-TarnUserIdentityRef userIdentityForContainerIdentifier(const TarnClientConnection& connection,
-                                                       const std::optional<std::string>& identifier,
-                                                       TarnContainerClass containerClass,
-                                                       uint64_t* error) {
+TarnResult<TarnUserIdentityRef> userIdentityForContainerIdentifier(
+    const TarnClientConnection& connection, const std::optional<std::string>& identifier,
+    TarnContainerClass containerClass) {
     TarnUserIdentityRef own = clientUserIdentity(connection);
     // A caller without a specific persona acts for whichever persona the
     // application belongs to; global containers have no persona to choose.
@@ -125,17 +125,15 @@ TarnUserIdentityRef userIdentityForContainerIdentifier(const TarnClientConnectio
         TarnLog(kLogError, __func__, "%@ trying to look up persona for %llu:%@",
                 connection.clientBundleIdentifier(), containerClass, identifier);
     }
-    TarnSetError(error, TarnErrorPersonaMismatch);
-    return nullptr;
+    return TARN_ERROR_CODE(TarnErrorPersonaMismatch, nullptr);
 }
 
-TarnUserIdentityRef userIdentityForPersonaUniqueString(
-    const TarnClientConnection& connection, const std::optional<std::string>& personaUniqueString,
-    uint64_t* error) {
+TarnResult<TarnUserIdentityRef> userIdentityForPersonaUniqueString(
+    const TarnClientConnection& connection, const std::optional<std::string>& personaUniqueString) {
     TarnUserIdentityRef own = clientUserIdentity(connection);
     const auto& flags = HostConfiguration::shared().multiUserFlags;
     if (flags && (*flags & kMultiUserSharedDeviceBit)) {
-        if (!own) TarnSetError(error, TarnErrorPersonaMismatch);
+        if (!own) return TARN_ERROR_CODE(TarnErrorPersonaMismatch, nullptr);
         return own;
     }
     TarnUserIdentityRef found =
@@ -146,69 +144,49 @@ TarnUserIdentityRef userIdentityForPersonaUniqueString(
                     "Cannot reconstitute a user identity from provided persona unique string; "
                     "client = [%@], personaUniqueString = [%@]",
                     connection.clientBundleIdentifier(), personaUniqueString);
-        TarnSetError(error, TarnErrorPersonaMismatch);
-        return nullptr;
+        return TARN_ERROR_CODE(TarnErrorPersonaMismatch, nullptr);
     }
     if (own && (own->isNoSpecificPersona() || own->isEqualToUserIdentity(*found))) return found;
     PlatformLog(kDecodingCategory, PlatformLogType::Error,
                 "Persona unique string is not valid for this client; client = [%@], "
                 "personaUniqueString = [%@]",
                 connection.clientBundleIdentifier(), personaUniqueString);
-    TarnSetError(error, TarnErrorPersonaMismatch);
-    return nullptr;
+    return TARN_ERROR_CODE(TarnErrorPersonaMismatch, nullptr);
 }
 
-TarnContainerIdentityRef validatedContainerIdentity(const PlistValue& request,
-                                                    const TarnClientConnection& connection,
-                                                    const char* identifierKey, const char* classKey,
-                                                    uint64_t* error) {
+TarnResult<TarnContainerIdentityRef> validatedContainerIdentity(
+    const PlistValue& request, const TarnClientConnection& connection, const char* identifierKey,
+    const char* classKey) {
     std::optional<std::string> identifier = identifierKey
                                                 ? stringForKey(request, identifierKey)
                                                 : identifierWithDefault(request, connection);
-    if (!identifier) {
-        TarnSetError(error, TarnErrorMissingIdentifier);
-        return nullptr;
-    }
+    if (!identifier) return TARN_ERROR_CODE(TarnErrorMissingIdentifier, nullptr);
     const TarnContainerClass containerClass =
         uint64ForKey(request, classKey ? classKey : "ContainerClass");
-    if (!TarnContainerClassIsValid(containerClass)) {
-        TarnSetError(error, TarnErrorInvalidContainerClass);
-        return nullptr;
-    }
+    if (!TarnContainerClassIsValid(containerClass))
+        return TARN_ERROR_CODE(TarnErrorInvalidContainerClass, nullptr);
     TarnUserIdentityRef user =
-        userIdentityForContainerIdentifier(connection, identifier, containerClass, error);
-    if (!user) return nullptr;
-    TarnResult<TarnContainerIdentityRef> identity =
-        TarnContainerIdentity::containerIdentityWithUserIdentity(
-            std::move(user), std::move(identifier), containerClass);
-    if (!TarnReport(identity, error, TarnErrorInvalidArgument)) return nullptr;
-    return std::move(*identity);
+        TARN_TRY(userIdentityForContainerIdentifier(connection, identifier, containerClass));
+    return TarnContainerIdentity::containerIdentityWithUserIdentity(
+        std::move(user), std::move(identifier), containerClass);
 }
 
-TarnConcreteContainerIdentityRef concreteContainerIdentity(const PlistValue& request,
-                                                           const TarnClientConnection& connection,
-                                                           const TarnConcreteIdentityKeys& keys,
-                                                           uint64_t* error) {
+TarnResult<TarnConcreteContainerIdentityRef> concreteContainerIdentity(
+    const PlistValue& request, const TarnClientConnection& connection,
+    const TarnConcreteIdentityKeys& keys) {
     const PlistValue* identifier = request.find(keys.identifier);
-    if (!identifier || identifier->isNull()) {
-        TarnSetError(error, TarnErrorMissingIdentifier);
-        return nullptr;
-    }
-    // Out-of-range classes are refused by the identity itself (11), not here.
+    if (!identifier || identifier->isNull())
+        return TARN_ERROR_CODE(TarnErrorMissingIdentifier, nullptr);
+    // Out-of-range classes are refused by the identity itself
+    // (TarnErrorInvalidArgument), not here.
     const TarnContainerClass containerClass = uint64ForKey(request, keys.containerClass);
-    TarnUserIdentityRef user;
-    if (TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
-        user = userIdentityForPersonaUniqueString(
-            connection, stringForKey(request, keys.personaUniqueString), error);
-        if (!user) return nullptr;
-    } else {
-        user = clientUserIdentity(connection);
-    }
-    TarnResult<TarnConcreteContainerIdentityRef> identity =
-        TarnConcreteContainerIdentity::containerIdentityWithUUID(request.find(keys.uuid), user,
-                                                                 identifier, containerClass);
-    if (!TarnReport(identity, error, TarnErrorInvalidArgument)) return nullptr;
-    return std::move(*identity);
+    TarnUserIdentityRef user =
+        TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)
+            ? TARN_TRY(userIdentityForPersonaUniqueString(
+                  connection, stringForKey(request, keys.personaUniqueString)))
+            : clientUserIdentity(connection);
+    return TarnConcreteContainerIdentity::containerIdentityWithUUID(request.find(keys.uuid), user,
+                                                                    identifier, containerClass);
 }
 
 const char* sandboxExtensionClassForContainer(TarnContainerClass containerClass,
@@ -260,32 +238,76 @@ void issueSandboxExtension(PlistValue& reply, const char* replyKey, const TarnMe
 
 // ---- Handlers ----
 
+namespace {
+
+// Handlers write the code of a failure into the error slot; a foreign
+// (file-layer) error or none answers this.
+constexpr uint64_t kHandlerFallback = TarnErrorInvalidArgument;
+
+// The persona unique string of a container's owner, or null for none.
+const std::string* personaUniqueStringOf(const TarnMetadata& container) {
+    const TarnUserIdentityRef& owner = container.userIdentity();
+    return owner && owner->personaUniqueString() ? &*owner->personaUniqueString() : nullptr;
+}
+
+void setPersonaUniqueString(PlistValue& reply, const TarnMetadata& container) {
+    if (const std::string* persona = personaUniqueStringOf(container))
+        reply.set("ReplyPersonaUniqueString", *persona);
+}
+
+// The shape of the handlers that name one existing container: decode its
+// concrete identity, then hand it to the connection operation `forward`, whose
+// result `answer` turns into reply keys. A failure at either step goes into
+// the error slot.
+template <class Forward, class Answer>
+void forwardConcreteIdentity(const PlistValue& request, TarnClientConnection& connection,
+                             uint64_t* error, Forward&& forward, Answer&& answer) {
+    TarnResult<TarnConcreteContainerIdentityRef> identity =
+        concreteContainerIdentity(request, connection, {});
+    if (!TarnReport(identity, error, kHandlerFallback)) return;
+    auto result = forward(*identity);
+    if (!TarnReport(result, error, kHandlerFallback)) return;
+    if constexpr (std::is_void_v<typename decltype(result)::ValueType>)
+        answer();
+    else
+        answer(*result);
+}
+
+template <class Forward>
+void forwardConcreteIdentity(const PlistValue& request, TarnClientConnection& connection,
+                             uint64_t* error, Forward&& forward) {
+    forwardConcreteIdentity(request, connection, error, std::forward<Forward>(forward),
+                            [](auto&&...) {});
+}
+
+}  // namespace
+
 void TarnHandleCreateOrLookupCommand(const TarnRequestContext& context, const PlistValue& request,
                                      PlistValue& reply, TarnClientConnection* connection,
                                      uint64_t* error) {
-    TarnContainerIdentityRef identity =
-        validatedContainerIdentity(request, *connection, nullptr, "ContainerClass", error);
-    if (!identity) return;
-    TarnMetadataRef container = connection->createOrLookupContainerWithContainerIdentity(
-        identity, boolForKey(request, "CreateIfNecessary"), boolForKey(request, "Transient"),
-        /*useLocking=*/true, error);
-    if (!container) return;
-    reply.set("ReplyUUID", container->uuid());
-    reply.set("ReplyExisted", container->existed());
-    reply.set("ReplyPath", container->url());
-    reply.set("ReplyIdentifier", container->identifier());
-    if (container->userIdentity() && container->userIdentity()->personaUniqueString())
-        reply.set("ReplyPersonaUniqueString", *container->userIdentity()->personaUniqueString());
-    issueSandboxExtension(reply, "ReplySandboxToken", *container,
+    TarnResult<TarnContainerIdentityRef> identity =
+        validatedContainerIdentity(request, *connection, nullptr, "ContainerClass");
+    if (!TarnReport(identity, error, kHandlerFallback)) return;
+    TarnResult<TarnMetadataRef> found = connection->createOrLookupContainerWithContainerIdentity(
+        *identity, boolForKey(request, "CreateIfNecessary"), boolForKey(request, "Transient"),
+        /*useLocking=*/true);
+    if (!TarnReport(found, error, kHandlerFallback)) return;
+    const TarnMetadata& container = **found;
+    reply.set("ReplyUUID", container.uuid());
+    reply.set("ReplyExisted", container.existed());
+    reply.set("ReplyPath", container.url());
+    reply.set("ReplyIdentifier", container.identifier());
+    setPersonaUniqueString(reply, container);
+    issueSandboxExtension(reply, "ReplySandboxToken", container,
                           connection->clientIdentity().get());
 }
 
 void TarnHandleContainersWithClassCommand(const TarnRequestContext& context,
                                           const PlistValue& request, PlistValue& reply,
                                           TarnClientConnection* connection, uint64_t* error) {
-    std::optional<std::vector<TarnMetadataRef>> containers = connection->containersWithClass(
-        uint64ForKey(request, "ContainerClass"), boolForKey(request, "Transient"), error);
-    if (!containers) return;
+    TarnResult<std::vector<TarnMetadataRef>> containers = connection->containersWithClass(
+        uint64ForKey(request, "ContainerClass"), boolForKey(request, "Transient"));
+    if (!TarnReport(containers, error, kHandlerFallback)) return;
     PlistArray identifiers, uuids, personas;
     identifiers.reserve(containers->size());
     uuids.reserve(containers->size());
@@ -294,9 +316,8 @@ void TarnHandleContainersWithClassCommand(const TarnRequestContext& context,
         if (!container) continue;  // keeps the three arrays parallel
         identifiers.emplace_back(container->identifier());
         uuids.emplace_back(container->uuid());
-        const auto& owner = container->userIdentity();
-        personas.emplace_back(owner && owner->personaUniqueString() ? *owner->personaUniqueString()
-                                                                    : std::string());
+        const std::string* persona = personaUniqueStringOf(*container);
+        personas.emplace_back(persona ? *persona : std::string());
     }
     reply.set("ReplyIdsArray", std::move(identifiers));
     reply.set("ReplyUUIDsArray", std::move(uuids));
@@ -330,25 +351,28 @@ void TarnHandleStageForDeleteCommand(const TarnRequestContext& context, const Pl
     identities.reserve(count);
     for (size_t i = 0; i < count; ++i) {
         const TarnContainerClass containerClass = (*classes)[i].asUInt64().value_or(0);
+        // One container of someone else's persona spoils the whole request.
         TarnUserIdentityRef user;
         if (TarnUserIdentity::isUserIdentityRequiredForContainerClass(containerClass)) {
             const std::string* persona = (*personas)[i].asString();
-            user = userIdentityForPersonaUniqueString(
-                *connection, persona ? std::optional<std::string>(*persona) : std::nullopt, error);
+            TarnResult<TarnUserIdentityRef> named = userIdentityForPersonaUniqueString(
+                *connection, persona ? std::optional<std::string>(*persona) : std::nullopt);
+            if (!TarnReport(named, error, TarnErrorPersonaMismatch)) return;
+            user = std::move(*named);
         } else {
             user = connection->userIdentityCache().userIdentityForCurrentContext(
                 context.personaUniqueString);
-        }
-        // One container of someone else's persona spoils the whole request.
-        if (!user) {
-            if (*error == TarnSuccess) TarnSetError(error, TarnErrorPersonaMismatch);
-            return;
+            // Without an identity the code of an earlier malformed entry stands.
+            if (!user) {
+                if (*error == TarnSuccess) TarnSetError(error, TarnErrorPersonaMismatch);
+                return;
+            }
         }
         // A malformed entry is skipped; its code stays in the slot.
         TarnResult<TarnConcreteContainerIdentityRef> identity =
             TarnConcreteContainerIdentity::containerIdentityWithUUID(
                 &(*uuids)[i], user, &(*identifiers)[i], containerClass);
-        if (TarnReport(identity, error, TarnErrorInvalidArgument))
+        if (TarnReport(identity, error, kHandlerFallback))
             identities.push_back(std::move(*identity));
     }
     connection->commandQueue()->insertCommand(
@@ -380,77 +404,76 @@ void TarnHandleDeleteDeathRowCommand(const TarnRequestContext& context, const Pl
 void TarnHandleSetInfoValueCommand(const TarnRequestContext& context, const PlistValue& request,
                                    PlistValue& reply, TarnClientConnection* connection,
                                    uint64_t* error) {
-    TarnConcreteContainerIdentityRef identity =
-        concreteContainerIdentity(request, *connection, {}, error);
-    if (!identity) return;
-    connection->setInfoValue(plistForKey(request, "Value"), stringForKey(request, "Key"), identity,
-                             /*useLocking=*/true, error);
+    forwardConcreteIdentity(request, *connection, error, [&](const auto& identity) {
+        return connection->setInfoValue(plistForKey(request, "Value"), stringForKey(request, "Key"),
+                                        identity, /*useLocking=*/true);
+    });
 }
 
 void TarnHandleInfoValueCommand(const TarnRequestContext& context, const PlistValue& request,
                                 PlistValue& reply, TarnClientConnection* connection,
                                 uint64_t* error) {
-    TarnConcreteContainerIdentityRef identity =
-        concreteContainerIdentity(request, *connection, {}, error);
-    if (!identity) return;
-    std::optional<PlistValue> value = connection->infoValueForKey(
-        stringForKey(request, "Key"), identity, /*useLocking=*/true, error);
-    if (value) reply.set("ReplyInfoValue", std::move(*value));
+    forwardConcreteIdentity(
+        request, *connection, error,
+        [&](const auto& identity) {
+            return connection->infoValueForKey(stringForKey(request, "Key"), identity,
+                                               /*useLocking=*/true);
+        },
+        [&](PlistValue& value) { reply.set("ReplyInfoValue", std::move(value)); });
 }
 
 void TarnHandleMetadataCommand(const TarnRequestContext& context, const PlistValue& request,
                                PlistValue& reply, TarnClientConnection* connection,
                                uint64_t* error) {
-    TarnConcreteContainerIdentityRef identity =
-        concreteContainerIdentity(request, *connection, {}, error);
-    if (!identity) return;
-    TarnMetadataRef container = connection->metadataWithContainerIdentity(identity, error);
-    if (!container) return;
-    reply.set("ReplyPath", container->url());
-    reply.set("ReplyTransient", container->transient());
-    if (boolForKey(request, "InfoDictRequested") && container->info())
-        reply.set("ReplyInfoDictionary", *container->info());
-    issueSandboxExtension(reply, "ReplySandboxToken", *container,
-                          connection->clientIdentity().get());
-    if (container->userIdentity() && container->userIdentity()->personaUniqueString())
-        reply.set("ReplyPersonaUniqueString", *container->userIdentity()->personaUniqueString());
+    forwardConcreteIdentity(
+        request, *connection, error,
+        [&](const auto& identity) { return connection->metadataWithContainerIdentity(identity); },
+        [&](const TarnMetadataRef& found) {
+            const TarnMetadata& container = *found;
+            reply.set("ReplyPath", container.url());
+            reply.set("ReplyTransient", container.transient());
+            if (boolForKey(request, "InfoDictRequested") && container.info())
+                reply.set("ReplyInfoDictionary", *container.info());
+            issueSandboxExtension(reply, "ReplySandboxToken", container,
+                                  connection->clientIdentity().get());
+            setPersonaUniqueString(reply, container);
+        });
 }
 
 void TarnHandleRecreateStructureCommand(const TarnRequestContext& context,
                                         const PlistValue& request, PlistValue& reply,
                                         TarnClientConnection* connection, uint64_t* error) {
-    TarnConcreteContainerIdentityRef identity =
-        concreteContainerIdentity(request, *connection, {}, error);
-    if (!identity) return;
-    connection->recreateDefaultStructureWithContainerIdentity(identity, error);
+    forwardConcreteIdentity(request, *connection, error, [&](const auto& identity) {
+        return connection->recreateDefaultStructureWithContainerIdentity(identity);
+    });
 }
 
 void TarnHandleRegenerateUUIDCommand(const TarnRequestContext& context, const PlistValue& request,
                                      PlistValue& reply, TarnClientConnection* connection,
                                      uint64_t* error) {
-    TarnConcreteContainerIdentityRef identity =
-        concreteContainerIdentity(request, *connection, {}, error);
-    if (!identity) return;
-    connection->regenerateDirectoryUUIDWithContainerIdentity(identity, error);
+    forwardConcreteIdentity(request, *connection, error, [&](const auto& identity) {
+        return connection->regenerateDirectoryUUIDWithContainerIdentity(identity);
+    });
 }
 
 void TarnHandleDeleteContainerCommand(const TarnRequestContext& context, const PlistValue& request,
                                       PlistValue& reply, TarnClientConnection* connection,
                                       uint64_t* error) {
-    TarnContainerIdentityRef identity =
-        validatedContainerIdentity(request, *connection, "Identifier", "ContainerClass", error);
-    if (!identity) return;
-    connection->deleteContainerWithContainerIdentity(identity, boolForKey(request, "Transient"),
-                                                     error);
+    TarnResult<TarnContainerIdentityRef> identity =
+        validatedContainerIdentity(request, *connection, "Identifier", "ContainerClass");
+    if (!TarnReport(identity, error, kHandlerFallback)) return;
+    (void)TarnReport(connection->deleteContainerWithContainerIdentity(
+                         *identity, boolForKey(request, "Transient")),
+                     error, kHandlerFallback);
 }
 
 void TarnHandleDiskUsageCommand(const TarnRequestContext& context, const PlistValue& request,
                                 PlistValue& reply, TarnClientConnection* connection,
                                 uint64_t* error) {
-    TarnConcreteContainerIdentityRef identity =
-        concreteContainerIdentity(request, *connection, {}, error);
-    if (!identity) return;
-    reply.set("ReplyDiskUsage", connection->diskUsageWithContainerIdentity(identity, error));
+    forwardConcreteIdentity(
+        request, *connection, error,
+        [&](const auto& identity) { return connection->diskUsageWithContainerIdentity(identity); },
+        [&](uint64_t bytes) { reply.set("ReplyDiskUsage", bytes); });
 }
 
 }  // namespace tarn

@@ -5,7 +5,7 @@
 //
 // Handlers run on the request's thread, inside the request processor, with the
 // request's own client connection; they write reply keys and, on failure, a
-// code into the error slot (which starts at 1). A handler that fails before it
+// code into the error slot (which starts at TarnSuccess). A handler that fails before it
 // reaches its connection operation writes no reply key. Decoding never trusts
 // a value's type: a key holding the wrong type reads as missing.
 #pragma once
@@ -19,6 +19,7 @@
 #include "Daemon/TarnContainerIdentity.h"
 #include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnRequestContext.h"
+#include "Daemon/TarnResult.h"
 #include "Daemon/TarnUserIdentity.h"
 #include "Platform/PropertyList.h"
 
@@ -46,27 +47,27 @@ std::optional<std::string> identifierWithDefault(const PlistValue& request,
 // The user identity that owns the container `identifier` of `containerClass`
 // for this caller. A caller without a specific persona asking for a per-user
 // class is mapped to the one persona the application belongs to (plug-in data
-// follows its parent application). Empty with 76 when no single identity fits.
-TarnUserIdentityRef userIdentityForContainerIdentifier(const TarnClientConnection& connection,
-                                                       const std::optional<std::string>& identifier,
-                                                       TarnContainerClass containerClass,
-                                                       uint64_t* error);
+// follows its parent application). TarnErrorPersonaMismatch when no single
+// identity fits.
+TarnResult<TarnUserIdentityRef> userIdentityForContainerIdentifier(
+    const TarnClientConnection& connection, const std::optional<std::string>& identifier,
+    TarnContainerClass containerClass);
 
 // The user identity a persona unique string names, as long as the caller may
-// act for it (a caller without a specific persona may act for any). Empty with
-// 76 otherwise. In shared-device mode the caller's own identity, always.
-TarnUserIdentityRef userIdentityForPersonaUniqueString(
-    const TarnClientConnection& connection, const std::optional<std::string>& personaUniqueString,
-    uint64_t* error);
+// act for it (a caller without a specific persona may act for any);
+// TarnErrorPersonaMismatch otherwise. In shared-device mode the caller's own
+// identity, always.
+TarnResult<TarnUserIdentityRef> userIdentityForPersonaUniqueString(
+    const TarnClientConnection& connection, const std::optional<std::string>& personaUniqueString);
 
 // A container identity from an identifier key and a class key, validated:
-// 18 without identifier, 20 for a class outside 1 to 13, 76 when the persona
+// TarnErrorMissingIdentifier without identifier, TarnErrorInvalidContainerClass
+// for a class outside 1 to 13, TarnErrorPersonaMismatch when the persona
 // cannot be settled. `identifierKey` null: "Identifier" with the caller's
 // bundle identifier as default; otherwise the key is required.
-TarnContainerIdentityRef validatedContainerIdentity(const PlistValue& request,
-                                                    const TarnClientConnection& connection,
-                                                    const char* identifierKey, const char* classKey,
-                                                    uint64_t* error);
+TarnResult<TarnContainerIdentityRef> validatedContainerIdentity(
+    const PlistValue& request, const TarnClientConnection& connection, const char* identifierKey,
+    const char* classKey);
 
 // Request keys of a concrete identity (the replace command reads two sets).
 struct TarnConcreteIdentityKeys {
@@ -75,13 +76,13 @@ struct TarnConcreteIdentityKeys {
     const char* uuid = "UUID";
     const char* personaUniqueString = "PersonaUniqueString";
 };
-// A concrete identity from the keys: 18 without identifier; the class is not
-// range-checked here (the identity constructor refuses it with 11); per-user
-// classes take their user identity from the persona string.
-TarnConcreteContainerIdentityRef concreteContainerIdentity(const PlistValue& request,
-                                                           const TarnClientConnection& connection,
-                                                           const TarnConcreteIdentityKeys& keys,
-                                                           uint64_t* error);
+// A concrete identity from the keys: TarnErrorMissingIdentifier without
+// identifier; the class is not range-checked here (the identity constructor
+// refuses it with TarnErrorInvalidArgument); per-user classes take their user
+// identity from the persona string.
+TarnResult<TarnConcreteContainerIdentityRef> concreteContainerIdentity(
+    const PlistValue& request, const TarnClientConnection& connection,
+    const TarnConcreteIdentityKeys& keys);
 
 // The sandbox extension class for a container, or null: only enterprise
 // data and application-group containers get one (the others are reachable

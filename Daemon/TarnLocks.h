@@ -143,4 +143,58 @@ class TarnLocks {
 // The daemon's one lock manager.
 extern TarnLocks& gTarnLocks;
 
+// One global lock of gTarnLocks, read or write, held until release() or the
+// end of the scope, so that no return path or exception leaves it taken.
+class TarnGlobalLockHolder {
+  public:
+    enum class Mode { None, Read, Write };
+    explicit TarnGlobalLockHolder(Mode mode = Mode::None) {
+        if (mode == Mode::Read) readLock();
+        if (mode == Mode::Write) writeLock();
+    }
+    ~TarnGlobalLockHolder() { release(); }
+    TarnGlobalLockHolder(const TarnGlobalLockHolder&) = delete;
+    TarnGlobalLockHolder& operator=(const TarnGlobalLockHolder&) = delete;
+
+    void readLock() {
+        gTarnLocks.read_lock_all_identifiers();
+        held_ = true;
+    }
+    void writeLock() {
+        gTarnLocks.write_lock_all_identifiers();
+        held_ = true;
+    }
+    void release() {
+        if (held_) gTarnLocks.unlock_all_identifiers();
+        held_ = false;
+    }
+
+  private:
+    bool held_ = false;
+};
+
+// One identifier lock of gTarnLocks for a scope (`enabled` false: none).
+// Identifier locks must be released on the taking thread, which a scope
+// guarantees.
+class TarnScopedIdentifierLock {
+  public:
+    TarnScopedIdentifierLock(std::string identifier, bool writing, bool enabled = true)
+        : identifier_(std::move(identifier)), held_(enabled) {
+        if (!held_) return;
+        if (writing)
+            gTarnLocks.write_lock_identifier(identifier_);
+        else
+            gTarnLocks.read_lock_identifier(identifier_);
+    }
+    ~TarnScopedIdentifierLock() {
+        if (held_) gTarnLocks.unlock_identifier(identifier_);
+    }
+    TarnScopedIdentifierLock(const TarnScopedIdentifierLock&) = delete;
+    TarnScopedIdentifierLock& operator=(const TarnScopedIdentifierLock&) = delete;
+
+  private:
+    const std::string identifier_;
+    const bool held_;
+};
+
 }  // namespace tarn

@@ -53,25 +53,24 @@ std::shared_ptr<TarnClientConnection> caller(TarnUserIdentityRef user) {
                                                         std::make_shared<TarnCommandQueue>());
 }
 
+// A decoded identity is either there or a failure whose code is not success.
+template <class T>
+void checkDecoded(const TarnResult<T>& decoded) {
+    if (decoded.ok() ? !*decoded : decoded.code(TarnSuccess) == TarnSuccess) std::abort();
+}
+
 void checkConnection(const PlistValue& request, TarnClientConnection& connection) {
-    uint64_t error = TarnSuccess;
-    if (!validatedContainerIdentity(request, connection, nullptr, "ContainerClass", &error) &&
-        error == TarnSuccess)
-        std::abort();
-    error = TarnSuccess;
-    if (!concreteContainerIdentity(request, connection, {}, &error) && error == TarnSuccess)
-        std::abort();
-    error = TarnSuccess;
+    checkDecoded(validatedContainerIdentity(request, connection, nullptr, "ContainerClass"));
+    checkDecoded(concreteContainerIdentity(request, connection, {}));
     TarnConcreteIdentityKeys old{"OldIdentifier", "OldContainerClass", "OldContainerUUID",
                                  "OldPersonaUniqueString"};
-    if (!concreteContainerIdentity(request, connection, old, &error) && error == TarnSuccess)
-        std::abort();
+    checkDecoded(concreteContainerIdentity(request, connection, old));
 
     auto queued = std::make_shared<TarnCommandQueue>();
     auto fresh = TarnClientConnection::initWithClientIdentity(
         connection.clientIdentity(), true, true, true, std::nullopt, std::nullopt, queued);
     PlistValue reply{PlistDict{}};
-    error = TarnSuccess;
+    uint64_t error = TarnSuccess;
     TarnHandleStageForDeleteCommand({}, request, reply, fresh.get(), &error);
     // A refused request queues nothing.
     if ((error == TarnErrorBadInput || error == TarnErrorPersonaMismatch) &&

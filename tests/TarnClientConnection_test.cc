@@ -32,6 +32,11 @@ class TarnClientConnectionTest : public test::ScratchRootTest {
     }
 
     static uint64_t codeOf(const TarnErrorRef& e) { return e ? e->code() : TarnSuccess; }
+    // A rule's answer, with its refusal kept in *error for the checks that follow.
+    static bool passes(const TarnStatus& answer, TarnErrorRef* error) {
+        if (!answer.ok()) *error = answer.error();
+        return answer.ok();
+    }
 };
 
 TEST_F(TarnClientConnectionTest, LookupEntitlementTakesOnlyArraysOfStrings) {
@@ -72,69 +77,72 @@ TEST_F(TarnClientConnectionTest, LookupRuleGrantsInOrderAndRefusesWith55) {
         caller("com.client",
                PlistValue(PlistDict{{"appGroup", PlistValue(PlistArray{PlistValue("group.a")})}}));
     TarnErrorRef error;
-    EXPECT_TRUE(c->_passesLookupRuleForContainerClass(2, "com.client", &error)) << "own identifier";
+    EXPECT_TRUE(passes(c->_passesLookupRuleForContainerClass(2, "com.client"), &error))
+        << "own identifier";
     // A caller without a bundle identifier does not own the container named "".
-    EXPECT_FALSE(caller("")->_passesLookupRuleForContainerClass(2, "", &error));
-    EXPECT_TRUE(c->_passesLookupRuleForContainerClass(7, "group.a", &error))
+    EXPECT_FALSE(passes(caller("")->_passesLookupRuleForContainerClass(2, ""), &error));
+    EXPECT_TRUE(passes(c->_passesLookupRuleForContainerClass(7, "group.a"), &error))
         << "lookup entitlement";
-    EXPECT_FALSE(c->_passesLookupRuleForContainerClass(2, "com.other", &error));
+    EXPECT_FALSE(passes(c->_passesLookupRuleForContainerClass(2, "com.other"), &error));
     EXPECT_EQ(codeOf(error), TarnErrorNotEntitled);
     EXPECT_EQ(error->localizedDescription(),
               "com.client not entitled to retrieve container class 2 with identifier com.other");
 
     // Group lookup widens groups only, and not for the owner rule.
-    EXPECT_FALSE(c->_passesLookupRuleForContainerClass(13, "systemgroup.x", &error));
+    EXPECT_FALSE(passes(c->_passesLookupRuleForContainerClass(13, "systemgroup.x"), &error));
     c->setAllowGroupIdLookup(true);
-    EXPECT_TRUE(c->_passesLookupRuleForContainerClass(13, "systemgroup.x", &error));
-    EXPECT_TRUE(c->_passesLookupRuleForContainerClass(7, "group.b", &error));
-    EXPECT_FALSE(c->_passesLookupRuleForContainerClass(2, "com.other", &error));
-    EXPECT_FALSE(c->_passesGroupOwnerRuleForContainerClass(7, "com.owner", &error));
+    EXPECT_TRUE(passes(c->_passesLookupRuleForContainerClass(13, "systemgroup.x"), &error));
+    EXPECT_TRUE(passes(c->_passesLookupRuleForContainerClass(7, "group.b"), &error));
+    EXPECT_FALSE(passes(c->_passesLookupRuleForContainerClass(2, "com.other"), &error));
+    EXPECT_FALSE(passes(c->_passesGroupOwnerRuleForContainerClass(7, "com.owner"), &error));
     EXPECT_EQ(
         error->localizedDescription(),
         "com.client not entitled to retrieve group container class 7 with identifier com.owner");
-    EXPECT_TRUE(c->_passesGroupOwnerRuleForContainerClass(7, "com.client", &error));
+    EXPECT_TRUE(passes(c->_passesGroupOwnerRuleForContainerClass(7, "com.client"), &error));
 
     c->setAllowOtherIdLookup(true);
-    EXPECT_TRUE(c->_passesLookupRuleForContainerClass(2, "com.other", &error));
-    EXPECT_TRUE(c->_passesGroupOwnerRuleForContainerClass(7, "com.owner", &error));
+    EXPECT_TRUE(passes(c->_passesLookupRuleForContainerClass(2, "com.other"), &error));
+    EXPECT_TRUE(passes(c->_passesGroupOwnerRuleForContainerClass(7, "com.owner"), &error));
 
     auto privileged = TarnClientConnection::privilegedClientConnectionWithUserIdentity(
         TarnUserIdentityCache::defaultUserIdentity());
-    EXPECT_TRUE(privileged->_passesLookupRuleForContainerClass(12, "com.any", &error));
-    EXPECT_TRUE(privileged->_passesSystemDataGateForContainerClass(12, "com.any", &error));
+    EXPECT_TRUE(passes(privileged->_passesLookupRuleForContainerClass(12, "com.any"), &error));
+    EXPECT_TRUE(passes(privileged->_passesSystemDataGateForContainerClass(12, "com.any"), &error));
     TarnClientConnection anonymous;
     EXPECT_TRUE(anonymous.unrestricted());
     EXPECT_FALSE(anonymous.allowOtherIdLookup());
-    EXPECT_TRUE(anonymous._passesLookupRuleForContainerClass(2, "com.any", &error));
+    EXPECT_TRUE(passes(anonymous._passesLookupRuleForContainerClass(2, "com.any"), &error));
 }
 
 TEST_F(TarnClientConnectionTest, OwnSystemContainerNeedsTheSignatureOrTheList) {
     auto c = caller("com.ostrea.daemonish");
     TarnErrorRef error;
     // The first gate passes on the own identifier; the second does not without a mapping entry.
-    EXPECT_TRUE(c->_passesLookupRuleForContainerClass(12, "com.ostrea.daemonish", &error));
-    EXPECT_FALSE(c->_passesSystemDataGateForContainerClass(12, "com.ostrea.daemonish", &error));
+    EXPECT_TRUE(passes(c->_passesLookupRuleForContainerClass(12, "com.ostrea.daemonish"), &error));
+    EXPECT_FALSE(
+        passes(c->_passesSystemDataGateForContainerClass(12, "com.ostrea.daemonish"), &error));
     EXPECT_EQ(codeOf(error), TarnErrorNotEntitled);
     EXPECT_EQ(error->localizedDescription(),
               "com.ostrea.daemonish not entitled for system container with identifier "
               "com.ostrea.daemonish");
-    EXPECT_TRUE(c->_passesSystemDataGateForContainerClass(2, "com.ostrea.daemonish", &error))
+    EXPECT_TRUE(
+        passes(c->_passesSystemDataGateForContainerClass(2, "com.ostrea.daemonish"), &error))
         << "only class 12 has the second gate";
 
     auto entitled = caller(
         "com.client",
         PlistValue(PlistDict{{"systemData", PlistValue(PlistArray{PlistValue("com.sys")})}}));
-    EXPECT_TRUE(entitled->_passesSystemDataGateForContainerClass(12, "com.sys", &error));
+    EXPECT_TRUE(passes(entitled->_passesSystemDataGateForContainerClass(12, "com.sys"), &error));
 }
 
 TEST_F(TarnClientConnectionTest, CompleteRunsTheCommandQueue) {
     struct Counting : TarnCommand {
         explicit Counting(int* n, bool ok) : n(n), ok(ok) {}
         uint64_t command() const override { return 99; }
-        bool fromQueue(TarnCommandQueue*, uint64_t* error) override {
+        TarnStatus fromQueue(TarnCommandQueue*) override {
             ++*n;
-            if (!ok) *error = TarnErrorDestroyFailed;
-            return ok;
+            if (!ok) return TARN_ERROR_CODE(TarnErrorDestroyFailed, nullptr);
+            return {};
         }
         int* n;
         bool ok;
@@ -149,10 +157,10 @@ TEST_F(TarnClientConnectionTest, CompleteRunsTheCommandQueue) {
     EXPECT_EQ(error, TarnErrorDestroyFailed);
     EXPECT_EQ(ran, 2);
 
-    // A command that throws fails with 40 and stops the run like any failure.
+    // A command that throws fails with TarnErrorException and stops the run like any failure.
     struct Throwing : TarnCommand {
         uint64_t command() const override { return 97; }
-        bool fromQueue(TarnCommandQueue*, uint64_t*) override { throw std::runtime_error("boom"); }
+        TarnStatus fromQueue(TarnCommandQueue*) override { throw std::runtime_error("boom"); }
     };
     PlatformLogSetQuiet(true);
     const HostConfiguration saved = HostConfiguration::shared();

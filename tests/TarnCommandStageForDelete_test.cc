@@ -18,12 +18,14 @@
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/Failpoints.h"
 #include "Platform/PlatformLog.h"
+#include "support/ResultCode.h"
 #include "support/ScratchRoot.h"
 
 namespace tarn {
 namespace {
 
 namespace fs = std::filesystem;
+using test::withCode;
 
 constexpr const char* kLibrary = "/private/var/root/Library/TarnKeeper";
 
@@ -31,10 +33,9 @@ constexpr const char* kLibrary = "/private/var/root/Library/TarnKeeper";
 class FailingCommand : public TarnCommand {
   public:
     uint64_t command() const override { return 99; }
-    bool fromQueue(TarnCommandQueue*, uint64_t* error) override {
+    TarnStatus fromQueue(TarnCommandQueue*) override {
         ++runs;
-        TarnSetError(error, TarnErrorCacheRemoveFailed);
-        return false;
+        return TARN_ERROR_CODE(TarnErrorCacheRemoveFailed, nullptr);
     }
     int runs = 0;
 };
@@ -69,15 +70,19 @@ class TarnCommandStageForDeleteTest : public test::ScratchRootTest {
     TarnMetadataRef create(const std::string& identifier, TarnContainerClass containerClass,
                            bool transient = false) {
         uint64_t code = TarnSuccess;
-        auto made = connection_.createOrLookupContainerWithContainerIdentity(
-            identity(identifier, containerClass), true, transient, true, &code);
+        TarnMetadataRef made =
+            withCode(connection_.createOrLookupContainerWithContainerIdentity(
+                         identity(identifier, containerClass), true, transient, true),
+                     &code)
+                .valueOr(nullptr);
         EXPECT_TRUE(made) << code;
         return made;
     }
     bool cached(const std::string& identifier, TarnContainerClass containerClass) {
-        uint64_t code = TarnSuccess;
-        return connection_.createOrLookupContainerWithContainerIdentity(
-                   identity(identifier, containerClass), false, false, true, &code) != nullptr;
+        return connection_
+                   .createOrLookupContainerWithContainerIdentity(
+                       identity(identifier, containerClass), false, false, true)
+                   .valueOr(nullptr) != nullptr;
     }
     static FileURL deathRowItem(const TarnMetadataRef& m) {
         return PathJoin(TarnGlobalConfiguration::sharedInstance().deathrowDirectory(),
@@ -110,14 +115,13 @@ class TarnCommandStageForDeleteTest : public test::ScratchRootTest {
 TEST_F(TarnCommandStageForDeleteTest, DeletionIsQueuedAndStagesTheContainerOnDeathRow) {
     auto made = create("com.example.doomed", 2);
     ASSERT_TRUE(made);
-    uint64_t code = 0;
-    connection_.deleteContainerWithContainerIdentity(identity("com.example.doomed", 2), false,
-                                                     &code);
-    EXPECT_EQ(code, TarnSuccess);
+    TarnStatus queued =
+        connection_.deleteContainerWithContainerIdentity(identity("com.example.doomed", 2), false);
+    EXPECT_TRUE(queued.ok()) << queued.code(TarnSuccess);
     EXPECT_TRUE(fs::exists(made->url())) << "nothing happens before the queue runs";
     EXPECT_EQ(connection_.commandQueue()->TEST_count(), 1u);
 
-    code = TarnSuccess;
+    uint64_t code = TarnSuccess;
     EXPECT_TRUE(connection_.completeWithError(&code));
     EXPECT_EQ(code, TarnSuccess);
     EXPECT_FALSE(fs::exists(made->url()));
@@ -126,8 +130,9 @@ TEST_F(TarnCommandStageForDeleteTest, DeletionIsQueuedAndStagesTheContainerOnDea
 
     // Deleting what is not there queues nothing.
     code = TarnSuccess;
-    connection_.deleteContainerWithContainerIdentity(identity("com.example.doomed", 2), false,
-                                                     &code);
+    (void)withCode(
+        connection_.deleteContainerWithContainerIdentity(identity("com.example.doomed", 2), false),
+        &code);
     EXPECT_EQ(code, TarnErrorNotFound);
     EXPECT_EQ(connection_.commandQueue()->TEST_count(), 0u);
 }
@@ -147,9 +152,8 @@ TEST_F(TarnCommandStageForDeleteTest, ContainersAlreadyGoneAreSkippedWithoutFail
         stage({identity("com.example.vanished", 2), neverMade}, [&](uint64_t) { called = true; });
     TarnCommandQueue queue;
     queue.insertCommand(command);
-    uint64_t code = TarnSuccess;
-    EXPECT_TRUE(queue.executeAllUntilExhaustedOrError(&code));
-    EXPECT_EQ(code, TarnSuccess);
+    TarnStatus ran = queue.executeAllUntilExhaustedOrError();
+    EXPECT_TRUE(ran.ok()) << ran.code(TarnSuccess);
     EXPECT_FALSE(called);
     EXPECT_TRUE(fs::exists(kept->url()));
 }
@@ -162,8 +166,7 @@ TEST_F(TarnCommandStageForDeleteTest, AFailedRenameFallsBackToRemovalInPlace) {
     ASSERT_TRUE(FailpointSet("fm.move", "errno:13"));
     TarnCommandQueue queue;
     queue.insertCommand(stage({moved->containerIdentity()}));
-    uint64_t code = TarnSuccess;
-    EXPECT_TRUE(queue.executeAllUntilExhaustedOrError(&code));
+    EXPECT_TRUE(queue.executeAllUntilExhaustedOrError().ok());
     EXPECT_FALSE(fs::exists(moved->url()));
     EXPECT_FALSE(fs::exists(deathRowItem(moved)));
     EXPECT_FALSE(cached("com.example.fallback", 2));
@@ -171,7 +174,7 @@ TEST_F(TarnCommandStageForDeleteTest, AFailedRenameFallsBackToRemovalInPlace) {
     // Neither rename nor removal works: logged only, the container stays live and cached.
     ASSERT_TRUE(FailpointSet("fm.remove", "errno:1"));
     queue.insertCommand(stage({stuck->containerIdentity()}));
-    EXPECT_TRUE(queue.executeAllUntilExhaustedOrError(&code));
+    EXPECT_TRUE(queue.executeAllUntilExhaustedOrError().ok());
     FailpointClearAll();
     EXPECT_TRUE(fs::exists(stuck->url()));
     EXPECT_TRUE(cached("com.example.stuck", 2));
@@ -204,15 +207,14 @@ TEST_F(TarnCommandStageForDeleteTest, BundlesTakeTheirCodeSigningRecordsUnlessAP
     // The transient copy goes; the permanent one still needs the records.
     TarnCommandQueue queue;
     queue.insertCommand(stage({transient->containerIdentity()}));
-    uint64_t code = TarnSuccess;
-    EXPECT_TRUE(queue.executeAllUntilExhaustedOrError(&code));
+    EXPECT_TRUE(queue.executeAllUntilExhaustedOrError().ok());
     EXPECT_FALSE(fs::exists(transient->url()));
     EXPECT_TRUE(stored("com.example.app"));
     EXPECT_TRUE(stored("com.example.app.widget"));
 
     // The permanent one goes, and its records and its children's with it.
     queue.insertCommand(stage({identity("com.example.app", 1)}));
-    EXPECT_TRUE(queue.executeAllUntilExhaustedOrError(&code));
+    EXPECT_TRUE(queue.executeAllUntilExhaustedOrError().ok());
     EXPECT_FALSE(fs::exists(permanent->url()));
     EXPECT_FALSE(stored("com.example.app"));
     EXPECT_FALSE(stored("com.example.app.widget"));

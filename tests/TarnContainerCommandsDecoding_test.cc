@@ -8,10 +8,13 @@
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/HostConfiguration.h"
 #include "Platform/Sandbox.h"
+#include "support/ResultCode.h"
 #include "support/ScratchRoot.h"
 
 namespace tarn {
 namespace {
+
+using tarn::test::withCode;
 
 class ContainerCommandsDecodingTest : public test::ScratchRootTest {
   protected:
@@ -69,7 +72,7 @@ TEST_F(ContainerCommandsDecodingTest, CallerWithoutPersonaActsForTheApplications
     struct Case {
         const char* identifier;
         TarnContainerClass containerClass;
-        const char* expected;  // persona unique string; nullptr: error 76
+        const char* expected;  // persona unique string; nullptr: TarnErrorPersonaMismatch
     } cases[] = {
         {"com.e1.app", 2, "E1"},  {"com.unlisted", 7, "P"},
         {"com.uni", 2, "P"},       // listed everywhere: the caller's own (unspecific) identity
@@ -78,8 +81,11 @@ TEST_F(ContainerCommandsDecodingTest, CallerWithoutPersonaActsForTheApplications
     };
     for (const Case& c : cases) {
         uint64_t error = TarnSuccess;
-        TarnUserIdentityRef user = userIdentityForContainerIdentifier(
-            *anyPersona, std::string(c.identifier), c.containerClass, &error);
+        TarnUserIdentityRef user =
+            withCode(userIdentityForContainerIdentifier(*anyPersona, std::string(c.identifier),
+                                                        c.containerClass),
+                     &error)
+                .valueOr(nullptr);
         if (!c.expected) {
             EXPECT_FALSE(user) << c.identifier;
             EXPECT_EQ(error, TarnErrorPersonaMismatch) << c.identifier;
@@ -93,13 +99,16 @@ TEST_F(ContainerCommandsDecodingTest, CallerWithoutPersonaActsForTheApplications
     // A caller of a specific persona always acts for it.
     uint64_t error = TarnSuccess;
     auto e1 = caller(persona("E1"));
-    EXPECT_EQ(
-        userIdentityForContainerIdentifier(*e1, std::string("com.both"), 2, &error)->identifier(),
-        "E1");
+    EXPECT_EQ(withCode(userIdentityForContainerIdentifier(*e1, std::string("com.both"), 2), &error)
+                  .valueOr(nullptr)
+                  ->identifier(),
+              "E1");
     auto anonymous = TarnClientConnection::initWithClientIdentity(
         nullptr, false, false, false, std::nullopt, std::nullopt,
         std::make_shared<TarnCommandQueue>());
-    EXPECT_FALSE(userIdentityForContainerIdentifier(*anonymous, std::string("x"), 2, &error));
+    EXPECT_FALSE(
+        withCode(userIdentityForContainerIdentifier(*anonymous, std::string("x"), 2), &error)
+            .valueOr(nullptr));
     EXPECT_EQ(error, TarnErrorPersonaMismatch);
 }
 
@@ -107,19 +116,25 @@ TEST_F(ContainerCommandsDecodingTest, PersonaStringMustBeOneTheCallerMayActFor) 
     auto anyPersona = caller(cache().unspecificUserIdentity());
     auto e1 = caller(persona("E1"));
     uint64_t error = TarnSuccess;
-    EXPECT_EQ(
-        userIdentityForPersonaUniqueString(*anyPersona, std::string("E2"), &error)->identifier(),
-        "E2");
-    EXPECT_TRUE(userIdentityForPersonaUniqueString(*anyPersona, std::nullopt, &error)
+    EXPECT_EQ(withCode(userIdentityForPersonaUniqueString(*anyPersona, std::string("E2")), &error)
+                  .valueOr(nullptr)
+                  ->identifier(),
+              "E2");
+    EXPECT_TRUE(withCode(userIdentityForPersonaUniqueString(*anyPersona, std::nullopt), &error)
+                    .valueOr(nullptr)
                     ->isNoSpecificPersona());
-    EXPECT_EQ(userIdentityForPersonaUniqueString(*e1, std::string("E1"), &error)->identifier(),
+    EXPECT_EQ(withCode(userIdentityForPersonaUniqueString(*e1, std::string("E1")), &error)
+                  .valueOr(nullptr)
+                  ->identifier(),
               "E1");
     EXPECT_EQ(error, TarnSuccess);
 
     for (auto [connection, unique] :
          {std::pair{e1, "E2"}, std::pair{e1, "NOPE"}, std::pair{anyPersona, "NOPE"}}) {
         error = TarnSuccess;
-        EXPECT_FALSE(userIdentityForPersonaUniqueString(*connection, std::string(unique), &error))
+        EXPECT_FALSE(
+            withCode(userIdentityForPersonaUniqueString(*connection, std::string(unique)), &error)
+                .valueOr(nullptr))
             << unique;
         EXPECT_EQ(error, TarnErrorPersonaMismatch) << unique;
     }
@@ -129,7 +144,9 @@ TEST_F(ContainerCommandsDecodingTest, PersonaStringMustBeOneTheCallerMayActFor) 
     host.multiUserFlags = 0x80000000u;
     HostConfiguration::TEST_setShared(host);
     error = TarnSuccess;
-    EXPECT_EQ(userIdentityForPersonaUniqueString(*e1, std::string("NOPE"), &error)->identifier(),
+    EXPECT_EQ(withCode(userIdentityForPersonaUniqueString(*e1, std::string("NOPE")), &error)
+                  .valueOr(nullptr)
+                  ->identifier(),
               "E1");
     EXPECT_EQ(error, TarnSuccess);
 }
@@ -137,8 +154,11 @@ TEST_F(ContainerCommandsDecodingTest, PersonaStringMustBeOneTheCallerMayActFor) 
 TEST_F(ContainerCommandsDecodingTest, IdentitiesFromRequests) {
     auto c = caller(persona("E1"));
     uint64_t error = TarnSuccess;
-    auto own = validatedContainerIdentity(request({{"ContainerClass", PlistValue(uint64_t{2})}}),
-                                          *c, nullptr, "ContainerClass", &error);
+    auto own =
+        withCode(validatedContainerIdentity(request({{"ContainerClass", PlistValue(uint64_t{2})}}),
+                                            *c, nullptr, "ContainerClass"),
+                 &error)
+            .valueOr(nullptr);
     ASSERT_TRUE(own);
     EXPECT_EQ(own->identifier(), "com.caller") << "defaults to the caller";
     EXPECT_EQ(own->userIdentity()->identifier(), "E1");
@@ -150,18 +170,22 @@ TEST_F(ContainerCommandsDecodingTest, IdentitiesFromRequests) {
     } validated[] = {
         {{{"Identifier", PlistValue(uint64_t{5})}, {"ContainerClass", PlistValue(uint64_t{2})}},
          nullptr,
-         18},
-        {{{"ContainerClass", PlistValue(uint64_t{2})}}, "Identifier", 18},
-        {{{"Identifier", PlistValue("a")}}, nullptr, 20},
+         TarnErrorMissingIdentifier},
+        {{{"ContainerClass", PlistValue(uint64_t{2})}}, "Identifier", TarnErrorMissingIdentifier},
+        {{{"Identifier", PlistValue("a")}}, nullptr, TarnErrorInvalidContainerClass},
         {{{"Identifier", PlistValue("a")}, {"ContainerClass", PlistValue(uint64_t{14})}},
          nullptr,
-         20},
-        {{{"Identifier", PlistValue("a")}, {"ContainerClass", PlistValue("2")}}, nullptr, 20},
+         TarnErrorInvalidContainerClass},
+        {{{"Identifier", PlistValue("a")}, {"ContainerClass", PlistValue("2")}},
+         nullptr,
+         TarnErrorInvalidContainerClass},
     };
     for (auto& v : validated) {
         error = TarnSuccess;
-        EXPECT_FALSE(validatedContainerIdentity(request(v.keys), *c, v.identifierKey,
-                                                "ContainerClass", &error));
+        EXPECT_FALSE(withCode(validatedContainerIdentity(request(v.keys), *c, v.identifierKey,
+                                                         "ContainerClass"),
+                              &error)
+                         .valueOr(nullptr));
         EXPECT_EQ(error, v.expected) << request(v.keys).description();
     }
 
@@ -170,43 +194,45 @@ TEST_F(ContainerCommandsDecodingTest, IdentitiesFromRequests) {
         PlistDict keys;
         uint64_t expected;
     } concrete[] = {
-        {{{"ContainerClass", PlistValue(uint64_t{2})}, {"UUID", PlistValue(uuid)}}, 18},
+        {{{"ContainerClass", PlistValue(uint64_t{2})}, {"UUID", PlistValue(uuid)}},
+         TarnErrorMissingIdentifier},
         // The decoder does not range-check: the identity refuses class 14 as an argument.
         {{{"Identifier", PlistValue("a")},
           {"ContainerClass", PlistValue(uint64_t{14})},
           {"UUID", PlistValue(uuid)},
           {"PersonaUniqueString", PlistValue("E1")}},
-         11},
+         TarnErrorInvalidArgument},
         {{{"Identifier", PlistValue("a")},
           {"ContainerClass", PlistValue(uint64_t{2})},
           {"UUID", PlistValue(uuid.string())},
           {"PersonaUniqueString", PlistValue("E1")}},
-         11},
+         TarnErrorInvalidArgument},
         // An enterprise caller must name its persona: none means "no specific persona".
         {{{"Identifier", PlistValue("a")},
           {"ContainerClass", PlistValue(uint64_t{2})},
           {"UUID", PlistValue(uuid)}},
-         76},
+         TarnErrorPersonaMismatch},
         {{{"Identifier", PlistValue("a")},
           {"ContainerClass", PlistValue(uint64_t{2})},
           {"UUID", PlistValue(uuid)},
           {"PersonaUniqueString", PlistValue("E2")}},
-         76},
+         TarnErrorPersonaMismatch},
         {{{"Identifier", PlistValue("a")},
           {"ContainerClass", PlistValue(uint64_t{2})},
           {"UUID", PlistValue(uuid)},
           {"PersonaUniqueString", PlistValue("E1")}},
-         1},
+         TarnSuccess},
         // Global classes ignore the persona string.
         {{{"Identifier", PlistValue("a")},
           {"ContainerClass", PlistValue(uint64_t{12})},
           {"UUID", PlistValue(uuid)},
           {"PersonaUniqueString", PlistValue("NOPE")}},
-         1},
+         TarnSuccess},
     };
     for (auto& v : concrete) {
         error = TarnSuccess;
-        auto identity = concreteContainerIdentity(request(v.keys), *c, {}, &error);
+        auto identity =
+            withCode(concreteContainerIdentity(request(v.keys), *c, {}), &error).valueOr(nullptr);
         EXPECT_EQ(error, v.expected) << request(v.keys).description();
         EXPECT_EQ(bool(identity), v.expected == TarnSuccess);
         if (identity) {
@@ -261,15 +287,17 @@ TEST_F(ContainerCommandsDecodingTest, TokensOnlyForSandboxedCallersOfEnterpriseC
 TEST_F(ContainerCommandsDecodingTest, DeathRowCommandRunsQueuedWorkFirst) {
     struct Failing : TarnCommand {
         uint64_t command() const override { return 99; }
-        bool fromQueue(TarnCommandQueue*, uint64_t* error) override {
-            *error = TarnErrorCacheRemoveFailed;
-            return false;
+        TarnStatus fromQueue(TarnCommandQueue*) override {
+            return TARN_ERROR_CODE(TarnErrorCacheRemoveFailed, nullptr);
         }
     };
     struct Counting : TarnCommand {
         explicit Counting(int* n) : n(n) {}
         uint64_t command() const override { return 98; }
-        bool fromQueue(TarnCommandQueue*, uint64_t*) override { return ++*n, true; }
+        TarnStatus fromQueue(TarnCommandQueue*) override {
+            ++*n;
+            return {};
+        }
         int* n;
     };
     int laterRan = 0;

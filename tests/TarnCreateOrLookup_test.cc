@@ -22,10 +22,13 @@
 #include "Platform/Failpoints.h"
 #include "Platform/PlatformLog.h"
 #include "Platform/SandboxUserState.h"
+#include "support/ResultCode.h"
 #include "support/ScratchRoot.h"
 
 namespace tarn {
 namespace {
+
+using tarn::test::withCode;
 
 namespace fs = std::filesystem;
 
@@ -59,8 +62,10 @@ class TarnCreateOrLookupTest : public test::ScratchRootTest {
     TarnMetadataRef create(const TarnContainerIdentityRef& id, bool transient = false,
                            uint64_t* code = nullptr) {
         uint64_t ignored = TarnSuccess;
-        return connection_.createOrLookupContainerWithContainerIdentity(id, true, transient, true,
-                                                                        code ? code : &ignored);
+        return withCode(connection_.createOrLookupContainerWithContainerIdentity(
+                            id, /*createIfNecessary=*/true, transient, /*useLocking=*/true),
+                        code ? code : &ignored)
+            .valueOr(nullptr);
     }
 
     static size_t entriesIn(const FileURL& dir) {
@@ -103,8 +108,9 @@ struct stat statOf(const FileURL& url) {
 TEST_F(TarnCreateOrLookupTest, LookupOfAMissingContainerFailsWith21AndLeavesNothingBehind) {
     for (bool transient : {false, true}) {
         uint64_t code = TarnSuccess;
-        EXPECT_FALSE(connection_.createOrLookupContainerWithContainerIdentity(
-            identity("com.example.missing", 2), false, transient, true, &code));
+        EXPECT_FALSE(withCode(connection_.createOrLookupContainerWithContainerIdentity(
+                                  identity("com.example.missing", 2), false, transient, true),
+                              &code));
         EXPECT_EQ(code, TarnErrorNotFound) << "transient " << transient;
     }
     EXPECT_EQ(directoriesIn(stagingFor(2)), 0u);
@@ -112,10 +118,11 @@ TEST_F(TarnCreateOrLookupTest, LookupOfAMissingContainerFailsWith21AndLeavesNoth
     EXPECT_EQ(entriesIn(liveFor(2, true)), 0u);
 
     uint64_t code = TarnSuccess;
-    EXPECT_FALSE(connection_.createOrLookupContainerWithContainerIdentity(nullptr, true, false,
-                                                                          true, &code));
+    EXPECT_FALSE(withCode(
+        connection_.createOrLookupContainerWithContainerIdentity(nullptr, true, false, true),
+        &code));
     EXPECT_EQ(code, TarnErrorBadInput);
-    EXPECT_FALSE(connection_.containersWithClass(14, false, &code));
+    EXPECT_FALSE(withCode(connection_.containersWithClass(14, false), &code));
     EXPECT_EQ(code, TarnErrorInvalidArgument);
 }
 
@@ -173,7 +180,7 @@ TEST_F(TarnCreateOrLookupTest, NewContainersAreStagedThenLiveWithTheirClassesOwn
     }
 
     uint64_t code = TarnSuccess;
-    auto listed = connection_.containersWithClass(2, false, &code);
+    auto listed = withCode(connection_.containersWithClass(2, false), &code);
     ASSERT_TRUE(listed) << code;
     ASSERT_EQ(listed->size(), 1u);
     EXPECT_EQ(listed->front()->identifier(), "com.example.owners2");
@@ -225,8 +232,10 @@ TEST_F(TarnCreateOrLookupTest, ConcurrentCreationsOfOneIdentityMakeOneContainer)
                 TarnClientConnection connection;
                 uint64_t code = TarnSuccess;
                 start.arrive_and_wait();
-                results[i] = connection.createOrLookupContainerWithContainerIdentity(
-                    id, true, false, true, &code);
+                results[i] = withCode(connection.createOrLookupContainerWithContainerIdentity(
+                                          id, true, false, true),
+                                      &code)
+                                 .valueOr(nullptr);
             });
         for (auto& t : threads) t.join();
         ASSERT_TRUE(results[0] && results[1]);
@@ -255,8 +264,8 @@ TEST_F(TarnCreateOrLookupTest, TransientContainersAreMadeAnewAndTheOldOneGoesToD
 
     // A transient container is invisible to plain lookups.
     uint64_t code = TarnSuccess;
-    EXPECT_FALSE(
-        connection_.createOrLookupContainerWithContainerIdentity(id, false, false, true, &code));
+    EXPECT_FALSE(withCode(
+        connection_.createOrLookupContainerWithContainerIdentity(id, false, false, true), &code));
     EXPECT_EQ(code, TarnErrorNotFound);
     TarnDeathRowQueue()->resume();
 }
@@ -316,8 +325,9 @@ TEST_F(TarnCreateOrLookupTest, AFailureAfterStagingLeavesNoHalfBuiltContainer) {
             EXPECT_EQ(directoriesIn(stagingFor(c.containerClass)), 0u);
         }
         code = TarnSuccess;
-        EXPECT_FALSE(connection_.createOrLookupContainerWithContainerIdentity(id, false, false,
-                                                                              true, &code));
+        EXPECT_FALSE(withCode(
+            connection_.createOrLookupContainerWithContainerIdentity(id, false, false, true),
+            &code));
         EXPECT_EQ(code, TarnErrorNotFound);
     }
 }

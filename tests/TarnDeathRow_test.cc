@@ -59,11 +59,10 @@ class TarnDeathRowTest : public test::ScratchRootTest {
 };
 
 TEST_F(TarnDeathRowTest, SameNamesGetTheirOwnSlotsAndAPassDestroysThem) {
-    TarnErrorRef error;
     FileURL a = makeItem("one/Data");
     FileURL b = makeItem("two/Data");
-    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(a, true, false, &error));
-    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(b, true, false, &error));
+    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(a, true, false).ok());
+    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(b, true, false).ok());
     EXPECT_FALSE(fs::exists(a));
     EXPECT_EQ(deathRowCount(), 2u);
     EXPECT_EQ(pass(), TarnSuccess);
@@ -71,17 +70,16 @@ TEST_F(TarnDeathRowTest, SameNamesGetTheirOwnSlotsAndAPassDestroysThem) {
 }
 
 TEST_F(TarnDeathRowTest, MovingSomethingAlreadyGoneSucceedsWithoutAPass) {
-    TarnErrorRef error;
     uint64_t before = Transaction::openCount();
-    EXPECT_TRUE(connection_._moveItemAtURLToDeathRow(root_.at("/private/var/mobile/nothing"), true,
-                                                     true, &error));
+    EXPECT_TRUE(
+        connection_._moveItemAtURLToDeathRow(root_.at("/private/var/mobile/nothing"), true, true)
+            .ok());
     EXPECT_EQ(Transaction::openCount(), before) << "no pass was queued";
     EXPECT_EQ(pass(), TarnSuccess);
 }
 
 TEST_F(TarnDeathRowTest, UndeletableItemIsMovedToTmp) {
-    TarnErrorRef error;
-    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(makeItem("stuck"), true, false, &error));
+    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(makeItem("stuck"), true, false).ok());
     // An item that resists removal (as an immutable file on a file system
     // that cannot clear the flag would).
     ASSERT_TRUE(FailpointSet("fm.remove", "errno:1@1"));
@@ -110,8 +108,7 @@ TEST_F(TarnDeathRowTest, AnUndeletableItemNeverReplacesWhatTmpHolds) {
 // Where /tmp is another volume the item stays on death row: a copy there
 // would be made again by every pass, as its source cannot be removed either.
 TEST_F(TarnDeathRowTest, AnUndeletableItemIsNeverCopiedToTmp) {
-    TarnErrorRef error;
-    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(makeItem("stuck"), true, false, &error));
+    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(makeItem("stuck"), true, false).ok());
     ASSERT_TRUE(FailpointSet("fm.remove", "errno:1"));
     ASSERT_TRUE(FailpointSet("fm.move", "errno:18"));  // EXDEV
     EXPECT_EQ(pass(), TarnErrorDestroyFailed);
@@ -125,8 +122,7 @@ TEST_F(TarnDeathRowTest, AnUndeletableItemIsNeverCopiedToTmp) {
 
 // A /tmp that is missing and cannot be made is a failure, not "already gone".
 TEST_F(TarnDeathRowTest, AMissingTmpIsNotTakenForAGoneItem) {
-    TarnErrorRef error;
-    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(makeItem("stuck"), true, false, &error));
+    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(makeItem("stuck"), true, false).ok());
     fs::remove_all(root_.at("/tmp"));
     ASSERT_TRUE(FailpointSet("fm.remove", "errno:1"));
     ASSERT_TRUE(FailpointSet("fm.createDirectory", "errno:13"));
@@ -137,9 +133,8 @@ TEST_F(TarnDeathRowTest, AMissingTmpIsNotTakenForAGoneItem) {
 }
 
 TEST_F(TarnDeathRowTest, ItemThatCanBeNeitherRemovedNorMovedStaysAndThePassGoesOn) {
-    TarnErrorRef error;
     for (const char* name : {"a", "b", "c"})
-        ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(makeItem(name), true, false, &error));
+        ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(makeItem(name), true, false).ok());
     ASSERT_TRUE(FailpointSet("fm.remove", "errno:1@1"));
     ASSERT_TRUE(FailpointSet("fm.move", "errno:16@1"));
     EXPECT_EQ(pass(), TarnErrorDestroyFailed);
@@ -151,8 +146,7 @@ TEST_F(TarnDeathRowTest, ItemThatCanBeNeitherRemovedNorMovedStaysAndThePassGoesO
 
 TEST_F(TarnDeathRowTest, PassesRunOneAfterAnotherUnderATransaction) {
     ASSERT_TRUE(FailpointSet("fm.remove", "sleep:200@1"));
-    TarnErrorRef error;
-    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(makeItem("slow"), true, false, &error));
+    ASSERT_TRUE(connection_._moveItemAtURLToDeathRow(makeItem("slow"), true, false).ok());
     std::promise<void> first;
     connection_.deleteContainersOnDeathRowWithCompletion([&](uint64_t) { first.set_value(); });
     EXPECT_GE(Transaction::openCount(), 1u);
