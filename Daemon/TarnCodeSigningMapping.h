@@ -105,7 +105,7 @@ public:
     std::optional<PlistDict> entitlementsForIdentifier(const std::string& identifier);
     // The code-signing info as a client may see it (external view); empty when none.
     std::optional<PlistDict> getCodeSigningInfoForIdentifier(const std::string& identifier);
-    // The stored entry (never empty), or 67 when there is none.
+    // The stored entry (never empty), or TarnErrorDatabaseNotFound when there is none.
     TarnResult<TarnCodeSigningEntryRef> codeSigningEntryForIdentifier(const std::string& identifier);
     std::optional<std::vector<std::string>> appGroupIdentifiersForIdentifier(const std::string& identifier);
     // Only identifiers with the "systemgroup." prefix.
@@ -158,7 +158,7 @@ public:
 
     // ---- on the queue ----
 
-    // Logs a failure other than 67 before answering it.
+    // Logs a failure other than TarnErrorDatabaseNotFound before answering it.
     TarnResult<TarnCodeSigningEntryRef> _onQueue_codeSigningEntryForIdentifier(const std::string& identifier);
     std::optional<PlistDict> _onQueue_codeSigningInfoForIdentifier(const std::string& identifier,
                                                                    bool externalRequest);
@@ -179,7 +179,7 @@ public:
                                          const GroupIdsBlock& forAllIdentifiersUsingBlock);
     // Writes each entry under its identifier, deleting where the entry has no
     // info; a read failure ends the batch, and a failed write is logged and
-    // skipped (neither fails the batch). 60 when the counts differ.
+    // skipped (neither fails the batch). TarnErrorMismatchedInput when the counts differ.
     TarnStatus _onQueue_setCodeSigningDictionaryValues(const std::vector<TarnCodeSigningEntryRef>& values,
                                                        const std::vector<std::string>& forIdentifiers);
     // Imports "tarn_code_signing_info.plist" from the library directory.
@@ -201,7 +201,7 @@ private:
 };
 
 // Command 19: answers "ReplyInfoDictionary" with the external view of the
-// identifier's code-signing info, or fails with 21 when there is none.
+// identifier's code-signing info, or fails with TarnErrorNotFound when there is none.
 void TarnHandleGetCodeSigningInfoCommand(const TarnRequestContext& context,
                                          const PlistValue& request, PlistValue& reply,
                                          TarnClientConnection* connection, uint64_t* error);

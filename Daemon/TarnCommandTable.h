@@ -14,7 +14,7 @@ namespace tarn {
 class TarnClientConnection;
 
 // A handler writes reply keys into `reply` and, on failure, a code into *error
-// (the request's error slot: 1 until something fails). It never sends the
+// (the request's error slot: TarnSuccess until something fails). It never sends the
 // reply itself unless its row has replyOnReturn 0; then, once it has started
 // its operation, the operation's completion answers through
 // context.deferredReply.

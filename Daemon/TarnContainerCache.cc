@@ -507,7 +507,7 @@ TarnResult<TarnMetadataRef> TarnContainerCache::containerForContainerIdentity(
     const TarnContainerIdentityRef& identity, bool transient, bool updateSandbox,
     bool allowKernelLookup) {
     assertNotOnMappingQueue();
-    // A boundary: its callers read an exception as error 40 of the look-up.
+    // A boundary: its callers read an exception as TarnErrorException of the look-up.
     return TarnFenceExceptions(kLookupOperation, [&] {
         return _containerForContainerIdentity(identity, transient, updateSandbox,
                                               allowKernelLookup);
@@ -626,7 +626,7 @@ TarnResult<std::vector<TarnMetadataRef>> TarnContainerCache::allContainersForUse
     const char* marker = transientMarker(transient);
     const char* const operation = __func__;  // inside the fenced body __func__ is the lambda's
     // A boundary, as the look-up is: an exception while the dictionaries are
-    // read or built is error 40 of this operation.
+    // read or built is TarnErrorException of this operation.
     TarnResult<std::vector<TarnMetadataRef>> gathered =
         TarnFenceExceptions(operation, [&]() -> TarnResult<std::vector<TarnMetadataRef>> {
             std::vector<TarnMetadataRef> all;

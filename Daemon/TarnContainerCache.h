@@ -92,9 +92,11 @@ class TarnContainerCache : public TarnUserIdentityCacheObserver,
 
     // ---- Lookups ----
 
-    // The container's metadata (never null), or the error: 21 not found, 43
-    // rebuild failed, 44 found but its metadata file is gone (the entry is
-    // dropped; the next lookup answers 21), 47 bad URL, 40 exception.
+    // The container's metadata (never null), or the error: TarnErrorNotFound,
+    // TarnErrorCacheRebuildFailed, TarnErrorCacheInconsistent when found but its
+    // metadata file is gone (the entry is dropped; the next lookup answers
+    // TarnErrorNotFound), TarnErrorCacheInvalidInput for a bad URL,
+    // TarnErrorException.
     // `updateSandbox`: a rebuild may push mappings; `allowKernelLookup`: an
     // unscanned class may be answered from the sandbox state (non-transient only).
     TarnResult<TarnMetadataRef> containerForContainerIdentity(
@@ -108,8 +110,8 @@ class TarnContainerCache : public TarnUserIdentityCacheObserver,
 
     // Every container of the class (of every accessible identity for the
     // unspecific one). Entries whose metadata file is gone are left out and
-    // dropped. Order unspecified. Errors: 47 bad class, 43 rebuild failed,
-    // 40 exception.
+    // dropped. Order unspecified. Errors: TarnErrorCacheInvalidInput for a bad
+    // class, TarnErrorCacheRebuildFailed, TarnErrorException.
     TarnResult<std::vector<TarnMetadataRef>> allContainersForUserIdentity(
         const TarnUserIdentityRef& userIdentity, TarnContainerClass contentClass, bool transient,
         bool populateSandboxCache);
@@ -120,7 +122,7 @@ class TarnContainerCache : public TarnUserIdentityCacheObserver,
 
     // Records `metadata` (with its url set to `url`). Before the class was
     // built and without `updateSandbox` it records nothing and succeeds.
-    // Errors: 47 bad input, 43 rebuild failed.
+    // Errors: TarnErrorCacheInvalidInput for bad input, TarnErrorCacheRebuildFailed.
     TarnStatus addContainerMetadata(const TarnMetadataRef& metadata, const FileURL& url,
                                     bool transient, bool updateSandbox);
     TarnStatus removeContainerForUserIdentity(const TarnUserIdentityRef& userIdentity,

@@ -4,11 +4,11 @@
 // shared freely between threads.
 //
 // Construction validates its arguments and answers the identity (never
-// empty) or a silent error value of TarnErrorDomain: 18 for a missing
-// identifier, 11 for every other bad argument. The refusal itself is logged
-// once, by the constructor. The overloads taking `const PlistValue*` are for
-// values decoded from a request, whose type is not known yet; nullptr or a
-// Null value is "missing".
+// empty) or a silent error value of TarnErrorDomain: TarnErrorMissingIdentifier
+// for a missing identifier, TarnErrorInvalidArgument for every other bad
+// argument. The refusal itself is logged once, by the constructor. The
+// overloads taking `const PlistValue*` are for values decoded from a request,
+// whose type is not known yet; nullptr or a Null value is "missing".
 //
 // Equality is deliberately asymmetric: a plain identity equals a concrete one
 // with the same three fields, but a concrete identity equals only another
@@ -53,7 +53,8 @@ public:
         TarnUserIdentityRef userIdentity, std::optional<std::string> identifier,
         TarnContainerClass containerClass);
     // For callers without a user identity: allowed only for global classes,
-    // which get the default user identity; other classes fail with 11.
+    // which get the default user identity; other classes fail with
+    // TarnErrorInvalidArgument.
     static TarnResult<TarnContainerIdentityRef> containerIdentityWithIdentifier(
         std::optional<std::string> identifier, TarnContainerClass containerClass);
 

@@ -1,6 +1,6 @@
 // Errors of the daemon's own domain, "TarnErrorDomain", and POSIX errors.
 //
-// A code travels alone in an error slot (uint64_t, 1 until something fails)
+// A code travels alone in an error slot (uint64_t, TarnSuccess until something fails)
 // or inside a TarnError value that also records where it was made. Only the
 // code ever reaches a client. TarnErrorRef values are immutable and shared.
 #pragma once

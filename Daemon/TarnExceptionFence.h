@@ -4,10 +4,11 @@
 // library (allocation, a container's at()) and the libraries it wraps. Such an
 // exception stops at the nearest boundary that needs it stopped: a request's
 // handler and queue run, a queued command, a queue item, start-up. There
-// TarnFenceExceptions turns it into the caught-exception error (TarnErrorException, "Got
-// exception: %@ : %@") on customer builds and into the fatal report on
-// internal builds, so a fault is loud where it can be fixed and contained
-// where it cannot. Everything between the boundaries relies on RAII.
+// TarnFenceExceptions turns it into the caught-exception error
+// (TarnErrorException, "Got exception: %@ : %@") on customer builds and into
+// the fatal report on internal builds, so a fault is loud where it can be
+// fixed and contained where it cannot. Everything between the boundaries
+// relies on RAII.
 #pragma once
 
 #include <exception>

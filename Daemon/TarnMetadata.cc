@@ -262,8 +262,8 @@ constexpr const char* kValidateFields = "validateFields";
 }  // namespace
 
 // What validateFields() has read so far, and one validator per field. Each
-// validator fails with code 29 and a line naming the field and the file, or
-// keeps the field's value.
+// validator fails with TarnErrorInvalidMetadata and a line naming the field
+// and the file, or keeps the field's value.
 struct TarnMetadata::FieldValidator {
     FieldValidator(ParsedFields& fields, const MetadataLocation& where,
                    const TarnUserIdentityRef& forUserIdentity)

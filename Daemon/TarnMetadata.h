@@ -9,7 +9,8 @@
 // Writing goes to "temp_metadata-<UUID>.plist" in the staging directory of
 // the container's user and class (same volume as the container), fsynced,
 // and is then renamed over the final file: a reader never sees a partial file.
-// Reading rejects anything malformed as a whole (code 29; unreadable: 12).
+// Reading rejects anything malformed as a whole (TarnErrorInvalidMetadata;
+// unreadable: TarnErrorReadFailed).
 #pragma once
 
 #include <memory>
@@ -51,7 +52,8 @@ inline constexpr const char* kTarnInfoGroupContainerIDsKey = "com.ostrea.Pallet.
 // What a metadata reader answers for a file it cannot read or parse at all
 // (missing, unreadable, not a property-list dictionary). A cache rebuild meets
 // such entries among the containers and has no use for them: kQuiet fails
-// without an error value and without a line; kReport fails with code 12.
+// without an error value and without a line; kReport fails with
+// TarnErrorReadFailed.
 enum class TarnMetadataUnreadable { kReport, kQuiet };
 
 class TarnMetadata {
@@ -77,7 +79,7 @@ public:
     // A new concrete identity from the fields; nullptr when that fails.
     TarnConcreteContainerIdentityRef containerIdentity() const;
 
-    // Writes to url() + the metadata file name. Failures are code 34.
+    // Writes to url() + the metadata file name. Failures are TarnErrorWriteFailed.
     TarnStatus writeMetadataToDiskWithError() const;
     TarnStatus writeMetadataToFileURL(const FileURL& fileURL) const;
     // The dictionary that would be written.

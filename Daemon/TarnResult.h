@@ -10,9 +10,10 @@
 //     is logged once, when made; passing it on never logs it again.
 //   - The numeric code is read off only where the protocol needs a number: a
 //     handler copies code(fallback) into the request's error slot (uint64_t,
-//     1 = success), and the request processor writes that slot as
-//     "ReplyError". The fallback answers for a foreign (POSIX) error or a
-//     failure without an error value, so a failure never reads as success.
+//     TarnSuccess until something fails), and the request processor writes
+//     that slot as "ReplyError". The fallback answers for a foreign (POSIX)
+//     error or a failure without an error value, so a failure never reads as
+//     success.
 //   - Exceptions do not travel: they are fenced once, at the boundaries that
 //     need it (a handler, a queued command, a queue item, start-up), by
 //     TarnFenceExceptions (Daemon/TarnExceptionFence.h). Cleanup is RAII.
@@ -63,7 +64,7 @@ class [[nodiscard]] TarnResult {
 
     // The error value; null after success.
     TarnErrorRef error() const { return ok() ? TarnErrorRef() : std::get<1>(state_); }
-    // The wire code: 1 after success, else the error's domain code or
+    // The wire code: TarnSuccess after success, else the error's domain code or
     // `fallback` (see the convention above).
     uint64_t code(uint64_t fallback) const {
         return ok() ? uint64_t{TarnSuccess} : TarnErrorCodeOf(std::get<1>(state_), fallback);
@@ -97,7 +98,8 @@ class [[nodiscard]] TarnResult<void> {
 using TarnStatus = TarnResult<void>;
 
 // Writes a failed result's code into a handler's error slot; a success
-// leaves the slot alone (it holds 1 until something fails). Answers ok().
+// leaves the slot alone (it holds TarnSuccess until something fails).
+// Answers ok().
 template <class T>
 bool TarnReport(const TarnResult<T>& result, uint64_t* slot, uint64_t fallback) {
     if (!result.ok()) TarnSetError(slot, result.code(fallback));

@@ -340,7 +340,8 @@ TarnStatus TarnSQLiteDB::inTransaction(const char* operation, Body&& body) {
     // Only an open transaction can be rolled back; the exception may have hit
     // after COMMIT or a ROLLBACK took effect.
     if (!ended && db_ && !sqlite3_get_autocommit(db_)) {
-        // The operation fails with 40 either way; the exec already logged.
+        // The operation fails with TarnErrorException either way; the exec
+        // already logged.
         (void)_sqliteExec("ROLLBACK;");
     }
     return status;

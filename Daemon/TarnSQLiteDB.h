@@ -12,10 +12,12 @@
 // ends the process, because the daemon cannot run without it.
 //
 // Every operation answers a TarnResult (Daemon/TarnResult.h) whose error is of
-// TarnErrorDomain: 38 a required argument is missing, 40 an unexpected failure
-// inside a transaction, 66 a SQLite call failed or stored data could not be
-// (de)serialised, 67 the identifier (or its children or parent) is not stored,
-// 68 a statement changed another number of rows than required, 73 a result
+// TarnErrorDomain: TarnErrorBadInput a required argument is missing,
+// TarnErrorException an unexpected failure inside a transaction,
+// TarnErrorDatabase a SQLite call failed or stored data could not be
+// (de)serialised, TarnErrorDatabaseNotFound the identifier (or its children or
+// parent) is not stored, TarnErrorDatabaseUnexpectedChanges a statement changed
+// another number of rows than required, TarnErrorAllocationFailed a result
 // could not be allocated.
 #pragma once
 
@@ -49,7 +51,8 @@ public:
 
     // Opens and initialises the database at `url`; never returns on failure.
     static sqlite3* openDBWithURL(const FileURL& url);
-    // Closes the handle; later calls fail with 66. Also done on destruction.
+    // Closes the handle; later calls fail with TarnErrorDatabase. Also done on
+    // destruction.
     void closeDB();
 
     sqlite3* db() const { return db_; }
@@ -61,7 +64,8 @@ public:
                                    const std::string& withIdentifier);
     // Deletes exactly one entry; its data and child rows go with it.
     TarnStatus deleteCodeSigningEntryWithIdentifier(const std::string& identifier);
-    // The entry with its children (never empty), or 67 when it is not stored.
+    // The entry with its children (never empty), or TarnErrorDatabaseNotFound
+    // when it is not stored.
     TarnResult<TarnCodeSigningEntryRef> codeSigningEntryWithIdentifier(const std::string& identifier);
     // Marks one entry invalid; an unknown identifier is not an error.
     TarnStatus invalidateCodeSigningWithIdentifier(const std::string& identifier);
@@ -77,10 +81,12 @@ public:
     // Every stored identifier; empty on an empty database. Fails only when no
     // identifier could be read: a later row's failure leaves a partial set.
     TarnResult<std::set<std::string>> identifiersWithError();
-    // The children in row order (never empty), or 67 when there are none.
+    // The children in row order (never empty), or TarnErrorDatabaseNotFound
+    // when there are none.
     TarnResult<std::vector<std::string>> childIdentifiersForParentIdentifier(
         const std::string& identifier);
-    // The parent, or 67 when the identifier is nobody's child.
+    // The parent, or TarnErrorDatabaseNotFound when the identifier is nobody's
+    // child.
     TarnResult<std::string> parentIdentifierForChildIdentifier(const std::string& identifier);
     // Removes every entry flagged as an advance copy.
     TarnStatus deleteAllAdvanceCopiesOfCodeSigningEntriesWithError();
@@ -118,9 +124,9 @@ private:
     // BEGIN, `body` (returning TarnStatus), then COMMIT; a failed body is
     // rolled back and its error answered. The body and the commit are an
     // exception boundary, because they run as items of the mapping's queue:
-    // what they throw is error 40 (the fatal report on internal builds) after
-    // a rollback of whatever is still open. `operation` names the caller in
-    // the log lines of a failed BEGIN and of a caught exception.
+    // what they throw is TarnErrorException (the fatal report on internal
+    // builds) after a rollback of whatever is still open. `operation` names the
+    // caller in the log lines of a failed BEGIN and of a caught exception.
     template <class Body>
     TarnStatus inTransaction(const char* operation, Body&& body);
     // Rolls back after `cause`; the rollback's own failure wraps `cause`.

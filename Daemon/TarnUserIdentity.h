@@ -67,9 +67,9 @@ public:
     static TarnUserIdentityRef init();
 
     // Reads a stored identity against `cache` (versions "1" and "2").
-    // Malformed data fails with 75 (the line saying why is logged, the error
-    // value is silent); well-formed data that names no identity the cache
-    // knows is a success holding an empty ref.
+    // Malformed data fails with TarnErrorInvalidUserIdentityData (the line
+    // saying why is logged, the error value is silent); well-formed data that
+    // names no identity the cache knows is a success holding an empty ref.
     static TarnResult<TarnUserIdentityRef> userIdentityWithPlist(const PlistValue& plist,
                                                                  TarnUserIdentityCache& cache);
     // The common case of userIdentityWithPlist() for a stored identity whose

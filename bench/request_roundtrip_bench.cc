@@ -4,8 +4,9 @@
 //       SOCK_SEQPACKET socket pair by another process: the daemon is one, and
 //       each hop to another process switches address space, which a thread
 //       of our own does not (that in-process echo is printed too, as "thread");
-//   (b) the same request ({"Command": 27}, answered with "ReplyError" 49)
-//       through a running tarnkeeperd in a scratch root;
+//   (b) the same request ({"Command": 27}, answered with "ReplyError"
+//       TarnErrorInvalidCommand) through a running tarnkeeperd in a scratch
+//       root;
 //   (c) for reference, the same request through an in-process Conduit
 //       listener that only echoes: what Conduit alone costs.
 //

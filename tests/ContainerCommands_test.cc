@@ -229,17 +229,17 @@ TEST_F(ContainerCommandsTest, StageForDeleteIsAllOrNothingOnBadInput) {
 
     EXPECT_EQ(stage("[2, 2, 2]", "[" + u + ", " + other + "]", R"(["com.stage", "x", "y"])",
                     R"([")" + std::string(kPersonal) + R"(", "", ""])"),
-              38u);
+              TarnErrorBadInput);
     EXPECT_TRUE(fs::is_directory(path)) << "nothing staged after a count mismatch";
 
     EXPECT_EQ(stage("[2, 2]", "[" + u + ", " + other + "]", R"(["com.stage", "x"])",
                     R"([")" + std::string(kPersonal) + R"(", "NO-SUCH-PERSONA"])"),
-              76u);
+              TarnErrorPersonaMismatch);
     EXPECT_TRUE(fs::is_directory(path)) << "nothing staged after a bad persona";
 
     EXPECT_EQ(
         stage("[2]", "[" + u + "]", R"(["com.stage"])", R"([")" + std::string(kPersonal) + R"("])"),
-        1u);
+        TarnSuccess);
     EXPECT_FALSE(fs::exists(path));
 }
 

@@ -108,7 +108,7 @@ TEST(Format, PrintfConversionsAndDescriptions) {
 TEST(TarnErrorValues, CarryCodePlaceAndOptionalDescription) {
     PlatformLogSetQuiet(true);
     auto plain = TARN_ERROR_CODE(TarnErrorNotFound, nullptr);
-    EXPECT_EQ(plain->code(), 21u);
+    EXPECT_EQ(plain->code(), TarnErrorNotFound);
     EXPECT_FALSE(plain->localizedDescription());
     EXPECT_EQ(plain->functionName(), "TestBody");
     EXPECT_GT(plain->sourceFileLine(), 0);
@@ -117,7 +117,7 @@ TEST(TarnErrorValues, CarryCodePlaceAndOptionalDescription) {
     auto wrapped = TARN_ERROR(TarnErrorReadFailed, posix, "Failed to read %@", "/x");
     EXPECT_EQ(wrapped->underlyingError(), posix);
     EXPECT_EQ(*wrapped->localizedDescription(), "Failed to read /x");
-    EXPECT_EQ(TarnErrorCodeOf(wrapped, 99), 12u);
+    EXPECT_EQ(TarnErrorCodeOf(wrapped, 99), TarnErrorReadFailed);
     EXPECT_EQ(TarnErrorCodeOf(posix, 99), 99u);
     EXPECT_EQ(TarnErrorCodeOf(nullptr, 99), 99u) << "a failure without a value is no success";
     EXPECT_NE(wrapped->description().find("UnderlyingError=Error Domain=PosixErrorDomain Code=2"),

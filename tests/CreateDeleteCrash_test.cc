@@ -129,8 +129,10 @@ class CreateDeleteCrashTest : public test::ScratchRootTest {
             const std::string id = identifierNumber(i);
             auto found = send(containerRequest(id, false, false));
             // The sandbox state may still name a container staged just before
-            // the kill: that first answer is 44 and drops the stale entry.
-            if (errorOf(found) == 44u) found = send(containerRequest(id, false, false));
+            // the kill: that first answer is TarnErrorCacheInconsistent and
+            // drops the stale entry.
+            if (errorOf(found) == TarnErrorCacheInconsistent)
+                found = send(containerRequest(id, false, false));
             auto it = live.find(id);
             if (it == live.end()) {
                 EXPECT_EQ(errorOf(found), TarnErrorNotFound) << id;

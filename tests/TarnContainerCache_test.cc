@@ -206,7 +206,7 @@ TEST_F(TarnContainerCacheTest, AddBeforeTheClassWasBuiltRecordsNothing) {
     EXPECT_TRUE(lookup(2, "com.ostrea.early", &code));
     EXPECT_EQ(cache_->TEST_rebuildCount(), 1u);
 
-    // Bad input is refused with 47, never recorded.
+    // Bad input is refused with TarnErrorCacheInvalidInput, never recorded.
     added = cache_->addContainerMetadata(made, "relative/path", /*transient=*/false,
                                          /*updateSandbox=*/true);
     EXPECT_EQ(added.code(0), uint64_t{TarnErrorCacheInvalidInput});
