@@ -39,9 +39,10 @@ TarnClientConnection::TarnClientConnection(TarnClientIdentityRef clientIdentity,
       userIdentityCache_(TarnUserIdentitySharedCache::sharedInstance()) {}
 
 TarnClientConnection::TarnClientConnection()
-    : TarnClientConnection(TarnClientIdentity::anonymousPrivilegedClientIdentity(), true, false,
-                           true, std::nullopt, std::nullopt, std::make_shared<TarnCommandQueue>()) {
-}
+    : TarnClientConnection(TarnClientIdentity::anonymousPrivilegedClientIdentity(),
+                           /*entitled=*/true, /*allowOtherIdLookup=*/false, /*unrestricted=*/true,
+                           /*lookup=*/std::nullopt, /*entitledWipeIdentifiers=*/std::nullopt,
+                           std::make_shared<TarnCommandQueue>()) {}
 
 std::shared_ptr<TarnClientConnection> TarnClientConnection::initWithClientIdentity(
     TarnClientIdentityRef clientIdentity, bool entitled, bool allowOtherIdLookup, bool unrestricted,
@@ -58,7 +59,9 @@ TarnClientConnection::privilegedClientConnectionWithUserIdentity(
     return std::make_shared<TarnClientConnection>(
         TarnClientIdentity::privilegedClientIdentityWithUserIdentity(std::move(userIdentity),
                                                                      kernel),
-        true, true, true, std::nullopt, std::nullopt, std::make_shared<TarnCommandQueue>());
+        /*entitled=*/true, /*allowOtherIdLookup=*/true, /*unrestricted=*/true,
+        /*lookup=*/std::nullopt, /*entitledWipeIdentifiers=*/std::nullopt,
+        std::make_shared<TarnCommandQueue>());
 }
 
 // ---- Lookup rules ----

@@ -176,8 +176,8 @@ TarnClientIdentityRef TarnClientIdentity::clientIdentityWithConduitConnection(
 TarnClientIdentityRef TarnClientIdentity::privilegedClientIdentityWithUserIdentity(
     std::shared_ptr<const TarnUserIdentity> userIdentity, bool kernel) {
     return initWithBundleIdentifier("com.ostrea.tarnkeeperd.internal", 0, 0, 0,
-                                    std::move(userIdentity), PlistValue(PlistDict{}), false,
-                                    TarnAuditToken{}, kernel);
+                                    std::move(userIdentity), PlistValue(PlistDict{}),
+                                    /*sandboxed=*/false, TarnAuditToken{}, kernel);
 }
 
 TarnClientIdentityRef TarnClientIdentity::anonymousPrivilegedClientIdentity() {

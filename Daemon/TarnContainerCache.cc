@@ -727,14 +727,8 @@ TarnStatus TarnContainerCache::addContainerMetadata(const TarnMetadataRef& metad
             shouldRegister = _lock_shouldRegisterSandboxMappingWithUserIdentity(
                 userIdentity, identifier, containerClass);
     }
-    if (updateSandbox && !transient && shouldRegister &&
-        !setSandboxContainerMappingForUserIdentity(userIdentity, identifier, containerClass, url)) {
-        TarnLog(kLogError, __func__, "Failed to set container mapping of %@, %llu", identifier,
-                containerClass);
-    }
-    TarnLog(kLogDebug, __func__, "Cache: %@%@: Added Identifier: %@",
-            _cacheKeyForUserIdentity(userIdentity, containerClass), transientMarker(transient),
-            identifier);
+    _finishChange(__func__, userIdentity, identifier, containerClass, transient,
+                  /*pushMapping=*/updateSandbox && shouldRegister, url);
     return {};
 }
 
@@ -763,16 +757,28 @@ TarnStatus TarnContainerCache::removeContainerForUserIdentity(
         shouldRegister = _lock_shouldRegisterSandboxMappingWithUserIdentity(
             userIdentity, identifier, contentClass);
     }
-    if (shouldRegister && !transient &&
-        !setSandboxContainerMappingForUserIdentity(userIdentity, identifier, contentClass,
-                                                   std::nullopt)) {
-        TarnLog(kLogError, __func__, "Failed to remove container mapping of %@, %llu", identifier,
-                contentClass);
-    }
-    TarnLog(kLogDebug, __func__, "Cache: %@%@: Removed Identifier: %@",
-            _cacheKeyForUserIdentity(userIdentity, contentClass), transientMarker(transient),
-            identifier);
+    _finishChange(__func__, userIdentity, identifier, contentClass, transient,
+                  /*pushMapping=*/shouldRegister, /*url=*/std::nullopt);
     return {};
+}
+
+void TarnContainerCache::_finishChange(const char* function,
+                                       const TarnUserIdentityRef& userIdentity,
+                                       const std::string& identifier,
+                                       TarnContainerClass containerClass, bool transient,
+                                       bool pushMapping, const std::optional<FileURL>& url) {
+    // Only permanent containers are mapped.
+    if (pushMapping && !transient &&
+        !setSandboxContainerMappingForUserIdentity(userIdentity, identifier, containerClass, url)) {
+        TarnLog(kLogError, function,
+                url ? "Failed to set container mapping of %@, %llu"
+                    : "Failed to remove container mapping of %@, %llu",
+                identifier, containerClass);
+    }
+    TarnLog(kLogDebug, function,
+            url ? "Cache: %@%@: Added Identifier: %@" : "Cache: %@%@: Removed Identifier: %@",
+            _cacheKeyForUserIdentity(userIdentity, containerClass), transientMarker(transient),
+            identifier);
 }
 
 // ---- Invalidation ----

@@ -131,6 +131,13 @@ class TarnContainerCache : public TarnUserIdentityCacheObserver,
 
     // ---- Kernel sandbox mapping ----
 
+    // The end of an add (`url`) or a remove (none) in the cache: the kernel
+    // mapping follows when `pushMapping` (a failure is logged, never fatal:
+    // the next rebuild pushes again), then the debug line. Called without
+    // the cache lock, under the name of the operation it ends.
+    void _finishChange(const char* function, const TarnUserIdentityRef& userIdentity,
+                       const std::string& identifier, TarnContainerClass containerClass,
+                       bool transient, bool pushMapping, const std::optional<FileURL>& url);
     // Pushes one mapping; no `url` removes it. Bundle classes: nothing, true.
     bool setSandboxContainerMappingForUserIdentity(const TarnUserIdentityRef& userIdentity,
                                                    const std::string& identifier,

@@ -18,7 +18,7 @@ TarnErrorRef TarnCaughtExceptionError(const char* function, const std::exception
         TarnFatalExceptionReport(exception);
     std::string name = exception ? typeid(*exception).name() : "unknown exception";
     std::string reason = exception ? exception->what() : "";
-    return TarnErrorMake(function, __LINE__, TarnErrorException, nullptr, true,
+    return TarnErrorMake(function, __LINE__, TarnErrorException, nullptr, /*log=*/true,
                          Format("Got exception: %@ : %@", name, reason));
 }
 

@@ -134,7 +134,8 @@ FsGroupACL posixACLFor(const TarnACL& acl, const FsStat& st) {
         if (dir && (inherits || onlyInherit)) {
             // What is inherited is the full entry, whatever the executable
             // bit of the directory says.
-            out.defaultPerms = std::max(out.defaultPerms, 0) | rwxOf(e.permissions, true, true);
+            out.defaultPerms = std::max(out.defaultPerms, 0) |
+                               rwxOf(e.permissions, /*isDirectory=*/true, /*executable=*/true);
         }
     }
     return out;

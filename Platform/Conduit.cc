@@ -84,16 +84,17 @@ Message::Message(PrivateTag, std::weak_ptr<Connection> connection, uint64_t id, 
       body_(std::move(body)) {}
 
 MessageRef Message::createDictionary() {
-    return std::make_shared<Message>(PrivateTag{}, std::weak_ptr<Connection>{}, 0, 0, false,
-                                     PlistValue(PlistDict{}));
+    return std::make_shared<Message>(PrivateTag{}, std::weak_ptr<Connection>{}, /*id=*/0,
+                                     /*replyTo=*/0,
+                                     /*request=*/false, PlistValue(PlistDict{}));
 }
 
 bool Message::expectsReply() const { return request_ && !replyCreated_.load(); }
 
 MessageRef Message::createReply() const {
     if (!request_ || replyCreated_.exchange(true)) return nullptr;
-    return std::make_shared<Message>(PrivateTag{}, connection_, 0, id_, false,
-                                     PlistValue(PlistDict{}));
+    return std::make_shared<Message>(PrivateTag{}, connection_, /*id=*/0, /*replyTo=*/id_,
+                                     /*request=*/false, PlistValue(PlistDict{}));
 }
 
 // ---------------------------------------------------------------------------

@@ -616,20 +616,31 @@ struct Walker {
 
 }  // namespace
 
+namespace {
+
+// The entry of a tree's root, addressed through its open parent without
+// following a link; fills `st` with what was found there.
+int rootEntry(const std::string& root, FsFd* parent, FsWalkEntry* e, struct stat* st) {
+    std::string name;
+    if (int err = openParent(root, parent, &name)) return err;
+    if (::fstatat(parent->get(), name.c_str(), st, AT_SYMLINK_NOFOLLOW) != 0) return errnoOr(EIO);
+    e->path = root;
+    e->level = 0;
+    e->parentFd = parent->get();
+    e->name = std::move(name);
+    e->st = fromStat(*st);
+    e->type = walkTypeOf(st->st_mode);
+    return 0;
+}
+
+}  // namespace
+
 int FsWalk(const std::string& root, const std::function<bool(const FsWalkEntry&)>& visit) {
     FsFd parent;
-    std::string name;
-    if (int err = openParent(root, &parent, &name)) return err;
-    struct stat s;
-    if (::fstatat(parent.get(), name.c_str(), &s, AT_SYMLINK_NOFOLLOW) != 0) return errnoOr(EIO);
-    Walker w{visit, s.st_dev};
     FsWalkEntry e;
-    e.path = root;
-    e.level = 0;
-    e.parentFd = parent.get();
-    e.name = name;
-    e.st = fromStat(s);
-    e.type = walkTypeOf(s.st_mode);
+    struct stat s;
+    if (int err = rootEntry(root, &parent, &e, &s)) return err;
+    Walker w{visit, s.st_dev};
     if (e.type == FsWalkType::Directory)
         w.directory(parent.get(), std::move(e), s.st_dev);
     else if (!visit(e))
@@ -701,17 +712,10 @@ struct Remover {
 
 int FsRemoveTree(const std::string& root, const FsRemoveErrorFn& onError) {
     FsFd parent;
-    std::string name;
-    if (int err = openParent(root, &parent, &name)) return err;
-    struct stat s;
-    if (::fstatat(parent.get(), name.c_str(), &s, AT_SYMLINK_NOFOLLOW) != 0) return errnoOr(EIO);
-    Remover r{onError};
     FsWalkEntry e;
-    e.path = root;
-    e.level = 0;
-    e.parentFd = parent.get();
-    e.name = name;
-    e.st = fromStat(s);
+    struct stat s;
+    if (int err = rootEntry(root, &parent, &e, &s)) return err;
+    Remover r{onError};
     r.item(std::move(e), S_ISDIR(s.st_mode));
     return 0;
 }

@@ -19,24 +19,25 @@
 //   container_requests_bench [CONTAINERS] [LOOKUP_ROUNDS] [lookup|create]
 //
 // With "lookup" or "create" only that part runs, pinned (for profiling).
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+#include <uuid/uuid.h>
+
 #include <algorithm>
 #include <atomic>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
-#include <filesystem>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <iterator>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-#include <uuid/uuid.h>
-
+#include "Daemon/TarnError.h"
 #include "Platform/Conduit.h"
 #include "Platform/ConduitHarness.h"
 #include "Platform/ConduitWire.h"
@@ -76,7 +77,7 @@ PlistValue send(Client& client, const PlistValue& request) {
     auto reply = client.sendSync(request, 10000ms, &why);
     if (!reply) die("request failed: " + why);
     const PlistValue* e = reply->find("ReplyError");
-    if (e && e->asUInt64() != 1) die("daemon answered " + reply->description());
+    if (e && e->asUInt64() != TarnSuccess) die("daemon answered " + reply->description());
     return std::move(*reply);
 }
 

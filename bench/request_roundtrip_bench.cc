@@ -16,6 +16,8 @@
 // daemon does not answer.
 //
 //   request_roundtrip_bench [ROUNDS] [OPS_PER_ROUND]
+#include <unistd.h>
+
 #include <algorithm>
 #include <chrono>
 #include <cstdio>
@@ -25,8 +27,7 @@
 #include <string>
 #include <vector>
 
-#include <unistd.h>
-
+#include "Daemon/TarnError.h"
 #include "Platform/Conduit.h"
 #include "Platform/ConduitHarness.h"
 #include "Platform/ConduitWire.h"
@@ -52,7 +53,7 @@ bool daemonAnswers(Client& client, std::string* why) {
     auto reply = client.sendSync(command27(), 5000ms, why);
     if (!reply) return false;
     const PlistValue* e = reply->find("ReplyError");
-    if (!e || e->asUInt64() != uint64_t{49}) {
+    if (!e || e->asUInt64() != uint64_t{TarnErrorInvalidCommand}) {
         *why = "unexpected reply " + reply->description();
         return false;
     }
@@ -174,7 +175,7 @@ int main(int argc, char** argv) {
             if (e.kind != Event::Kind::Message || !c) return;
             auto reply = e.message->createReply();
             if (!reply) return;
-            reply->body().set("ReplyError", PlistValue(uint64_t{49}));
+            reply->body().set("ReplyError", PlistValue(uint64_t{TarnErrorInvalidCommand}));
             c->send(reply);
         });
         c->resume();
