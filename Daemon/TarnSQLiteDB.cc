@@ -454,144 +454,119 @@ TarnResult<TarnCodeSigningEntryRef> TarnSQLiteDB::codeSigningEntryWithIdentifier
     return TarnCodeSigningEntryRef(std::move(entry));
 }
 
-TarnStatus TarnSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(const EntryBlock& block) {
-    TarnErrorRef lastError;
+template <class Row>
+TarnStatus TarnSQLiteDB::_selectRows(const char* function, const char* query,
+                                     const std::string* textInput, const char* column, Row&& row) {
+    TarnErrorRef e;
     sqlite3_stmt* statement = nullptr;
-    if (!db_ || sqlite3_prepare_v2(db_, kSelectAllEntries, -1, &statement, nullptr) != SQLITE_OK) {
-        lastError = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_,
-                               errmsg());
-        if (statement) finalize(statement);
-        return lastError;
+    if (!db_ || sqlite3_prepare_v2(db_, query, -1, &statement, nullptr) != SQLITE_OK) {
+        e = TARN_ERROR_IN(function, TarnErrorDatabase, nullptr,
+                          "sqlite3_prepare(select) for %@ failed: %s", url_, errmsg());
+    } else if (textInput && sqlite3_bind_text(statement, 1, textInput->c_str(), -1,
+                                              SQLITE_TRANSIENT) != SQLITE_OK) {
+        e = TARN_ERROR_IN(function, TarnErrorDatabase, nullptr,
+                          "sqlite3_bind_text for %s=%@ at %@ failed: %s", column, *textInput, url_,
+                          errmsg());
+    } else {
+        for (;;) {
+            const int rc = sqlite3_step(statement);
+            if (rc == SQLITE_DONE) break;
+            if (rc != SQLITE_ROW) {
+                e = TARN_ERROR_IN(function, TarnErrorDatabase, nullptr,
+                                  "sqlite3_step for %@ failed: %s", url_, errmsg());
+                break;
+            }
+            row(statement);
+        }
     }
-    for (;;) {
-        int rc = sqlite3_step(statement);
-        if (rc == SQLITE_DONE) break;
-        if (rc != SQLITE_ROW) {
-            lastError = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_step for %@ failed: %s", url_, errmsg());
-            break;
-        }
-        // Everything made for this row lives in this scope only, so memory
-        // stays flat however many rows there are.
-        TarnResult<std::shared_ptr<TarnCodeSigningEntry>> decoded = _codeSigningEntryFromStatementRow(statement);
-        if (!decoded.ok()) {
-            lastError = decoded.error();
-            continue;
-        }
-        std::shared_ptr<TarnCodeSigningEntry>& entry = *decoded;
-        const unsigned char* text = sqlite3_column_text(statement, 5);
-        if (!text) {
-            lastError = TARN_ERROR(TarnErrorDatabase, nullptr, "Error retrieving code_signing_id_text from DB");
-            continue;
-        }
-        std::string identifier(textOrEmpty(text));
-        TarnResult<std::vector<std::string>> children = childIdentifiersForParentIdentifier(identifier);
-        if (children.ok()) {
-            entry->setChildBundleIdentifiers(std::move(*children));
-        } else if (!isNotFound(children.error())) {
-            lastError = TARN_ERROR(TarnErrorDatabase, children.error(), "Error retrieving childBundleIds: %@",
-                                   children.error());
-            continue;
-        }
-        block(identifier, entry);
-    }
-    finalize(statement);
+    if (statement) finalize(statement);
+    return statusOf(std::move(e));
+}
+
+TarnStatus TarnSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(const EntryBlock& block) {
+    // A bad row is skipped; the answer is the last failure.
+    TarnErrorRef lastError;
+    TARN_TRY(
+        _selectRows(__func__, kSelectAllEntries, nullptr, nullptr, [&](sqlite3_stmt* statement) {
+            // Everything made for this row lives in this scope only, so memory
+            // stays flat however many rows there are.
+            TarnResult<std::shared_ptr<TarnCodeSigningEntry>> decoded =
+                _codeSigningEntryFromStatementRow(statement);
+            if (!decoded.ok()) {
+                lastError = decoded.error();
+                return;
+            }
+            std::shared_ptr<TarnCodeSigningEntry>& entry = *decoded;
+            const unsigned char* text = sqlite3_column_text(statement, 5);
+            if (!text) {
+                lastError = TARN_ERROR_IN("enumerateIdentifiersAndCodeSigningInfoUsingBlock",
+                                          TarnErrorDatabase, nullptr,
+                                          "Error retrieving code_signing_id_text from DB");
+                return;
+            }
+            std::string identifier(textOrEmpty(text));
+            TarnResult<std::vector<std::string>> children =
+                childIdentifiersForParentIdentifier(identifier);
+            if (children.ok()) {
+                entry->setChildBundleIdentifiers(std::move(*children));
+            } else if (!isNotFound(children.error())) {
+                lastError = TARN_ERROR_IN("enumerateIdentifiersAndCodeSigningInfoUsingBlock",
+                                          TarnErrorDatabase, children.error(),
+                                          "Error retrieving childBundleIds: %@", children.error());
+                return;
+            }
+            block(identifier, entry);
+        }));
     return statusOf(std::move(lastError));
 }
 
 TarnResult<std::set<std::string>> TarnSQLiteDB::identifiersWithError() {
     std::set<std::string> identifiers;
-    TarnErrorRef lastError;
-    sqlite3_stmt* statement = nullptr;
-    if (!db_ || sqlite3_prepare_v2(db_, kSelectIdentifiers, -1, &statement, nullptr) != SQLITE_OK) {
-        lastError = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_,
-                               errmsg());
-    } else {
-        for (;;) {
-            int rc = sqlite3_step(statement);
-            if (rc == SQLITE_DONE) break;
-            if (rc != SQLITE_ROW) {
-                lastError = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_step for %@ failed: %s", url_, errmsg());
-                break;
-            }
+    const TarnStatus selected =
+        _selectRows(__func__, kSelectIdentifiers, nullptr, nullptr, [&](sqlite3_stmt* statement) {
             const unsigned char* text = sqlite3_column_text(statement, 0);
             if (!text) {
-                TarnLog(kLogError, "identifiersWithError", "Error retrieving code_signing_id_text from DB");
-                continue;
+                TarnLog(kLogError, "identifiersWithError",
+                        "Error retrieving code_signing_id_text from DB");
+                return;
             }
             identifiers.emplace(textOrEmpty(text));
-        }
-    }
-    if (statement) finalize(statement);
-    if (identifiers.empty() && lastError) return lastError;
+        });
+    // What could be read is the answer; a failure only when nothing could.
+    if (identifiers.empty() && !selected.ok()) return selected.error();
     return identifiers;
 }
 
 TarnResult<std::vector<std::string>> TarnSQLiteDB::childIdentifiersForParentIdentifier(
     const std::string& identifier) {
     std::vector<std::string> children;
-    TarnErrorRef e;
-    sqlite3_stmt* statement = nullptr;
-    if (!db_ || sqlite3_prepare_v2(db_, kSelectChildren, -1, &statement, nullptr) != SQLITE_OK) {
-        e = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_, errmsg());
-    } else if (sqlite3_bind_text(statement, 1, identifier.c_str(), -1, SQLITE_TRANSIENT) != SQLITE_OK) {
-        e = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_bind_text for code_signing_id_text=%@ at %@ failed: %s",
-                       identifier, url_, errmsg());
-    } else {
-        for (;;) {
-            int rc = sqlite3_step(statement);
-            if (rc == SQLITE_DONE) break;
-            if (rc != SQLITE_ROW) {
-                e = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_step for %@ failed: %s", url_, errmsg());
-                children.clear();
-                break;
-            }
-            const unsigned char* text = sqlite3_column_text(statement, 0);
-            if (text) children.emplace_back(textOrEmpty(text));
-        }
-        if (!e && children.empty()) {
-            // Silent: most entries have no children.
-            e = TARN_ERROR_SILENT(TarnErrorDatabaseNotFound, nullptr,
-                                  "Children for parent identifier: \"%@\" Not Found in DB", identifier);
-        }
+    TARN_TRY(_selectRows(__func__, kSelectChildren, &identifier, "code_signing_id_text",
+                         [&](sqlite3_stmt* statement) {
+                             const unsigned char* text = sqlite3_column_text(statement, 0);
+                             if (text) children.emplace_back(textOrEmpty(text));
+                         }));
+    if (children.empty()) {
+        // Silent: most entries have no children.
+        return TARN_ERROR_SILENT(TarnErrorDatabaseNotFound, nullptr,
+                                 "Children for parent identifier: \"%@\" Not Found in DB",
+                                 identifier);
     }
-    if (statement) finalize(statement);
-    if (e) return e;
     return children;
 }
 
-TarnResult<std::string> TarnSQLiteDB::parentIdentifierForChildIdentifier(const std::string& identifier) {
-    std::string parent;
-    bool found = false;
-    TarnErrorRef e;
-    sqlite3_stmt* statement = nullptr;
-    if (!db_ || sqlite3_prepare_v2(db_, kSelectParent, -1, &statement, nullptr) != SQLITE_OK) {
-        e = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_prepare(select) for %@ failed: %s", url_, errmsg());
-    } else if (sqlite3_bind_text(statement, 1, identifier.c_str(), -1, SQLITE_TRANSIENT) != SQLITE_OK) {
-        e = TARN_ERROR(TarnErrorDatabase, nullptr,
-                       "sqlite3_bind_text for child_code_signing_id_text=%@ at %@ failed: %s", identifier, url_,
-                       errmsg());
-    } else {
-        for (;;) {
-            int rc = sqlite3_step(statement);
-            if (rc == SQLITE_DONE) break;
-            if (rc != SQLITE_ROW) {
-                e = TARN_ERROR(TarnErrorDatabase, nullptr, "sqlite3_step for %@ failed: %s", url_, errmsg());
-                break;
-            }
-            const unsigned char* text = sqlite3_column_text(statement, 0);
-            if (text) {
-                parent = textOrEmpty(text);
-                found = true;
-            }
-        }
-        if (!e && !found) {
-            e = TARN_ERROR_SILENT(TarnErrorDatabaseNotFound, nullptr, "Parent identifier for: \"%@\" Not Found in DB",
-                                  identifier);
-        }
+TarnResult<std::string> TarnSQLiteDB::parentIdentifierForChildIdentifier(
+    const std::string& identifier) {
+    std::optional<std::string> parent;
+    TARN_TRY(_selectRows(__func__, kSelectParent, &identifier, "child_code_signing_id_text",
+                         [&](sqlite3_stmt* statement) {
+                             const unsigned char* text = sqlite3_column_text(statement, 0);
+                             if (text) parent = textOrEmpty(text);
+                         }));
+    if (!parent) {
+        return TARN_ERROR_SILENT(TarnErrorDatabaseNotFound, nullptr,
+                                 "Parent identifier for: \"%@\" Not Found in DB", identifier);
     }
-    if (statement) finalize(statement);
-    if (e) return e;
-    return parent;
+    return std::move(*parent);
 }
 
 // ---- invalidation and deletion ----

@@ -97,52 +97,59 @@ public:
     std::function<void(const char* step)> TEST_storeStepHook;
 
 private:
-    TarnStatus _sqliteExec(const char* statement);
-    TarnStatus _performSingleParameterQuery(const char* query, const std::string& withTextInput);
-    TarnStatus _performSingleParameterQuery(const char* query, const std::string& withTextInput,
-                                            int expectedChanges);
-    // `andTextInputTwo` null: the query takes one parameter. `expectedChanges`
-    // -1: the change count is not checked.
-    TarnStatus _performTwoParameterQuery(const char* query, const std::string& withTextInputOne,
-                                         const std::string* andTextInputTwo, int expectedChanges);
-    TarnStatus _insertCodeSigningInfo(const TarnCodeSigningEntry& info,
-                                      const std::string& forIdentifier);
-    TarnStatus _insertCodeSigningData(const TarnCodeSigningEntry& data,
-                                      const std::string& forIdentifier);
-    TarnStatus _insertChildIdentifier(const std::string& childIdentifier,
-                                      const std::string& forParentIdentifier);
-    TarnStatus _performInsertOrUpdateQuery(const char* query,
-                                           const TarnCodeSigningEntry& withCodeSigningEntry,
-                                           const std::string& forIdentifier, bool isUpdate);
-    // Empty without an error when no row matches.
-    TarnResult<std::shared_ptr<TarnCodeSigningEntry>> _selectCodeSigningEntryWithIdentifier(
-        const std::string& identifier);
-    TarnResult<std::shared_ptr<TarnCodeSigningEntry>> _codeSigningEntryFromStatementRow(
-        sqlite3_stmt* statement);
-    TarnStatus _deleteCodeSigningWithIdentifier(const std::string& identifier);
+  // Runs a SELECT: prepares `query`, binds `textInput` (when given) to its one
+  // parameter, named `column` in the failure line, and hands each row's
+  // statement to `row`. A failed prepare, bind or step is the answer, with
+  // its line, under `function`'s name.
+  template <class Row>
+  TarnStatus _selectRows(const char* function, const char* query, const std::string* textInput,
+                         const char* column, Row&& row);
+  TarnStatus _sqliteExec(const char* statement);
+  TarnStatus _performSingleParameterQuery(const char* query, const std::string& withTextInput);
+  TarnStatus _performSingleParameterQuery(const char* query, const std::string& withTextInput,
+                                          int expectedChanges);
+  // `andTextInputTwo` null: the query takes one parameter. `expectedChanges`
+  // -1: the change count is not checked.
+  TarnStatus _performTwoParameterQuery(const char* query, const std::string& withTextInputOne,
+                                       const std::string* andTextInputTwo, int expectedChanges);
+  TarnStatus _insertCodeSigningInfo(const TarnCodeSigningEntry& info,
+                                    const std::string& forIdentifier);
+  TarnStatus _insertCodeSigningData(const TarnCodeSigningEntry& data,
+                                    const std::string& forIdentifier);
+  TarnStatus _insertChildIdentifier(const std::string& childIdentifier,
+                                    const std::string& forParentIdentifier);
+  TarnStatus _performInsertOrUpdateQuery(const char* query,
+                                         const TarnCodeSigningEntry& withCodeSigningEntry,
+                                         const std::string& forIdentifier, bool isUpdate);
+  // Empty without an error when no row matches.
+  TarnResult<std::shared_ptr<TarnCodeSigningEntry>> _selectCodeSigningEntryWithIdentifier(
+      const std::string& identifier);
+  TarnResult<std::shared_ptr<TarnCodeSigningEntry>> _codeSigningEntryFromStatementRow(
+      sqlite3_stmt* statement);
+  TarnStatus _deleteCodeSigningWithIdentifier(const std::string& identifier);
 
-    // BEGIN, `body` (returning TarnStatus), then COMMIT; a failed body is
-    // rolled back and its error answered. The body and the commit are an
-    // exception boundary, because they run as items of the mapping's queue:
-    // what they throw is TarnErrorException (the fatal report on internal
-    // builds) after a rollback of whatever is still open. `operation` names the
-    // caller in the log lines of a failed BEGIN and of a caught exception.
-    template <class Body>
-    TarnStatus inTransaction(const char* operation, Body&& body);
-    // Rolls back after `cause`; the rollback's own failure wraps `cause`.
-    TarnErrorRef rollbackAfter(TarnErrorRef cause);
-    // COMMIT; on failure rolls back whatever is still open.
-    TarnStatus commitTransaction();
-    void finalize(sqlite3_stmt* statement);
-    const char* errmsg() const;
-    void runStoreStepHook(const char* step);
+  // BEGIN, `body` (returning TarnStatus), then COMMIT; a failed body is
+  // rolled back and its error answered. The body and the commit are an
+  // exception boundary, because they run as items of the mapping's queue:
+  // what they throw is TarnErrorException (the fatal report on internal
+  // builds) after a rollback of whatever is still open. `operation` names the
+  // caller in the log lines of a failed BEGIN and of a caught exception.
+  template <class Body>
+  TarnStatus inTransaction(const char* operation, Body&& body);
+  // Rolls back after `cause`; the rollback's own failure wraps `cause`.
+  TarnErrorRef rollbackAfter(TarnErrorRef cause);
+  // COMMIT; on failure rolls back whatever is still open.
+  TarnStatus commitTransaction();
+  void finalize(sqlite3_stmt* statement);
+  const char* errmsg() const;
+  void runStoreStepHook(const char* step);
 
-    // Constant after construction.
-    const FileURL url_;
-    // Cleared by closeDB().
-    sqlite3* db_ = nullptr;
-    // The compiled entry look-up, made on first use; finalized by closeDB().
-    sqlite3_stmt* selectEntry_ = nullptr;
+  // Constant after construction.
+  const FileURL url_;
+  // Cleared by closeDB().
+  sqlite3* db_ = nullptr;
+  // The compiled entry look-up, made on first use; finalized by closeDB().
+  sqlite3_stmt* selectEntry_ = nullptr;
 };
 
 }  // namespace tarn
