@@ -6,6 +6,7 @@
 #include <stdlib.h>
 
 #include <algorithm>
+#include <chrono>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -16,6 +17,8 @@
 #include "Platform/PropertyList.h"
 
 namespace tarn::bench {
+
+using Clock = std::chrono::steady_clock;
 
 inline std::string makeScratchRoot() {
     const char* tmp = std::getenv("TMPDIR");

@@ -47,9 +47,7 @@
 
 using namespace tarn;
 using namespace tarn::conduit;
-using tarn::bench::makeScratchRoot;
-using tarn::bench::medianUs;
-using Clock = std::chrono::steady_clock;
+using namespace tarn::bench;
 using namespace std::chrono_literals;
 
 namespace {

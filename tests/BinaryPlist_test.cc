@@ -275,40 +275,20 @@ TEST(BinaryPlist, RefusesDamagedFiles) {
         b.add(ascii("x"));
         return b;
     };
-    {
+    // Damage to the trailer of an otherwise good file.
+    const std::pair<const char*, void (*)(Bplist&)> trailerDamage[] = {
+        {"zero offset size", [](Bplist& b) { b.offsetSize = 0; }},
+        {"zero reference size", [](Bplist& b) { b.refSize = 0; }},
+        {"no objects", [](Bplist& b) { b.count = 0; }},
+        {"root past the objects", [](Bplist& b) { b.root = 2; }},
+        {"offset table longer than the file", [](Bplist& b) { b.count = 1000; }},
+        {"offset table inside the header", [](Bplist& b) { b.tableAt = 4; }},
+        {"offset table far past the end", [](Bplist& b) { b.tableAt = uint64_t{1} << 60; }},
+    };
+    for (const auto& [name, damage] : trailerDamage) {
         Bplist b = simple();
-        b.offsetSize = 0;
-        cases.push_back({"zero offset size", b});
-    }
-    {
-        Bplist b = simple();
-        b.refSize = 0;
-        cases.push_back({"zero reference size", b});
-    }
-    {
-        Bplist b = simple();
-        b.count = 0;
-        cases.push_back({"no objects", b});
-    }
-    {
-        Bplist b = simple();
-        b.root = 2;
-        cases.push_back({"root past the objects", b});
-    }
-    {
-        Bplist b = simple();
-        b.count = 1000;
-        cases.push_back({"offset table longer than the file", b});
-    }
-    {
-        Bplist b = simple();
-        b.tableAt = 4;
-        cases.push_back({"offset table inside the header", b});
-    }
-    {
-        Bplist b = simple();
-        b.tableAt = uint64_t{1} << 60;
-        cases.push_back({"offset table far past the end", b});
+        damage(b);
+        cases.push_back({name, b});
     }
     {
         Bplist b;

@@ -58,6 +58,19 @@ std::vector<uint8_t> encode(const PlistValue& v) {
     return out;
 }
 
+// A request of one `bytes`-long blob, cut into records.
+std::vector<std::vector<uint8_t>> blobRecords(size_t bytes, uint8_t fill, uint64_t messageId,
+                                              std::vector<uint8_t>* body = nullptr) {
+    PlistDict d;
+    d["blob"] = PlistValue(PlistData(bytes, fill));
+    const auto encoded = encode(PlistValue(d));
+    if (body) *body = encoded;
+    RecordHeader h;
+    h.flags = kFlagRequest;
+    h.messageId = messageId;
+    return BuildRecords(h, encoded);
+}
+
 PlistValue nestedArrays(size_t depth) {
     PlistValue v(PlistDict{});
     for (size_t i = 1; i < depth; ++i) v = PlistValue(PlistArray{std::move(v)});
@@ -188,13 +201,8 @@ TEST(ConduitWire, BodiesOverOneMegabyteAreRefusedBothWays) {
 }
 
 TEST(ConduitWire, LargeMessagesTravelInSeveralRecordsAndReassemble) {
-    PlistDict d;
-    d["blob"] = PlistValue(PlistData(300 * 1024, 0x5A));
-    const auto body = encode(PlistValue(d));
-    RecordHeader h;
-    h.flags = kFlagRequest;
-    h.messageId = 42;
-    const auto records = BuildRecords(h, body);
+    std::vector<uint8_t> body;
+    const auto records = blobRecords(300 * 1024, 0x5A, 42, &body);
     ASSERT_GT(records.size(), 4u);
     RecordAssembler a;
     std::string why;
@@ -211,13 +219,7 @@ TEST(ConduitWire, LargeMessagesTravelInSeveralRecordsAndReassemble) {
 }
 
 TEST(ConduitWire, BrokenRecordSequencesAreMalformed) {
-    PlistDict d;
-    d["blob"] = PlistValue(PlistData(150 * 1024, 0x11));
-    const auto body = encode(PlistValue(d));
-    RecordHeader h;
-    h.flags = kFlagRequest;
-    h.messageId = 7;
-    const auto records = BuildRecords(h, body);
+    const auto records = blobRecords(150 * 1024, 0x11, 7);
     ASSERT_EQ(records.size(), 3u);
     auto expectMalformed = [](std::vector<std::vector<uint8_t>> seq, const char* name) {
         RecordAssembler a;
