@@ -5,6 +5,7 @@
 #include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnCommandTable.h"
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnExceptionFence.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnLog.h"
 #include "Platform/CodeSignRegistry.h"

@@ -3,13 +3,11 @@
 // different peers run concurrently.
 #pragma once
 
-#include <exception>
 #include <memory>
 #include <optional>
 
 #include "Daemon/TarnClientIdentity.h"
 #include "Daemon/TarnError.h"
-#include "Daemon/TarnExceptionFence.h"
 #include "Platform/PropertyList.h"
 
 namespace tarn {
