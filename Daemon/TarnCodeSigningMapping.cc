@@ -559,3 +559,26 @@ void TarnHandleGetCodeSigningInfoCommand(const TarnRequestContext& context,
 }
 
 }  // namespace tarn
+
+namespace tarn {
+
+// Not built yet: the processing of code-signing information.
+TarnStatus TarnCodeSigningMapping::processCodeSigningInfo(const std::optional<PlistDict>&,
+                                                          const std::string&, const PlistDict&,
+                                                          TarnCommandQueue*) {
+    return {};
+}
+
+TarnStatus TarnCodeSigningMapping::_onQueue_processCodeSigningInfo(const std::optional<PlistDict>&,
+                                                                   const std::string&,
+                                                                   const PlistDict&,
+                                                                   const std::optional<PlistDict>&,
+                                                                   TarnCommandQueue*) {
+    return {};
+}
+
+TarnStatus TarnCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
+    return {};
+}
+
+}  // namespace tarn

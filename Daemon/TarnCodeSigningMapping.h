@@ -33,9 +33,11 @@
 #include <vector>
 
 #include "Daemon/TarnCodeSigningEntry.h"
+#include "Daemon/TarnContainerClass.h"
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnRequestContext.h"
 #include "Daemon/TarnResult.h"
+#include "Daemon/TarnUserIdentity.h"
 #include "Platform/Dispatch.h"
 #include "Platform/Path.h"
 #include "Platform/PropertyList.h"
@@ -124,6 +126,29 @@ public:
 
     // ---- changes ----
 
+    // Option keys of processCodeSigningInfo().
+    static constexpr const char* kOptionDataContainerClass =
+        "com.ostrea.TarnKeeper.DataContainerClass";
+    static constexpr const char* kOptionParentBundleID = "com.ostrea.TarnKeeper.ParentBundleID";
+    static constexpr const char* kOptionRegisteredByCaller = "RegByCaller";
+    static constexpr const char* kOptionPlaceholder =
+        "com.ostrea.TarnKeeper.PlaceholderEntitlements";
+    static constexpr const char* kOptionAdvanceCopy = "com.ostrea.TarnKeeper.AdvanceCopy";
+    // The key of the code-signing info that holds the entitlements.
+    static constexpr const char* kEntitlementsKey = "com.ostrea.TarnKeeper.Entitlements";
+
+    // Records the installer's (or a caller's) code-signing info for the
+    // identifier; empty info removes the identifier's record. Group and
+    // system containers the new entitlements no longer claim are staged for
+    // deletion on `commandQueue`, to run after the mapping work. The old
+    // entitlements are read first, outside the queue.
+    TarnStatus processCodeSigningInfo(const std::optional<PlistDict>& codeSigningInfo,
+                                      const std::string& forIdentifier,
+                                      const PlistDict& withOptions, TarnCommandQueue* commandQueue);
+    // Under the global write lock: invalidates every entry whose bundle has
+    // no container, except caller-registered ones and plug-ins with a parent.
+    TarnStatus invalidateCodeSigningInfoForAppsWithoutBundleContainer();
+
     TarnStatus invalidateCodeSigningInfoForIdentifier(const std::string& identifier);
     TarnStatus invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier);
     TarnStatus removeAllAdvanceCopiesWithError();
@@ -157,6 +182,31 @@ public:
         const TarnCodeSigningEntryRef& entry, bool externalRequest);
 
     // ---- on the queue ----
+
+    TarnStatus _onQueue_processCodeSigningInfo(const std::optional<PlistDict>& codeSigningInfo,
+                                               const std::string& forIdentifier,
+                                               const PlistDict& withOptions,
+                                               const std::optional<PlistDict>& oldEntitlements,
+                                               TarnCommandQueue* commandQueue);
+
+    // ---- group containers (TarnCodeSigningMappingGroups.cc) ----
+
+    // Called while new info is processed, before its entry is written: the
+    // groups the old list names and the new one does not lose a reference.
+    void _onQueue_handleChangeFromOldGroupContainerIds(
+        const std::optional<std::vector<std::string>>& oldGroupContainerIds,
+        const std::optional<std::vector<std::string>>& toNewGroupContainerIds, TarnGroupType ofType,
+        TarnCommandQueue* commandQueue);
+    void _onQueue_removeReferenceForGroupIdentifiers(
+        const std::vector<std::string>& groupIdentifiers, TarnGroupType ofType,
+        TarnCommandQueue* commandQueue);
+    // Stages the deletion of each group whose only reference left is the
+    // changing identifier's own (count 1), for one user; counts go down as
+    // the list is walked.
+    void _onQueue_removeGroupContainersIfNeededforUserIdentity(
+        const TarnUserIdentityRef& userIdentity, TarnContainerClass groupContainerClass,
+        const std::vector<std::string>& identifiers, TarnCountedSet& referenceCounts,
+        TarnCommandQueue* commandQueue);
 
     // Logs a failure other than TarnErrorDatabaseNotFound before answering it.
     TarnResult<TarnCodeSigningEntryRef> _onQueue_codeSigningEntryForIdentifier(const std::string& identifier);
