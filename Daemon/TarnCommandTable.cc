@@ -1,5 +1,6 @@
 #include "Daemon/TarnCommandTable.h"
 
+#include "Daemon/TarnCodeSigningCommands.h"
 #include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnContainerCommands.h"
 #include "Daemon/TarnError.h"
@@ -32,13 +33,13 @@ const TarnCommandTableRow gTarnCommandTable[kTarnCommandCount] = {
     {.command = 11, .entitlement = kTarnEntitlementWipeContainer},  // wipe an entitled data container
     {.command = 12, .entitlement = kTarnEntitlementDeleteContainerContent},  // wipe any container
     {.command = 13, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // the client's group containers
-    {.command = 14, .entitlement = kAllowed, .lookupAllowed = 1},  // group identifiers of an owner
+    {.command = 14, .handler = TarnHandleGroupIdentifiersCommand, .entitlement = kAllowed, .lookupAllowed = 1},  // group identifiers of an owner
     {.command = 15, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // path of a system container
     {.command = 16, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // system group containers of an owner
     {.command = 17, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // path of one system group container
-    {.command = 18, .entitlement = kAllowed},  // record code-signing information
+    {.command = 18, .handler = TarnHandleProcessCodeSigningInfoCommand, .entitlement = kAllowed},  // record code-signing information
     {.command = 19, .handler = TarnHandleGetCodeSigningInfoCommand, .entitlement = kAllowed},  // read code-signing information
-    {.command = 20, .entitlement = kAllowed},  // invalidate code-signing info without bundle
+    {.command = 20, .handler = TarnHandleInvalidateAppsWithoutBundleCommand, .entitlement = kAllowed},  // invalidate code-signing info without bundle
     {.command = 21, .entitlement = kAllowed, .replyOnReturn = 0},  // set data protection
     {.command = 22, .handler = TarnHandleRecreateStructureCommand, .entitlement = kAllowed},  // same as 8
     {.command = 23, .handler = TarnHandleDiskUsageCommand, .entitlement = kAllowed, .lookupAllowed = 1},  // disk usage

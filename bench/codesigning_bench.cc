@@ -19,27 +19,12 @@
 
 #include "Daemon/TarnSQLiteDB.h"
 #include "Platform/PlatformLog.h"
+#include "bench/StoreFloor.h"
 
 namespace fs = std::filesystem;
 using Clock = std::chrono::steady_clock;
 
 namespace {
-
-// The store's initialisation text, repeated here so that the floor does not
-// depend on the code under measurement.
-constexpr const char* kInit =
-    "PRAGMA locking_mode = EXCLUSIVE;PRAGMA journal_mode = WAL;PRAGMA foreign_keys = ON;PRAGMA auto_vacuum = FULL;"
-    "CREATE TABLE IF NOT EXISTS code_signing_info(id INTEGER PRIMARY KEY AUTOINCREMENT,code_signing_id_text TEXT "
-    "NOT NULL UNIQUE,invalid INTEGER NOT NULL DEFAULT 0,placeholder INTEGER NOT NULL DEFAULT 0,registered_by_caller "
-    "INTEGER NOT NULL DEFAULT 0,data_container_class INTEGER NOT NULL DEFAULT 0);"
-    "CREATE TABLE IF NOT EXISTS code_signing_data(id INTEGER PRIMARY KEY AUTOINCREMENT,cs_info_id INTEGER NOT NULL "
-    "UNIQUE,data BLOB NOT NULL,FOREIGN KEY(cs_info_id) REFERENCES code_signing_info(id) ON DELETE CASCADE);"
-    "CREATE TABLE IF NOT EXISTS child_bundles(id INTEGER PRIMARY KEY AUTOINCREMENT,child_code_signing_id_text TEXT "
-    "NOT NULL UNIQUE,parent_id INTEGER NOT NULL,FOREIGN KEY(parent_id) REFERENCES code_signing_info(id) ON DELETE "
-    "CASCADE);"
-    "CREATE INDEX IF NOT EXISTS code_signing_id_text_idx ON code_signing_info(code_signing_id_text);"
-    "CREATE INDEX IF NOT EXISTS cs_info_id_idx ON code_signing_data(cs_info_id);"
-    "CREATE INDEX IF NOT EXISTS parent_id_idx ON child_bundles(parent_id);";
 
 struct Result {
     double upsertOps = 0;
@@ -88,85 +73,35 @@ Result runStore(const fs::path& path, const std::vector<tarn::TarnCodeSigningEnt
     return r;
 }
 
-void check(int rc, int want, sqlite3* db, const char* what) {
-    if (rc != want) {
-        std::fprintf(stderr, "%s: %s\n", what, sqlite3_errmsg(db));
-        std::exit(1);
-    }
-}
-
-void exec(sqlite3* db, const char* sql) { check(sqlite3_exec(db, sql, nullptr, nullptr, nullptr), SQLITE_OK, db, sql); }
-
-// One prepared statement per use, as the store does: bare SQLite, same work.
-void runStep(sqlite3* db, const char* sql, const std::function<void(sqlite3_stmt*)>& bind, bool wantRow = false,
-             const std::function<void(sqlite3_stmt*)>& row = nullptr) {
-    sqlite3_stmt* st = nullptr;
-    check(sqlite3_prepare_v2(db, sql, -1, &st, nullptr), SQLITE_OK, db, sql);
-    bind(st);
-    int rc;
-    while ((rc = sqlite3_step(st)) == SQLITE_ROW) {
-        if (row) row(st);
-        if (!wantRow) break;
-    }
-    sqlite3_finalize(st);
-}
-
 Result runBare(const fs::path& path, const std::vector<std::vector<uint8_t>>& blobs) {
     Result r;
-    sqlite3* db = nullptr;
-    check(sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr), SQLITE_OK, db,
-          "open");
-    exec(db, kInit);
+    tarn::bench::BareStore db(path.string());
     auto start = Clock::now();
-    for (size_t i = 0; i < blobs.size(); ++i) {
-        const std::string id = identifier(i);
-        auto bindFlags = [&](sqlite3_stmt* st) {
-            sqlite3_bind_int(st, 1, 0);
-            sqlite3_bind_int(st, 2, 0);
-            sqlite3_bind_int(st, 3, 0);
-            sqlite3_bind_int64(st, 4, 2);
-            sqlite3_bind_text(st, 5, id.c_str(), -1, SQLITE_TRANSIENT);
-        };
-        exec(db, "BEGIN;");
-        runStep(db,
-                "UPDATE code_signing_info SET invalid=?, placeholder=?, registered_by_caller=?, data_container_class=? "
-                "WHERE code_signing_id_text=?;",
-                bindFlags);
-        if (sqlite3_changes(db) != 1) {
-            runStep(db,
-                    "INSERT INTO code_signing_info (invalid, placeholder, registered_by_caller, data_container_class, "
-                    "code_signing_id_text) VALUES (?, ?, ?, ?, ?);",
-                    bindFlags);
-        }
-        runStep(db,
-                "INSERT OR REPLACE INTO code_signing_data (cs_info_id, data) SELECT id, ? FROM code_signing_info WHERE "
-                "code_signing_id_text = ?;",
-                [&](sqlite3_stmt* st) {
-                    sqlite3_bind_blob64(st, 1, blobs[i].data(), blobs[i].size(), SQLITE_STATIC);
-                    sqlite3_bind_text(st, 2, id.c_str(), -1, SQLITE_TRANSIENT);
-                });
-        exec(db, "COMMIT;");
-    }
+    for (size_t i = 0; i < blobs.size(); ++i) db.upsert(identifier(i), blobs[i], 2);
     r.upsertOps = opsPerSecond(blobs.size(), Clock::now() - start);
     start = Clock::now();
     size_t bytes = 0;
     for (size_t i = 0; i < blobs.size(); ++i) {
         const std::string id = identifier(i);
         auto bindId = [&](sqlite3_stmt* st) { sqlite3_bind_text(st, 1, id.c_str(), -1, SQLITE_TRANSIENT); };
-        runStep(db,
-                "SELECT code_signing_data.data, code_signing_info.invalid, code_signing_info.placeholder, "
-                "code_signing_info.registered_by_caller, code_signing_info.data_container_class FROM code_signing_info, "
-                "code_signing_data WHERE code_signing_info.id = code_signing_data.cs_info_id AND "
-                "code_signing_info.code_signing_id_text = ?;",
-                bindId, false, [&](sqlite3_stmt* st) { bytes += static_cast<size_t>(sqlite3_column_bytes(st, 0)); });
-        runStep(db,
-                "SELECT child_bundles.child_code_signing_id_text FROM child_bundles, code_signing_info WHERE "
-                "code_signing_info.code_signing_id_text = ? AND child_bundles.parent_id=code_signing_info.id;",
-                bindId, true);
+        db.runStep(
+            "SELECT code_signing_data.data, code_signing_info.invalid, "
+            "code_signing_info.placeholder, "
+            "code_signing_info.registered_by_caller, code_signing_info.data_container_class FROM "
+            "code_signing_info, "
+            "code_signing_data WHERE code_signing_info.id = code_signing_data.cs_info_id AND "
+            "code_signing_info.code_signing_id_text = ?;",
+            bindId, false,
+            [&](sqlite3_stmt* st) { bytes += static_cast<size_t>(sqlite3_column_bytes(st, 0)); });
+        db.runStep(
+            "SELECT child_bundles.child_code_signing_id_text FROM child_bundles, code_signing_info "
+            "WHERE "
+            "code_signing_info.code_signing_id_text = ? AND "
+            "child_bundles.parent_id=code_signing_info.id;",
+            bindId, true);
     }
     r.readOps = opsPerSecond(blobs.size(), Clock::now() - start);
     if (bytes == 0) std::exit(1);
-    sqlite3_close(db);
     return r;
 }
 

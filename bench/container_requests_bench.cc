@@ -55,11 +55,6 @@ namespace {
 constexpr uint64_t kClass = 2;  // application data: the most common container
 constexpr uid_t kOwner = 501;
 
-void die(const std::string& what) {
-    std::fprintf(stderr, "%s\n", what.c_str());
-    std::exit(1);
-}
-
 PlistValue request0(const std::string& identifier, bool create) {
     PlistDict d;
     d["Command"] = PlistValue(uint64_t{0});
@@ -69,15 +64,7 @@ PlistValue request0(const std::string& identifier, bool create) {
     return PlistValue(std::move(d));
 }
 
-// One request; exits on transport failure or an error reply.
-PlistValue send(Client& client, const PlistValue& request) {
-    std::string why;
-    auto reply = client.sendSync(request, 10000ms, &why);
-    if (!reply) die("request failed: " + why);
-    const PlistValue* e = reply->find("ReplyError");
-    if (e && e->asUInt64() != TarnSuccess) die("daemon answered " + reply->description());
-    return std::move(*reply);
-}
+PlistValue send(Client& client, const PlistValue& request) { return sendOrDie(client, request); }
 
 double since(Clock::time_point t0) {
     return std::chrono::duration<double, std::micro>(Clock::now() - t0).count();
@@ -269,19 +256,10 @@ int main(int argc, char** argv) {
 
     const std::string root = makeScratchRoot();
     if (root.empty()) die("cannot make a scratch root");
-    harness::ChildProcess::Options opts;
-    opts.stdoutPath = root + "/daemon.out";
-    opts.stderrPath = root + "/daemon.err";
-    auto daemon = harness::ChildProcess::spawn({TARN_BINARY_DIR "/tarnkeeperd", "--root", root},
-                                               opts, &why);
-    if (!daemon) die("cannot start " TARN_BINARY_DIR "/tarnkeeperd: " + why);
-    const std::string socket = root + "/run/com.ostrea.tarnkeeperd.socket";
-    std::unique_ptr<Client> client;
-    for (const auto deadline = Clock::now() + 15s; !client && Clock::now() < deadline;) {
-        client = Client::connect(socket, &why);
-        if (!client && daemon->wait(50ms)) die("the daemon exited; see " + opts.stderrPath);
-    }
-    if (!client) die("no daemon socket: " + why);
+    BenchDaemon started = startDaemon(root);
+    auto& daemon = started.process;
+    auto& client = started.client;
+    const std::string& socket = started.socket;
     // The direct side writes the very bytes the daemon wrote for this one.
     const PlistValue made = send(*client, request0("bench.lookup", true));
     const PlistValue* path = made.find("ReplyPath");
