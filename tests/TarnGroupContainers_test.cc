@@ -1,6 +1,6 @@
-// Group containers: which ones a change of entitlements stages for deletion.
-// Three users: the personal one and enterprise E-1 have homes, enterprise E-2
-// has none.
+// Group containers: which ones a change of entitlements stages for deletion,
+// what the boot reconciliation removes, and the owner look-up. Three users:
+// the personal one and enterprise E-1 have homes, enterprise E-2 has none.
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -280,6 +280,21 @@ TEST_F(TarnGroupContainersTest, AChangeStagesOnlyGroupsItHeldTheLastReferenceTo)
     EXPECT_FALSE(fs::exists(root_.at(kE2Home))) << "a user without a home is left alone";
 }
 
+// A group no stored entitlement names is not the change's to remove: the
+// boot reconciliation does that.
+TEST_F(TarnGroupContainersTest, ADroppedGroupNobodyNamesWaitsForReconciliation) {
+    store(*mapping_, "com.a", entryWith(appGroups({"other"})));
+    createGroup(personal(), "orphan");
+    TarnCommandQueue queue;
+    change(*mapping_, Ids{"orphan"}, Ids{}, TarnGroupTypeApplication, queue);
+    EXPECT_TRUE(stagedOn(queue).empty());
+
+    TarnGroupManager manager(users());
+    manager.reconcileGroupContainersOfType(TarnGroupTypeApplication, &queue);
+    EXPECT_EQ(stagedOn(queue),
+              (std::vector<Staged>{{"501", "orphan", TarnContainerClassAppGroup, false}}));
+}
+
 TEST_F(TarnGroupContainersTest, StagedDeletionsTakeTheContainersOfEveryUserWithAHome) {
     store(*mapping_, "com.a", entryWith(appGroups({"g", "shared"})));
     store(*mapping_, "com.b", entryWith(appGroups({"shared"})));
@@ -300,6 +315,129 @@ TEST_F(TarnGroupContainersTest, StagedDeletionsTakeTheContainersOfEveryUserWithA
         EXPECT_FALSE(cached(user, "g"));
         EXPECT_TRUE(cached(user, "shared"));
     }
+}
+
+// Boot reconciliation stages exactly the containers no stored entry names,
+// without locking (its caller holds the global write lock), by their UUIDs.
+TEST_F(TarnGroupContainersTest, ReconciliationStagesExactlyTheUnreferencedContainers) {
+    store(*mapping_, "com.a",
+          entryWith({{kTarnApplicationGroupsEntitlement, PlistArray{"used"}},
+                     {kTarnSystemGroupsEntitlement, PlistArray{"systemgroup.used"}}}));
+    store(*mapping_, "com.gone",
+          entryWith(appGroups({"by-invalid"}), [](auto& e) { e.setInvalid(true); }));
+    store(*mapping_, "com.old",
+          entryWith({{kTarnSystemGroupContainersEntitlement, "systemgroup.legacy"}}));
+    std::map<std::pair<std::string, std::string>, Uuid> uuids;
+    for (const auto& user : {personal(), e1()}) {
+        for (const char* group : {"used", "by-invalid", "orphan"}) {
+            if (auto made = createGroup(user, group))
+                uuids[{user->identifier(), group}] = made->uuid();
+        }
+    }
+    for (const char* group : {"systemgroup.used", "systemgroup.legacy", "systemgroup.orphan"})
+        createGroup(personal(), group, TarnContainerClassSystemGroup);
+
+    TarnGroupManager manager(users());
+    TarnCommandQueue queue;
+    {
+        TarnGlobalLockHolder lock(TarnGlobalLockHolder::Mode::Write);
+        manager.reconcileGroupContainersOfType(TarnGroupTypeApplication, &queue);
+    }
+    ASSERT_EQ(stagedOn(queue), forUsersWithHomes({"orphan"}, /*useLocking=*/false));
+    for (const auto& command : queue.commands()) {
+        auto stage = std::static_pointer_cast<TarnCommandStageForDelete>(command);
+        auto concrete = std::dynamic_pointer_cast<const TarnConcreteContainerIdentity>(
+            stage->containerIdentities().front());
+        ASSERT_TRUE(concrete) << "the container found, not whatever holds its name later";
+        EXPECT_EQ(concrete->uuid(), (uuids[{concrete->userIdentity()->identifier(), "orphan"}]));
+    }
+    {
+        TarnGlobalLockHolder lock(TarnGlobalLockHolder::Mode::Write);
+        ASSERT_TRUE(queue.executeAllUntilExhaustedOrError().ok());
+    }
+    for (const auto& user : {personal(), e1()}) {
+        SCOPED_TRACE(user->identifier());
+        EXPECT_FALSE(cached(user, "orphan"));
+        EXPECT_TRUE(cached(user, "used"));
+        EXPECT_TRUE(cached(user, "by-invalid"));
+    }
+    EXPECT_FALSE(fs::exists(root_.at(kE2Home)));
+
+    // System groups: the global class once, for the default user; the older
+    // entitlement key still counts.
+    TarnCommandQueue systemQueue;
+    manager.reconcileGroupContainersOfType(TarnGroupTypeSystem, &systemQueue);
+    const auto staged = stagedOn(systemQueue);
+    ASSERT_EQ(staged.size(), 1u);
+    EXPECT_EQ(staged[0].group, "systemgroup.orphan");
+    EXPECT_EQ(staged[0].containerClass, TarnContainerClassSystemGroup);
+    EXPECT_FALSE(staged[0].useLocking);
+
+    TarnCommandQueue unknownQueue;
+    manager.reconcileGroupContainersOfType(static_cast<TarnGroupType>(2), &unknownQueue);
+    EXPECT_TRUE(stagedOn(unknownQueue).empty()) << "no counts: nothing may go";
+}
+
+TEST_F(TarnGroupContainersTest, OwnerLookUpAnswersTheGroupsOfTheClass) {
+    store(*mapping_, "com.a",
+          entryWith({{kTarnApplicationGroupsEntitlement, PlistArray{"g2", "g1"}},
+                     {kTarnSystemGroupsEntitlement, PlistArray{"systemgroup.s", "nope"}}}));
+    store(*mapping_, "com.old",
+          entryWith({{kTarnSystemGroupContainersEntitlement, "systemgroup.legacy"}}));
+    store(*mapping_, "com.none", entryWith({{"com.ostrea.security.system-container", true}}));
+    store(*mapping_, "com.broken",
+          entryWith({{kTarnApplicationGroupsEntitlement, PlistArray{"g", uint64_t{1}}}}));
+    TarnGroupManager manager(users());
+
+    struct Case {
+        std::optional<std::string> owner;
+        TarnContainerClass containerClass;
+        Ids expected;
+    };
+    for (const Case& c : {Case{"com.a", TarnContainerClassAppGroup, {"g2", "g1"}},
+                          Case{"com.a", TarnContainerClassSystemGroup, {"systemgroup.s"}},
+                          Case{"com.old", TarnContainerClassSystemGroup, {"systemgroup.legacy"}},
+                          Case{"com.old", TarnContainerClassAppGroup, {}},
+                          Case{"com.none", TarnContainerClassAppGroup, {}},
+                          Case{"com.broken", TarnContainerClassAppGroup, {}},
+                          Case{"com.unknown", TarnContainerClassSystemGroup, {}},
+                          Case{"", TarnContainerClassAppGroup, {}}}) {
+        for (bool useLocking : {false, true}) {
+            SCOPED_TRACE(*c.owner + " class " + std::to_string(c.containerClass) +
+                         (useLocking ? " locking" : ""));
+            auto groups = manager.groupContainerIdentifiersForOwnerIdentifier(
+                c.owner, c.containerClass, useLocking);
+            ASSERT_TRUE(groups.ok()) << groups.code(TarnSuccess);
+            EXPECT_EQ(*groups, c.expected);
+        }
+    }
+
+    auto notAString = manager.groupContainerIdentifiersForOwnerIdentifier(
+        std::nullopt, TarnContainerClassAppGroup, /*useLocking=*/true);
+    EXPECT_EQ(notAString.code(TarnSuccess), TarnErrorInvalidArgument);
+}
+
+TEST_F(TarnGroupContainersTest, OwnerLookUpWithLockingWaitsForTheGlobalLock) {
+    store(*mapping_, "com.a", entryWith(appGroups({"g"})));
+    TarnGroupManager manager(users());
+    std::future<TarnResult<Ids>> answer;
+    {
+        TarnGlobalLockHolder lock(TarnGlobalLockHolder::Mode::Read);
+        // Without locking it does not wait.
+        auto unlocked = manager.groupContainerIdentifiersForOwnerIdentifier(
+            "com.a", TarnContainerClassAppGroup, /*useLocking=*/false);
+        EXPECT_EQ(unlocked.valueOr({}), Ids{"g"});
+        answer = std::async(std::launch::async, [&] {
+            return manager.groupContainerIdentifiersForOwnerIdentifier(
+                "com.a", TarnContainerClassAppGroup, /*useLocking=*/true);
+        });
+        EXPECT_EQ(answer.wait_for(std::chrono::milliseconds(100)), std::future_status::timeout)
+            << "answered while a reader held the global lock";
+    }
+    auto groups = answer.get();
+    ASSERT_TRUE(groups.ok());
+    EXPECT_EQ(*groups, Ids{"g"});
+    EXPECT_EQ(gTarnLocks.TEST_allReaderWriterState(), 0) << "the lookup let its lock go";
 }
 
 }  // namespace
