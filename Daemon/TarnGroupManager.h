@@ -44,7 +44,7 @@ class TarnGroupManager {
     // class 13, application groups otherwise); an empty list when none.
     // `ownerIdentifier` empty: the request's value was not a string
     // (TarnErrorInvalidArgument). With `useLocking` the global write lock is
-    // held for the call.
+    // held for the call. An exception inside is TarnErrorException.
     TarnResult<std::vector<std::string>> groupContainerIdentifiersForOwnerIdentifier(
         const std::optional<std::string>& ownerIdentifier, TarnContainerClass groupContainerClass,
         bool useLocking);
