@@ -1,5 +1,6 @@
 #include "Daemon/TarnCodeSigningMapping.h"
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
@@ -9,6 +10,10 @@
 #include <system_error>
 #include <vector>
 
+#include "Daemon/TarnCommandQueue.h"
+#include "Daemon/TarnCommandStageForDelete.h"
+#include "Daemon/TarnContainerIdentity.h"
+#include "Daemon/TarnExceptionFence.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnSQLiteDB.h"
 #include "Daemon/TarnUserIdentityCache.h"
@@ -33,6 +38,22 @@ const std::optional<PlistDict> kNoInfo;
 
 // The store's answer for an identifier it has no record of.
 bool isNotFound(const TarnErrorRef& e) { return e && e->code() == TarnErrorDatabaseNotFound; }
+
+// A group list as log lines print it; "(null)" when absent.
+std::optional<PlistValue> describedIds(const std::optional<std::vector<std::string>>& ids) {
+    if (!ids) return std::nullopt;
+    return PlistValue(PlistArray(ids->begin(), ids->end()));
+}
+
+const PlistValue* optionValue(const PlistDict& options, const char* key) {
+    auto it = options.find(key);
+    return it == options.end() ? nullptr : &it->second;
+}
+
+bool optionIsTrue(const PlistDict& options, const char* key) {
+    const PlistValue* value = optionValue(options, key);
+    return value && value->truthy();
+}
 
 }  // namespace
 
@@ -497,24 +518,18 @@ TarnStatus TarnCodeSigningMapping::invalidateCodeSigningInfoForIdentifier(const 
 
 void TarnCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChildren(
     const std::string& identifier, TarnCommandQueue* commandQueue) {
-    // Group clean-up (reference counts, staged deletion of unused groups on
-    // `commandQueue`) joins here once the mapping's write side lands; until
-    // then only the records themselves go.
-    (void)commandQueue;
-    if (identifier.empty()) return;
-    runOnQueue([&] {
-        std::vector<std::string> identifiers = _onQueue_childBundleIdentifiersForParentIdentifier(identifier);
-        identifiers.push_back(identifier);
-        for (const std::string& each : identifiers) {
-            // An unreadable record is still deleted; only a missing one is skipped.
-            TarnResult<TarnCodeSigningEntryRef> stored = _onQueue_codeSigningEntryForIdentifier(each);
-            if (!stored.ok() && isNotFound(stored.error())) continue;
-            TarnStatus deleted = codeSigningMappingDB_->deleteCodeSigningEntryWithIdentifier(each);
-            if (deleted.ok()) continue;
+    // Children first: each is processed as a removal of its own, so that the
+    // groups and system container it alone claimed go with it.
+    std::vector<std::string> identifiers = childBundleIdentifiersForParentIdentifier(identifier);
+    identifiers.push_back(identifier);
+    for (const std::string& each : identifiers) {
+        TarnStatus cleared = processCodeSigningInfo(std::nullopt, each, PlistDict{}, commandQueue);
+        if (!cleared.ok()) {
             TarnLog(kLogError, "removeCodeSigningDictionariesForIdentifierAndItsChildren",
-                    "Failed to clear entitlements for %@ : %llu", each, deleted.code(TarnErrorDatabase));
+                    "Failed to clear entitlements for %@ : %llu", each,
+                    cleared.code(TarnErrorDatabase));
         }
-    });
+    }
 }
 
 TarnStatus TarnCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(
@@ -558,23 +573,149 @@ void TarnHandleGetCodeSigningInfoCommand(const TarnRequestContext& context,
     reply.set("ReplyInfoDictionary", std::move(*info));
 }
 
-}  // namespace tarn
+// ---- processing of code-signing info ----
 
-namespace tarn {
-
-// Not built yet: the processing of code-signing information.
-TarnStatus TarnCodeSigningMapping::processCodeSigningInfo(const std::optional<PlistDict>&,
-                                                          const std::string&, const PlistDict&,
-                                                          TarnCommandQueue*) {
-    return {};
+TarnStatus TarnCodeSigningMapping::processCodeSigningInfo(
+    const std::optional<PlistDict>& codeSigningInfo, const std::string& forIdentifier,
+    const PlistDict& withOptions, TarnCommandQueue* commandQueue) {
+    // Read through the public operation, before the queue is entered: the
+    // read is where information kept elsewhere gets imported.
+    std::optional<PlistDict> oldEntitlements = entitlementsForIdentifier(forIdentifier);
+    TarnStatus status;
+    runOnQueue([&] {
+        status = _onQueue_processCodeSigningInfo(codeSigningInfo, forIdentifier, withOptions,
+                                                 oldEntitlements, commandQueue);
+    });
+    return status;
 }
 
-TarnStatus TarnCodeSigningMapping::_onQueue_processCodeSigningInfo(const std::optional<PlistDict>&,
-                                                                   const std::string&,
-                                                                   const PlistDict&,
-                                                                   const std::optional<PlistDict>&,
-                                                                   TarnCommandQueue*) {
-    return {};
+TarnStatus TarnCodeSigningMapping::_onQueue_processCodeSigningInfo(
+    const std::optional<PlistDict>& codeSigningInfo, const std::string& forIdentifier,
+    const PlistDict& withOptions, const std::optional<PlistDict>& oldEntitlements,
+    TarnCommandQueue* commandQueue) {
+    assertOnQueue();
+    constexpr const char* kTag = "_onQueue_processCodeSigningInfo";
+    return TarnFenceExceptions(kTag, [&]() -> TarnStatus {
+        if (forIdentifier.empty())
+            return TARN_ERROR_CODE_IN(kTag, TarnErrorMissingIdentifier, nullptr);
+
+        TarnResult<TarnCodeSigningEntryRef> read =
+            _onQueue_codeSigningEntryForIdentifier(forIdentifier);
+        if (!read.ok() && !isNotFound(read.error())) return read.error();
+        const TarnCodeSigningEntryRef existing = read.ok() ? std::move(*read) : nullptr;
+
+        auto entry = std::make_shared<TarnCodeSigningEntry>();
+        if (const PlistValue* dataClass = optionValue(withOptions, kOptionDataContainerClass)) {
+            entry->setDataContainerClass(dataClass->asUInt64().value_or(0));
+        }
+
+        // Written in this order: the parent before the identifier.
+        std::vector<TarnCodeSigningEntryRef> values;
+        std::vector<std::string> identifiers;
+
+        const PlistValue* parentOption = optionValue(withOptions, kOptionParentBundleID);
+        const std::string* parentIdentifier = parentOption ? parentOption->asString() : nullptr;
+        if (parentIdentifier && !parentIdentifier->empty()) {
+            TarnResult<TarnCodeSigningEntryRef> parentRead =
+                _onQueue_codeSigningEntryForIdentifier(*parentIdentifier);
+            if (!parentRead.ok() && !isNotFound(parentRead.error())) return parentRead.error();
+            // A parent without a record gets an empty one, which the batch
+            // does not store: the child is recorded once the parent is.
+            auto parent = parentRead.ok() ? std::make_shared<TarnCodeSigningEntry>(**parentRead)
+                                          : std::make_shared<TarnCodeSigningEntry>();
+            std::vector<std::string> children = parent->childBundleIdentifiers();
+            if (std::find(children.begin(), children.end(), forIdentifier) == children.end()) {
+                children.push_back(forIdentifier);
+                TarnLog(kLogDebug, kTag,
+                        "Staging Child Bundles: %@ for parent ID: %@ by appending: %@",
+                        PlistValue(PlistArray(children.begin(), children.end())), *parentIdentifier,
+                        forIdentifier);
+                parent->setChildBundleIdentifiers(std::move(children));
+                values.push_back(std::move(parent));
+                identifiers.push_back(*parentIdentifier);
+            }
+        }
+
+        entry->setRegisteredByCaller(optionIsTrue(withOptions, kOptionRegisteredByCaller));
+        entry->setPlaceholder(optionIsTrue(withOptions, kOptionPlaceholder));
+        entry->setAdvanceCopy(optionIsTrue(withOptions, kOptionAdvanceCopy));
+        entry->setCodeSigningInfo(codeSigningInfo);
+
+        if (!existing || !existing->isEqual(*entry)) {
+            const PlistDict* newEntitlements = entry->entitlements();
+            const PlistDict* previous = oldEntitlements ? &*oldEntitlements : nullptr;
+
+            if (_entitlementsHasSystemContainer(previous) &&
+                !_entitlementsHasSystemContainer(newEntitlements)) {
+                _onQueue_stageSystemContainerForDelete(forIdentifier, commandQueue);
+            }
+
+            auto handOver = [&](const std::optional<std::vector<std::string>>& oldIds,
+                                const std::optional<std::vector<std::string>>& newIds,
+                                TarnGroupType type) {
+                if (!oldIds && !newIds) return;
+                if (TEST_groupChangeHook) TEST_groupChangeHook(oldIds, newIds, type);
+                _onQueue_handleChangeFromOldGroupContainerIds(oldIds, newIds, type, commandQueue);
+            };
+            const auto newAppGroups =
+                _appGroupIdentifiersForIdentifier(forIdentifier, newEntitlements);
+            const auto oldAppGroups = _appGroupIdentifiersForIdentifier(forIdentifier, previous);
+            handOver(oldAppGroups, newAppGroups, TarnGroupTypeApplication);
+
+            // The new list is read as the entitlement stands (the older key
+            // when the current one names none); the old one through the
+            // system-group rules.
+            auto newSystemGroups = _copyApplicationGroupEntitlementForIdentifier(
+                forIdentifier, newEntitlements, kTarnSystemGroupsEntitlement);
+            if (!newSystemGroups || newSystemGroups->empty()) {
+                newSystemGroups = _copyApplicationGroupEntitlementForIdentifier(
+                    forIdentifier, newEntitlements, kTarnSystemGroupContainersEntitlement);
+            }
+            const auto oldSystemGroups =
+                _systemGroupIdentifiersForIdentifier(forIdentifier, previous);
+            handOver(oldSystemGroups, newSystemGroups, TarnGroupTypeSystem);
+            PlatformLog("codesignmapping", PlatformLogType::Default,
+                        "Reconciled; old app groups: %@, new app groups: %@, "
+                        "old system groups: %@, new system groups: %@",
+                        describedIds(oldAppGroups), describedIds(newAppGroups),
+                        describedIds(oldSystemGroups), describedIds(newSystemGroups));
+
+            values.push_back(codeSigningInfo ? entry : std::make_shared<TarnCodeSigningEntry>());
+            identifiers.push_back(forIdentifier);
+        }
+
+        if (!values.empty()) {
+            // Write failures are logged by the batch and do not fail the
+            // processing; the arrays are built in pairs, so counts match.
+            (void)_onQueue_setCodeSigningDictionaryValues(values, identifiers);
+        }
+        return {};
+    });
+}
+
+void TarnCodeSigningMapping::_onQueue_stageSystemContainerForDelete(
+    const std::string& identifier, TarnCommandQueue* commandQueue) {
+    assertOnQueue();
+    TarnResult<TarnContainerIdentityRef> identity =
+        TarnContainerIdentity::containerIdentityWithIdentifier(identifier, TarnContainerClass{12});
+    if (!identity.ok()) {
+        TarnLog(kLogError, "_onQueue_processCodeSigningInfo",
+                "Failed to create system container identity for %@: %@", identifier,
+                identity.error());
+        return;
+    }
+    TarnLog(kLogError, "_onQueue_processCodeSigningInfo",
+            "Deleting system container for ID: %@ because it is no longer in the entitlements",
+            identifier);
+    // Without a command queue (tools, tests) there is nowhere to stage it.
+    if (!commandQueue) return;
+    commandQueue->insertCommand(
+        TarnCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+            {std::move(*identity)}, /*useLocking=*/true, [identifier](uint64_t error) {
+                TarnLog(kLogError, "_onQueue_processCodeSigningInfo",
+                        "Failed to destroy system container with identifier %@: %llu", identifier,
+                        error);
+            }));
 }
 
 TarnStatus TarnCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleContainer() {

@@ -6,9 +6,9 @@
 // Concurrency: every store access runs on the mapping's one serial queue,
 // "com.ostrea.TarnKeeper.EntitlementQueue". Public operations enter it
 // synchronously, so they must not be called from it (that would deadlock;
-// it is checked in every build, and stops the process). `_onQueue_` operations must run on it. Work on the queue
-// runs strictly one item at a time in submission order, so a read never sees
-// half of a write.
+// it is checked in every build, and stops the process). `_onQueue_`
+// operations must run on it. Work on the queue runs strictly one item at a
+// time in submission order, so a read never sees half of a write.
 //
 // Lifetime: the shared instance is made on first use and lives for the whole
 // process. Entries handed out are immutable snapshots.
@@ -140,8 +140,11 @@ public:
     // Records the installer's (or a caller's) code-signing info for the
     // identifier; empty info removes the identifier's record. Group and
     // system containers the new entitlements no longer claim are staged for
-    // deletion on `commandQueue`, to run after the mapping work. The old
-    // entitlements are read first, outside the queue.
+    // deletion on `commandQueue` (null: none are staged), to run after the
+    // mapping work. The old entitlements are read first, outside the queue.
+    // Info equal to what is stored writes nothing and stages nothing. Fails
+    // only for a missing identifier, an unreadable record (its error) or an
+    // exception (TarnErrorException); a failed store write is logged only.
     TarnStatus processCodeSigningInfo(const std::optional<PlistDict>& codeSigningInfo,
                                       const std::string& forIdentifier,
                                       const PlistDict& withOptions, TarnCommandQueue* commandQueue);
@@ -152,10 +155,10 @@ public:
     TarnStatus invalidateCodeSigningInfoForIdentifier(const std::string& identifier);
     TarnStatus invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier);
     TarnStatus removeAllAdvanceCopiesWithError();
-    // Deletes the stored records of the identifier's children, then of the
-    // identifier itself; an identifier without a record is skipped. A failure
-    // is logged and the others are still removed. `commandQueue` receives the
-    // follow-up work of group clean-up.
+    // Processes empty info for each of the identifier's children, then for the
+    // identifier itself: their records go, and the group and system
+    // containers they alone claimed are staged for deletion on `commandQueue`.
+    // A failure is logged and the others are still removed.
     void removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier,
                                                                   TarnCommandQueue* commandQueue);
     // A connecting client's own entitlements, offered on every admitted
@@ -183,11 +186,18 @@ public:
 
     // ---- on the queue ----
 
+    // Steps of processCodeSigningInfo() after the old entitlements are read;
+    // an exception inside is fenced here.
     TarnStatus _onQueue_processCodeSigningInfo(const std::optional<PlistDict>& codeSigningInfo,
                                                const std::string& forIdentifier,
                                                const PlistDict& withOptions,
                                                const std::optional<PlistDict>& oldEntitlements,
                                                TarnCommandQueue* commandQueue);
+
+    // Step of processing: stages the deletion of the identifier's system
+    // container (class 12), with locking, on `commandQueue`.
+    void _onQueue_stageSystemContainerForDelete(const std::string& identifier,
+                                                TarnCommandQueue* commandQueue);
 
     // ---- group containers (TarnCodeSigningMappingGroups.cc) ----
 
@@ -238,11 +248,20 @@ public:
     // when it cannot be read; a missing file is a POSIX ENOENT error.
     static TarnResult<PlistDict> _readCodeSigningMappingFromDiskAtURL(const FileURL& url);
 
+    // ---- test access ----
+
+    // Called on the queue with what processing hands to
+    // _onQueue_handleChangeFromOldGroupContainerIds(). Set only while no
+    // processing runs.
+    using GroupChangeHook = std::function<void(
+        const std::optional<std::vector<std::string>>& oldIds,
+        const std::optional<std::vector<std::string>>& newIds, TarnGroupType type)>;
+    GroupChangeHook TEST_groupChangeHook;
+
 private:
     // Runs `work` synchronously on the queue; must be called off it.
     void runOnQueue(const std::function<void()>& work);
     void assertOnQueue() const;
-
     // Constant after construction.
     TarnUserIdentitySharedCache* const userIdentityCache_;
     const DispatchQueueRef queue_;

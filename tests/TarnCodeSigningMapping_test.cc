@@ -1,11 +1,18 @@
-// The read side of the code-signing mapping: views, group lists from
-// entitlements, parent/child look-ups, invalidation, reference counts, the
-// legacy mapping-file import and command 19.
+// The code-signing mapping: views, group lists from entitlements,
+// parent/child look-ups, invalidation, reference counts, the legacy
+// mapping-file import and command 19; the processing of code-signing info
+// and removal with children.
 #include "Daemon/TarnCodeSigningMapping.h"
 
+#include <atomic>
 #include <filesystem>
+#include <stdexcept>
 
+#include "Daemon/TarnCommandQueue.h"
+#include "Daemon/TarnCommandStageForDelete.h"
+#include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnSQLiteDB.h"
+#include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/PlatformLog.h"
 #include "support/ScratchRoot.h"
 
@@ -22,24 +29,71 @@ TarnCodeSigningEntryRef entryWith(PlistDict entitlements, uint64_t dataClass = 2
     return e;
 }
 
+PlistDict infoWith(PlistDict entitlements) {
+    return PlistDict{{kTarnEntitlementsKey, std::move(entitlements)}};
+}
+
 class TarnCodeSigningMappingTest : public test::ScratchRootTest {
 protected:
     void SetUp() override {
         PlatformLogSetQuiet(true);
+        TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
         root_.mkdirs(kLibrary);
     }
-    void TearDown() override { TarnCodeSigningMapping::TEST_setSharedInstance(nullptr); }
+    void TearDown() override {
+        TarnCodeSigningMapping::TEST_setSharedInstance(nullptr);
+        TarnUserIdentityCache::TEST_setPersonasAreSupported(std::nullopt);
+    }
 
     std::unique_ptr<TarnCodeSigningMapping> makeMapping() {
         return std::make_unique<TarnCodeSigningMapping>(
-            nullptr, DispatchQueue::createSerial("com.ostrea.TarnKeeper.EntitlementQueue"),
+            &TarnUserIdentitySharedCache::sharedInstance(),
+            DispatchQueue::createSerial("com.ostrea.TarnKeeper.EntitlementQueue"),
             TarnSQLiteDB::initWithParentDirectoryURL(root_.at(kLibrary)));
     }
 
+    // A private mapping when a test made one, else the shared one: the
+    // container cache, made on first use for the scratch root, must see the
+    // same mapping (a second one could not open the store).
     TarnCodeSigningMapping& mapping() {
-        if (!mapping_) mapping_ = makeMapping();
-        return *mapping_;
+        if (mapping_) return *mapping_;
+        if (!shared_) {
+            TarnCodeSigningMapping::TEST_setSharedInstance(makeMapping());
+            shared_ = TarnCodeSigningMapping::sharedInstance();
+        }
+        return *shared_;
     }
+
+    // Counts the entries the store writes from now on.
+    void countStoreWrites() {
+        mapping().queue()->sync([&] {
+            mapping().codeSigningMappingDB()->TEST_storeStepHook = [this](const char* step) {
+                if (std::string_view(step) == "info") ++writes_;
+            };
+        });
+    }
+
+    TarnStatus process(const std::string& id, std::optional<PlistDict> info,
+                       PlistDict options = {}) {
+        return mapping().processCodeSigningInfo(info, id, options, &commands_);
+    }
+
+    // The staged deletions queued so far, as "identifier/class"; each must lock.
+    std::vector<std::string> staged() {
+        std::vector<std::string> out;
+        for (const auto& command : commands_.commands()) {
+            auto stage = std::dynamic_pointer_cast<TarnCommandStageForDelete>(command);
+            if (!stage || !stage->useLocking()) {
+                out.push_back("unexpected command");
+                continue;
+            }
+            for (const auto& identity : stage->containerIdentities())
+                out.push_back(identity->identifier() + "/" +
+                              std::to_string(identity->containerClass()));
+        }
+        return out;
+    }
+
 
     void store(const std::string& id, const TarnCodeSigningEntryRef& entry) {
         TarnStatus stored;
@@ -55,6 +109,9 @@ protected:
     }
 
     std::unique_ptr<TarnCodeSigningMapping> mapping_;
+    TarnCodeSigningMapping* shared_ = nullptr;
+    TarnCommandQueue commands_;
+    std::atomic<int> writes_{0};
 };
 
 TEST_F(TarnCodeSigningMappingTest, ExternalViewHidesUncommittedAndInvalidEntries) {
@@ -229,7 +286,6 @@ TEST_F(TarnCodeSigningMappingTest, GetCodeSigningInfoCommand) {
     PlistDict info{{kTarnEntitlementsKey, PlistDict{{"k", "v"}}}, {"Extra", uint64_t{1}}};
     store("com.app", std::make_shared<TarnCodeSigningEntry>(info, 2));
     store("com.placeholder", entryWith({}, 2, [](auto& e) { e.setPlaceholder(true); }));
-    TarnCodeSigningMapping::TEST_setSharedInstance(std::move(mapping_));
 
     struct Case {
         PlistValue request;
@@ -272,6 +328,133 @@ TEST_F(TarnCodeSigningMappingTest, BatchWriteDeletesStoresAndChecksCounts) {
     });
     EXPECT_TRUE(written.ok());
     EXPECT_EQ(identifiers(), std::set<std::string>{"com.kept"});
+}
+
+// ---- processing ----
+
+TEST_F(TarnCodeSigningMappingTest, SameInfoTwiceWritesOnceAndDroppedSystemContainerIsStagedOnce) {
+    countStoreWrites();
+    const PlistDict withSystem{{"com.ostrea.security.system-container", true},
+                               {"com.ostrea.security.application-groups", "group.a"}};
+    const PlistDict withoutSystem{{"com.ostrea.security.application-groups", "group.a"}};
+    const PlistDict options{{TarnCodeSigningMapping::kOptionDataContainerClass, uint64_t{2}}};
+    int handOvers = 0;
+    mapping().TEST_groupChangeHook = [&](const auto&, const auto&, TarnGroupType) { ++handOvers; };
+
+    ASSERT_TRUE(process("com.sys", infoWith(withSystem), options).ok());
+    EXPECT_EQ(writes_, 1);
+    EXPECT_TRUE(staged().empty());
+    EXPECT_EQ(mapping().dataContainerTypeForIdentifier("com.sys"), 2u);
+
+    ASSERT_TRUE(process("com.sys", infoWith(withoutSystem), options).ok());
+    EXPECT_EQ(writes_, 2);
+    EXPECT_EQ(staged(), std::vector<std::string>{"com.sys/12"});
+    EXPECT_EQ(handOvers, 2);
+
+    // Nothing changed: no write, nothing staged, nothing handed to the group rules.
+    ASSERT_TRUE(process("com.sys", infoWith(withoutSystem), options).ok());
+    EXPECT_EQ(writes_, 2);
+    EXPECT_EQ(staged().size(), 1u);
+    EXPECT_EQ(handOvers, 2);
+
+    EXPECT_EQ(process("", infoWith(withoutSystem)).code(TarnSuccess), TarnErrorMissingIdentifier);
+}
+
+TEST_F(TarnCodeSigningMappingTest, ChildIsAddedToItsParentOnce) {
+    const PlistDict child{{TarnCodeSigningMapping::kOptionParentBundleID, "com.app"},
+                          {TarnCodeSigningMapping::kOptionDataContainerClass, uint64_t{4}}};
+    ASSERT_TRUE(process("com.app", infoWith({{"k", "app"}})).ok());
+    ASSERT_TRUE(process("com.app.ext", infoWith({{"k", "ext"}}), child).ok());
+    EXPECT_EQ(mapping().childBundleIdentifiersForParentIdentifier("com.app"),
+              std::vector<std::string>{"com.app.ext"});
+    EXPECT_EQ(mapping().parentIdentifierForChildIdentifier("com.app.ext"), "com.app");
+
+    countStoreWrites();
+    ASSERT_TRUE(process("com.app.ext", infoWith({{"k", "ext"}}), child).ok());
+    EXPECT_EQ(writes_, 0);
+    EXPECT_EQ(mapping().childBundleIdentifiersForParentIdentifier("com.app"),
+              std::vector<std::string>{"com.app.ext"});
+
+    // A parent with children never equals new info (which lists none), so it
+    // is written again; its children stay.
+    ASSERT_TRUE(process("com.app", infoWith({{"k", "app"}})).ok());
+    EXPECT_EQ(writes_, 1);
+    EXPECT_EQ(mapping().childBundleIdentifiersForParentIdentifier("com.app"),
+              std::vector<std::string>{"com.app.ext"});
+
+    // A parent without a record is not made up for its child.
+    ASSERT_TRUE(process("com.orphan.ext", infoWith({}),
+                        {{TarnCodeSigningMapping::kOptionParentBundleID, "com.nobody"}})
+                    .ok());
+    EXPECT_EQ(identifiers(), (std::set<std::string>{"com.app", "com.app.ext", "com.orphan.ext"}));
+    EXPECT_EQ(mapping().parentIdentifierForChildIdentifier("com.orphan.ext"), "");
+}
+
+TEST_F(TarnCodeSigningMappingTest, RemovingAParentRemovesItsChildrenFirstThroughProcessing) {
+    const PlistDict system{{"com.ostrea.security.system-container", true}};
+    ASSERT_TRUE(process("com.p", infoWith(system)).ok());
+    for (const char* kid : {"com.p.one", "com.p.two"}) {
+        ASSERT_TRUE(process(kid, infoWith(system),
+                            {{TarnCodeSigningMapping::kOptionParentBundleID, "com.p"}})
+                        .ok());
+    }
+    ASSERT_TRUE(process("com.other", infoWith(system)).ok());
+    ASSERT_TRUE(staged().empty());
+
+    mapping().removeCodeSigningDictionariesForIdentifierAndItsChildren("com.p", &commands_);
+    EXPECT_EQ(identifiers(), std::set<std::string>{"com.other"});
+    // Each removal is a processing of its own: every system container the
+    // removed entries claimed is staged, the children's before the parent's.
+    EXPECT_EQ(staged(), (std::vector<std::string>{"com.p.one/12", "com.p.two/12", "com.p/12"}));
+
+    // Unknown identifiers are nothing to remove.
+    mapping().removeCodeSigningDictionariesForIdentifierAndItsChildren("com.unknown", &commands_);
+    mapping().removeCodeSigningDictionariesForIdentifierAndItsChildren("", &commands_);
+    EXPECT_EQ(staged().size(), 3u);
+    EXPECT_EQ(identifiers(), std::set<std::string>{"com.other"});
+}
+
+TEST_F(TarnCodeSigningMappingTest, MalformedGroupValuesAreIgnoredWhenHandedToTheGroupRules) {
+    using Ids = std::optional<std::vector<std::string>>;
+    std::vector<std::pair<Ids, Ids>> seen;  // (old, new), app groups first
+    mapping().TEST_groupChangeHook = [&](const Ids& oldIds, const Ids& newIds, TarnGroupType) {
+        seen.emplace_back(oldIds, newIds);
+    };
+    ASSERT_TRUE(process("com.a", infoWith({{"com.ostrea.security.application-groups",
+                                            PlistArray{"g.a", "g.b"}},
+                                           {"com.ostrea.security.system-groups",
+                                            PlistArray{"systemgroup.a", "unprefixed"}}}))
+                    .ok());
+    // A list holding a non-string counts as no list; the older system-group
+    // key is read when the current one is empty; the old system list keeps
+    // only prefixed names.
+    seen.clear();
+    ASSERT_TRUE(
+        process(
+            "com.a",
+            infoWith({{"com.ostrea.security.application-groups", PlistArray{"g.a", uint64_t{7}}},
+                      {"com.ostrea.security.system-groups", PlistArray{}},
+                      {"com.ostrea.security.system-group-containers", "systemgroup.b"}}))
+            .ok());
+    EXPECT_EQ(seen,
+              (std::vector<std::pair<Ids, Ids>>{{Ids({"g.a", "g.b"}), std::nullopt},
+                                                {Ids({"systemgroup.a"}), Ids({"systemgroup.b"})}}));
+}
+
+TEST_F(TarnCodeSigningMappingTest, ExceptionWhileProcessingIsFencedAndWritesNothing) {
+    TarnGlobalConfiguration::sharedInstance().setIsInternalImage(false);
+    countStoreWrites();
+    mapping().TEST_groupChangeHook = [](const auto&, const auto&, TarnGroupType) {
+        throw std::runtime_error("boom");
+    };
+    EXPECT_EQ(process("com.a", infoWith({{"com.ostrea.security.application-groups", "g.a"}}))
+                  .code(TarnSuccess),
+              TarnErrorException);
+    EXPECT_EQ(writes_, 0);
+    mapping().TEST_groupChangeHook = nullptr;
+    EXPECT_TRUE(
+        process("com.a", infoWith({{"com.ostrea.security.application-groups", "g.a"}})).ok());
+    EXPECT_EQ(writes_, 1);
 }
 
 // Misuse of the queue is a programming error, caught in every build.
