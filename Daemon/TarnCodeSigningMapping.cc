@@ -12,9 +12,11 @@
 
 #include "Daemon/TarnCommandQueue.h"
 #include "Daemon/TarnCommandStageForDelete.h"
+#include "Daemon/TarnContainerCache.h"
 #include "Daemon/TarnContainerIdentity.h"
 #include "Daemon/TarnExceptionFence.h"
 #include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnSQLiteDB.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/PlatformLog.h"
@@ -38,6 +40,9 @@ const std::optional<PlistDict> kNoInfo;
 
 // The store's answer for an identifier it has no record of.
 bool isNotFound(const TarnErrorRef& e) { return e && e->code() == TarnErrorDatabaseNotFound; }
+
+// The key under which a bundle container's cached info keeps its entitlements.
+constexpr const char* kCachedInfoEntitlementsKey = "Entitlements";
 
 // A group list as log lines print it; "(null)" when absent.
 std::optional<PlistValue> describedIds(const std::optional<std::vector<std::string>>& ids) {
@@ -436,7 +441,44 @@ std::optional<PlistDict> TarnCodeSigningMapping::entitlementsForIdentifier(const
     if (identifier.empty()) return std::nullopt;
     std::optional<PlistDict> entitlements;
     runOnQueue([&] { entitlements = _onQueue_entitlementsForIdentifier(identifier); });
-    return entitlements;
+    if (entitlements) return entitlements;
+    return importCachedCodeSigningInfo(identifier);
+}
+
+std::optional<PlistDict> TarnCodeSigningMapping::importCachedCodeSigningInfo(
+    const std::string& identifier) {
+    // Bundle containers are global: they belong to the default user identity.
+    TarnResult<TarnContainerIdentityRef> bundle =
+        TarnContainerIdentity::containerIdentityWithUserIdentity(
+            TarnUserIdentityCache::defaultUserIdentity(), identifier, TarnContainerClass{1});
+    if (!bundle.ok()) return std::nullopt;
+    TarnResult<TarnMetadataRef> container =
+        TarnContainerCache::sharedInstance().containerForContainerIdentity(
+            *bundle, /*transient=*/false, /*updateSandbox=*/false);
+    if (!container.ok()) return std::nullopt;
+    const std::optional<PlistValue>& metadataInfo = (*container)->info();
+    const PlistValue* cached =
+        metadataInfo ? metadataInfo->find(kTarnInfoCachedCodeSigningInfoKey) : nullptr;
+    if (!cached || !cached->isDict()) return std::nullopt;
+
+    PlistDict info = *cached->asDict();
+    TarnLog(kLogNotice, "entitlementsForIdentifier",
+            "Migrating code signing info from bundle container upon request for %@", identifier);
+    if (auto it = info.find(kCachedInfoEntitlementsKey); it != info.end()) {
+        PlistValue entitlements = it->second;
+        info.insert_or_assign(kEntitlementsKey, std::move(entitlements));
+    }
+    auto entry = std::make_shared<const TarnCodeSigningEntry>(std::move(info), uint64_t{2});
+    TarnStatus stored;
+    runOnQueue([&] {
+        stored = codeSigningMappingDB_->addCodeSigningEntry(entry, identifier);
+    });
+    if (!stored.ok()) {
+        TarnLog(kLogError, "entitlementsForIdentifier",
+                "Failed to write code signing info to DB for %@ : %@", identifier, stored.error());
+    }
+    if (const PlistDict* entitlements = entry->entitlements()) return *entitlements;
+    return std::nullopt;
 }
 
 std::optional<PlistDict> TarnCodeSigningMapping::getCodeSigningInfoForIdentifier(const std::string& identifier) {
@@ -578,8 +620,8 @@ void TarnHandleGetCodeSigningInfoCommand(const TarnRequestContext& context,
 TarnStatus TarnCodeSigningMapping::processCodeSigningInfo(
     const std::optional<PlistDict>& codeSigningInfo, const std::string& forIdentifier,
     const PlistDict& withOptions, TarnCommandQueue* commandQueue) {
-    // Read through the public operation, before the queue is entered: the
-    // read is where information kept elsewhere gets imported.
+    // Off the queue: a miss may import from the bundle container, and the
+    // container cache must not be called on the queue.
     std::optional<PlistDict> oldEntitlements = entitlementsForIdentifier(forIdentifier);
     TarnStatus status;
     runOnQueue([&] {

@@ -103,7 +103,10 @@ public:
 
     // ---- reads ----
 
-    // Entitlements for the daemon's own decisions (internal view); empty when none.
+    // Entitlements for the daemon's own decisions (internal view); empty when
+    // none. On a miss, code-signing info still cached in the metadata of the
+    // identifier's application bundle container is stored (data-container
+    // class 2) and answered.
     std::optional<PlistDict> entitlementsForIdentifier(const std::string& identifier);
     // The code-signing info as a client may see it (external view); empty when none.
     std::optional<PlistDict> getCodeSigningInfoForIdentifier(const std::string& identifier);
@@ -262,6 +265,10 @@ private:
     // Runs `work` synchronously on the queue; must be called off it.
     void runOnQueue(const std::function<void()>& work);
     void assertOnQueue() const;
+    // entitlementsForIdentifier() after a miss: the import from the
+    // application bundle container's metadata. Off the queue.
+    std::optional<PlistDict> importCachedCodeSigningInfo(const std::string& identifier);
+
     // Constant after construction.
     TarnUserIdentitySharedCache* const userIdentityCache_;
     const DispatchQueueRef queue_;

@@ -1,7 +1,7 @@
 // The code-signing mapping: views, group lists from entitlements,
 // parent/child look-ups, invalidation, reference counts, the legacy
-// mapping-file import and command 19; the processing of code-signing info
-// and removal with children.
+// mapping-file import and command 19; the processing of code-signing info,
+// removal with children and the import from a bundle container's metadata.
 #include "Daemon/TarnCodeSigningMapping.h"
 
 #include <atomic>
@@ -11,6 +11,7 @@
 #include "Daemon/TarnCommandQueue.h"
 #include "Daemon/TarnCommandStageForDelete.h"
 #include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnSQLiteDB.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/PlatformLog.h"
@@ -94,6 +95,24 @@ protected:
         return out;
     }
 
+    // Writes a bundle container of `identifier` with `info` as its metadata info.
+    void makeBundleContainer(TarnContainerClass containerClass, const std::string& identifier,
+                             std::optional<PlistValue> info = std::nullopt) {
+        const TarnUserIdentityRef owner = TarnUserIdentityCache::defaultUserIdentity();
+        const Uuid uuid = Uuid::generate();
+        const FileURL dir = PathJoin(
+            *TarnGlobalConfiguration::sharedInstance().containerDirectoryURLForUserIdentity(
+                owner, containerClass, /*transient=*/false),
+            uuid.string());
+        std::filesystem::create_directories(dir);
+        auto identity = TarnConcreteContainerIdentity::containerIdentityWithUUID(
+                            uuid, owner, identifier, containerClass)
+                            .value();
+        TarnStatus written =
+            TarnMetadata::initWithContainerIdentity(identity, std::move(info), dir, std::nullopt)
+                ->writeMetadataToDiskWithError();
+        ASSERT_TRUE(written.ok()) << written.error()->description();
+    }
 
     void store(const std::string& id, const TarnCodeSigningEntryRef& entry) {
         TarnStatus stored;
@@ -455,6 +474,34 @@ TEST_F(TarnCodeSigningMappingTest, ExceptionWhileProcessingIsFencedAndWritesNoth
     EXPECT_TRUE(
         process("com.a", infoWith({{"com.ostrea.security.application-groups", "g.a"}})).ok());
     EXPECT_EQ(writes_, 1);
+}
+
+// ---- import from bundle containers ----
+
+TEST_F(TarnCodeSigningMappingTest, MissImportsCachedInfoFromTheBundleContainerOnce) {
+    const PlistDict entitlements{{"com.ostrea.security.application-groups", "group.x"}};
+    makeBundleContainer(1, "com.cached",
+                        PlistDict{{kTarnInfoCachedCodeSigningInfoKey,
+                                   PlistDict{{"Entitlements", entitlements}, {"Other", "kept"}}}});
+    makeBundleContainer(1, "com.notdict", PlistDict{{kTarnInfoCachedCodeSigningInfoKey, "junk"}});
+    countStoreWrites();
+
+    EXPECT_EQ(mapping().entitlementsForIdentifier("com.cached"), entitlements);
+    EXPECT_EQ(mapping().entitlementsForIdentifier("com.cached"), entitlements);
+    EXPECT_EQ(mapping().appGroupIdentifiersForIdentifier("com.cached"),
+              std::optional<std::vector<std::string>>({"group.x"}));
+    EXPECT_EQ(writes_, 1);
+    TarnCodeSigningEntryRef imported = storedEntry("com.cached");
+    ASSERT_TRUE(imported);
+    EXPECT_EQ(imported->dataContainerClass(), 2u);
+    EXPECT_EQ(*imported->codeSigningInfo(), (PlistDict{{"Entitlements", entitlements},
+                                                       {"Other", "kept"},
+                                                       {kTarnEntitlementsKey, entitlements}}));
+
+    EXPECT_FALSE(mapping().entitlementsForIdentifier("com.notdict"));
+    EXPECT_FALSE(mapping().entitlementsForIdentifier("com.nobundle"));
+    EXPECT_EQ(writes_, 1);
+    EXPECT_EQ(identifiers(), std::set<std::string>{"com.cached"});
 }
 
 // Misuse of the queue is a programming error, caught in every build.
