@@ -16,6 +16,7 @@
 #include "Daemon/TarnContainerIdentity.h"
 #include "Daemon/TarnExceptionFence.h"
 #include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnLocks.h"
 #include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnSQLiteDB.h"
 #include "Daemon/TarnUserIdentityCache.h"
@@ -760,7 +761,76 @@ void TarnCodeSigningMapping::_onQueue_stageSystemContainerForDelete(
             }));
 }
 
+// ---- invalidation of apps without a bundle container ----
+
 TarnStatus TarnCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
+    constexpr const char* kTag = "invalidateCodeSigningInfoForAppsWithoutBundleContainer";
+    TarnGlobalLockHolder lock(TarnGlobalLockHolder::Mode::Write);
+    TarnResult<std::set<std::string>> identifiers = identifiersWithError();
+    if (!identifiers.ok()) {
+        TarnLog(kLogError, kTag,
+                "Failed to enumerate containers when invalidating code signing info: %@",
+                identifiers.error());
+        return identifiers.error();
+    }
+    const TarnUserIdentityRef bundleOwner = TarnUserIdentityCache::defaultUserIdentity();
+    TarnContainerCache& cache = TarnContainerCache::sharedInstance();
+    for (const std::string& identifier : *identifiers) {
+        TarnResult<TarnCodeSigningEntryRef> entry = TarnCodeSigningEntryRef();
+        bool isPlugIn = false;
+        bool hasParent = false;
+        runOnQueue([&] {
+            entry = codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier);
+            if (!entry.ok()) return;
+            const uint64_t dataClass = (*entry)->dataContainerClass();
+            isPlugIn = dataClass >= 3 && dataClass <= 6;
+            hasParent =
+                isPlugIn && !_onQueue_parentIdentifierForChildIdentifier(identifier).empty();
+        });
+        if (!entry.ok()) {
+            TarnLog(kLogError, kTag,
+                    "Error fetching code sign info for %@ to check for invalidation: %@",
+                    identifier, entry.error());
+            continue;
+        }
+        PlatformLog("codesignmapping", PlatformLogType::Info,
+                    "Checking for invalidation: identifier = %@, codeSigningEntry = <%p>, "
+                    "isRegisteredByCaller = %d, isPlugIn = %d, hasParent = %d",
+                    identifier, static_cast<const void*>(entry->get()),
+                    (*entry)->registeredByCaller(), isPlugIn, hasParent);
+        // A caller-registered entry has no bundle of its own; a plug-in with a
+        // parent goes with its parent.
+        if ((*entry)->registeredByCaller() || hasParent) continue;
+
+        bool hasBundle = false;
+        for (TarnContainerClass bundleClass :
+             {TarnContainerClass{1}, TarnContainerClass{3}, TarnContainerClass{5}}) {
+            TarnResult<TarnContainerIdentityRef> identity =
+                TarnContainerIdentity::containerIdentityWithUserIdentity(bundleOwner, identifier,
+                                                                         bundleClass);
+            if (!identity.ok()) continue;
+            // Only a container found counts: a class directory that does not
+            // exist (no VPN plug-in ever installed) fails the look-up too.
+            if (cache
+                    .containerForContainerIdentity(*identity, /*transient=*/false,
+                                                   /*updateSandbox=*/false)
+                    .ok()) {
+                hasBundle = true;
+                break;
+            }
+        }
+        if (hasBundle) continue;
+
+        PlatformLog("codesignmapping", PlatformLogType::Default,
+                    "Invalidating: identifier = %@, isPlugin = %d", identifier, isPlugIn);
+        TarnStatus invalidated = invalidateCodeSigningInfoForIdentifierAndItsChildren(identifier);
+        if (!invalidated.ok()) {
+            // Recorded for this identifier only; the others are still checked.
+            (void)TARN_ERROR_IN(kTag, TarnErrorDatabase, invalidated.error(),
+                                "Failed to invalidate code signing info for %@ : %@", identifier,
+                                invalidated.error());
+        }
+    }
     return {};
 }
 

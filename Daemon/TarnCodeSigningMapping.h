@@ -151,8 +151,11 @@ public:
     TarnStatus processCodeSigningInfo(const std::optional<PlistDict>& codeSigningInfo,
                                       const std::string& forIdentifier,
                                       const PlistDict& withOptions, TarnCommandQueue* commandQueue);
-    // Under the global write lock: invalidates every entry whose bundle has
-    // no container, except caller-registered ones and plug-ins with a parent.
+    // Under the global write lock: invalidates, with its children, every
+    // entry whose identifier has no bundle container (class 1, 3 or 5),
+    // except caller-registered ones and plug-ins with a parent. Fails only
+    // when the identifiers cannot be listed; a failed invalidation is logged
+    // and the others are still checked.
     TarnStatus invalidateCodeSigningInfoForAppsWithoutBundleContainer();
 
     TarnStatus invalidateCodeSigningInfoForIdentifier(const std::string& identifier);

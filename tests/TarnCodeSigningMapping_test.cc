@@ -1,7 +1,8 @@
 // The code-signing mapping: views, group lists from entitlements,
 // parent/child look-ups, invalidation, reference counts, the legacy
 // mapping-file import and command 19; the processing of code-signing info,
-// removal with children and the import from a bundle container's metadata.
+// removal with children, invalidation of apps without a bundle container and
+// the import from a bundle container's metadata.
 #include "Daemon/TarnCodeSigningMapping.h"
 
 #include <atomic>
@@ -11,6 +12,7 @@
 #include "Daemon/TarnCommandQueue.h"
 #include "Daemon/TarnCommandStageForDelete.h"
 #include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnLocks.h"
 #include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnSQLiteDB.h"
 #include "Daemon/TarnUserIdentityCache.h"
@@ -476,7 +478,34 @@ TEST_F(TarnCodeSigningMappingTest, ExceptionWhileProcessingIsFencedAndWritesNoth
     EXPECT_EQ(writes_, 1);
 }
 
-// ---- import from bundle containers ----
+// ---- invalidation and import from bundle containers ----
+
+TEST_F(TarnCodeSigningMappingTest, AppsWithoutBundleContainerAreInvalidated) {
+    makeBundleContainer(1, "com.app");
+    makeBundleContainer(5, "com.vpn");
+    store("com.app",
+          entryWith({}, 2, [](auto& e) { e.setChildBundleIdentifiers({"com.app.ext"}); }));
+    store("com.app.ext", entryWith({}, 4));
+    store("com.vpn", entryWith({}, 6));
+    store("com.caller", entryWith({}, 0, [](auto& e) { e.setRegisteredByCaller(true); }));
+    store("com.gone",
+          entryWith({}, 2, [](auto& e) { e.setChildBundleIdentifiers({"com.gone.ext"}); }));
+    store("com.gone.ext", entryWith({}, 4));
+    store("com.lone.ext", entryWith({}, 4));
+
+    ASSERT_TRUE(mapping().invalidateCodeSigningInfoForAppsWithoutBundleContainer().ok());
+    for (const char* kept : {"com.app", "com.app.ext", "com.vpn", "com.caller"}) {
+        EXPECT_FALSE(storedEntry(kept)->invalid()) << kept;
+    }
+    // A plug-in with a parent is not judged on its own, but goes with a parent
+    // that is invalidated.
+    for (const char* gone : {"com.gone", "com.gone.ext", "com.lone.ext"}) {
+        EXPECT_TRUE(storedEntry(gone)->invalid()) << gone;
+    }
+    EXPECT_FALSE(mapping().getCodeSigningInfoForIdentifier("com.gone"));
+    // The global write lock is released.
+    EXPECT_EQ(gTarnLocks.TEST_allReaderWriterState(), 0);
+}
 
 TEST_F(TarnCodeSigningMappingTest, MissImportsCachedInfoFromTheBundleContainerOnce) {
     const PlistDict entitlements{{"com.ostrea.security.application-groups", "group.x"}};
