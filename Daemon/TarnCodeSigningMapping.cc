@@ -45,6 +45,10 @@ bool isNotFound(const TarnErrorRef& e) { return e && e->code() == TarnErrorDatab
 // The key under which a bundle container's cached info keeps its entitlements.
 constexpr const char* kCachedInfoEntitlementsKey = "Entitlements";
 
+// Distinct identifiers the registration memo keeps before it starts over: a
+// device has far fewer clients, so this only bounds a misbehaving one.
+constexpr size_t kRegistrationMemoCapacity = 4096;
+
 // A group list as log lines print it; "(null)" when absent.
 std::optional<PlistValue> describedIds(const std::optional<std::vector<std::string>>& ids) {
     if (!ids) return std::nullopt;
@@ -271,17 +275,20 @@ TarnResult<std::set<std::string>> TarnCodeSigningMapping::_onQueue_identifiersWi
 TarnStatus TarnCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifier(
     const std::string& identifier) {
     assertOnQueue();
+    _onQueue_storeWillChange();
     return codeSigningMappingDB_->invalidateCodeSigningWithIdentifier(identifier);
 }
 
 TarnStatus TarnCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(
     const std::string& identifier) {
     assertOnQueue();
+    _onQueue_storeWillChange();
     return codeSigningMappingDB_->invalidateCodeSigningForIdentifierAndAllChildren(identifier);
 }
 
 TarnStatus TarnCodeSigningMapping::_onQueue_removeAllAdvanceCopiesWithError() {
     assertOnQueue();
+    _onQueue_storeWillChange();
     return codeSigningMappingDB_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError();
 }
 
@@ -354,6 +361,7 @@ TarnStatus TarnCodeSigningMapping::_onQueue_setCodeSigningDictionaryValues(
         const TarnCodeSigningEntryRef stored = read.ok() ? std::move(*read) : nullptr;
         if (!entry || !entry->codeSigningInfo()) {
             if (!stored) continue;
+            _onQueue_storeWillChange();
             TarnStatus deleted = codeSigningMappingDB_->deleteCodeSigningEntryWithIdentifier(identifier);
             if (!deleted.ok()) {
                 TarnLog(kLogError, "_onQueue_setCodeSigningDictionaryValues",
@@ -365,6 +373,7 @@ TarnStatus TarnCodeSigningMapping::_onQueue_setCodeSigningDictionaryValues(
             continue;
         }
         if (TarnCodeSigningEntriesEqual(stored, entry)) continue;
+        _onQueue_storeWillChange();
         TarnStatus written = codeSigningMappingDB_->addCodeSigningEntry(entry, identifier);
         if (!written.ok()) {
             TarnLog(kLogError, "_onQueue_setCodeSigningDictionaryValues",
@@ -414,6 +423,7 @@ void TarnCodeSigningMapping::_onQueue_migrateFromMappingFileToDBIfNecessary() {
         // An entry that cannot be decoded goes to the store as nothing, which
         // refuses it with its own error.
         TarnCodeSigningEntryRef entry = TarnCodeSigningEntry::initWithSerializedDictionary(serialized);
+        _onQueue_storeWillChange();
         TarnStatus added = codeSigningMappingDB_->addCodeSigningEntry(entry, identifier);
         if (added.ok()) {
             ++migrated;
@@ -472,6 +482,7 @@ std::optional<PlistDict> TarnCodeSigningMapping::importCachedCodeSigningInfo(
     auto entry = std::make_shared<const TarnCodeSigningEntry>(std::move(info), uint64_t{2});
     TarnStatus stored;
     runOnQueue([&] {
+        _onQueue_storeWillChange();
         stored = codeSigningMappingDB_->addCodeSigningEntry(entry, identifier);
     });
     if (!stored.ok()) {
@@ -591,7 +602,82 @@ TarnStatus TarnCodeSigningMapping::removeAllAdvanceCopiesWithError() {
 TarnStatus TarnCodeSigningMapping::processCallerRegisteredEntitlements(const PlistDict& entitlements,
                                                                        const std::string& forIdentifier,
                                                                        TarnCommandQueue* commandQueue) {
-    return {};
+    if (forIdentifier.empty()) return TARN_ERROR_CODE(TarnErrorMissingIdentifier, nullptr);
+    // Every admitted request comes here: the common case must not touch the
+    // store or wait for the queue.
+    if (registrationIsCurrent(forIdentifier, entitlements)) return {};
+
+    TarnResult<TarnCodeSigningEntryRef> read = TarnCodeSigningEntryRef();
+    uint64_t generation = 0;
+    runOnQueue([&] {
+        read = _onQueue_codeSigningEntryForIdentifier(forIdentifier);
+        // Taken with the read, on the queue: a change after the read bumps it.
+        generation = storeGeneration();
+    });
+    if (!read.ok() && !isNotFound(read.error())) return read.error();
+    const TarnCodeSigningEntryRef stored = read.ok() ? std::move(*read) : nullptr;
+
+    if (stored && stored->codeSigningInfo() && !stored->registeredByCaller()) {
+        // The installer's info is never replaced by what a caller says of itself.
+        rememberRegistration(forIdentifier, entitlements, generation);
+        return {};
+    }
+    if (stored && stored->registeredByCaller()) {
+        const PlistDict* registered = stored->entitlements();
+        if (registered && *registered == entitlements) {
+            rememberRegistration(forIdentifier, entitlements, generation);
+            return {};
+        }
+        TarnLog(kLogNotice, "processCallerRegisteredEntitlements",
+                "%@ has changed entitlements. Re-registering.", forIdentifier);
+    }
+    // Not remembered here: the next request finds the registration in the
+    // store and remembers it then, so that a failed write is retried.
+    TarnGlobalLockHolder lock(TarnGlobalLockHolder::Mode::Write);
+    return processCodeSigningInfo(PlistDict{{kEntitlementsKey, entitlements}}, forIdentifier,
+                                  PlistDict{{kOptionRegisteredByCaller, true}}, commandQueue);
+}
+
+// ---- registration memo ----
+
+bool TarnCodeSigningMapping::registrationIsCurrent(const std::string& identifier,
+                                                   const PlistDict& entitlements) {
+    std::shared_ptr<const PlistDict> remembered;
+    {
+        MutexLock lock(memoMutex_);
+        auto it = registrationMemo_.find(identifier);
+        if (it == registrationMemo_.end() || it->second.generation != storeGeneration_)
+            return false;
+        remembered = it->second.entitlements;
+    }
+    // Compared outside the lock: concurrent requests of other clients need not
+    // wait for it. A change made meanwhile is ordered after this request.
+    return *remembered == entitlements;
+}
+
+void TarnCodeSigningMapping::rememberRegistration(const std::string& identifier,
+                                                  const PlistDict& entitlements,
+                                                  uint64_t generation) {
+    auto copy = std::make_shared<const PlistDict>(entitlements);
+    MutexLock lock(memoMutex_);
+    // Learnt before a change that has happened since: it may no longer hold.
+    if (generation != storeGeneration_) return;
+    if (registrationMemo_.size() >= kRegistrationMemoCapacity &&
+        !registrationMemo_.contains(identifier)) {
+        registrationMemo_.clear();
+    }
+    registrationMemo_.insert_or_assign(identifier, RegistrationMemo{std::move(copy), generation});
+}
+
+uint64_t TarnCodeSigningMapping::storeGeneration() {
+    MutexLock lock(memoMutex_);
+    return storeGeneration_;
+}
+
+void TarnCodeSigningMapping::_onQueue_storeWillChange() {
+    assertOnQueue();
+    MutexLock lock(memoMutex_);
+    ++storeGeneration_;
 }
 
 // ---- command 19 ----

@@ -20,6 +20,12 @@
 // Errors: operations that can fail answer a TarnResult (Daemon/TarnResult.h)
 // carrying the store's error values unchanged (TarnSQLiteDB.h lists them).
 // Reads that answer a plain value treat a failure as "none" after logging it.
+//
+// Locks: processCallerRegisteredEntitlements() and
+// invalidateCodeSigningInfoForAppsWithoutBundleContainer() take the global
+// identifier write lock (gTarnLocks), so their callers must hold no global or
+// identifier lock. The container cache is called only off the queue (its lock
+// comes before the queue).
 #pragma once
 
 #include <cstdint>
@@ -30,6 +36,7 @@
 #include <set>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 #include <vector>
 
 #include "Daemon/TarnCodeSigningEntry.h"
@@ -41,6 +48,7 @@
 #include "Platform/Dispatch.h"
 #include "Platform/Path.h"
 #include "Platform/PropertyList.h"
+#include "Platform/ThreadAnnotations.h"
 
 namespace tarn {
 
@@ -97,7 +105,8 @@ public:
     TarnCodeSigningMapping& operator=(const TarnCodeSigningMapping&) = delete;
 
     const DispatchQueueRef& queue() const { return queue_; }
-    // Only to be used on queue().
+    // Only to be used on queue(); a change made through it calls
+    // _onQueue_storeWillChange() first.
     TarnSQLiteDB* codeSigningMappingDB() const { return codeSigningMappingDB_.get(); }
     TarnUserIdentitySharedCache* userIdentityCache() const { return userIdentityCache_; }
 
@@ -168,9 +177,11 @@ public:
     void removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier,
                                                                   TarnCommandQueue* commandQueue);
     // A connecting client's own entitlements, offered on every admitted
-    // request. Not built yet: registering them (and the group clean-up that
-    // follows) comes with the processing of code-signing information. Until
-    // then this answers success and stores nothing.
+    // request. Registers them (under the global write lock) unless the
+    // installer's info is stored for the identifier or the same entitlements
+    // are already registered. Answered from a memo, with no store read and no
+    // queue hop, while nothing in the store has changed since the identifier
+    // was last found registered with these entitlements (or installer-owned).
     TarnStatus processCallerRegisteredEntitlements(const PlistDict& entitlements,
                                                    const std::string& forIdentifier,
                                                    TarnCommandQueue* commandQueue);
@@ -250,6 +261,9 @@ public:
                                                        const std::vector<std::string>& forIdentifiers);
     // Imports "tarn_code_signing_info.plist" from the library directory.
     void _onQueue_migrateFromMappingFileToDBIfNecessary();
+    // Every change of the store made through the mapping calls this first: it
+    // retires what the registration memo has learnt.
+    void _onQueue_storeWillChange();
     // The legacy mapping file: identifier -> serialised entry, or the error
     // when it cannot be read; a missing file is a POSIX ENOENT error.
     static TarnResult<PlistDict> _readCodeSigningMappingFromDiskAtURL(const FileURL& url);
@@ -272,11 +286,30 @@ private:
     // application bundle container's metadata. Off the queue.
     std::optional<PlistDict> importCachedCodeSigningInfo(const std::string& identifier);
 
+    // The registration memo. The generation counts store changes; a memo
+    // entry holds for as long as the generation it was learnt at is current.
+    struct RegistrationMemo {
+        std::shared_ptr<const PlistDict> entitlements;
+        uint64_t generation = 0;
+    };
+    // True when `entitlements` are known to need no registration for `identifier`.
+    bool registrationIsCurrent(const std::string& identifier, const PlistDict& entitlements)
+        EXCLUDES(memoMutex_);
+    void rememberRegistration(const std::string& identifier, const PlistDict& entitlements,
+                              uint64_t generation) EXCLUDES(memoMutex_);
+    uint64_t storeGeneration() EXCLUDES(memoMutex_);
+
     // Constant after construction.
     TarnUserIdentitySharedCache* const userIdentityCache_;
     const DispatchQueueRef queue_;
     // Used on queue_ only.
     const std::unique_ptr<TarnSQLiteDB> codeSigningMappingDB_;
+
+    // Guarded by memoMutex_ (taken on and off the queue; never held while
+    // waiting for anything else).
+    Mutex memoMutex_;
+    uint64_t storeGeneration_ GUARDED_BY(memoMutex_) = 0;
+    std::unordered_map<std::string, RegistrationMemo> registrationMemo_ GUARDED_BY(memoMutex_);
 };
 
 // Command 19: answers "ReplyInfoDictionary" with the external view of the

@@ -1,12 +1,14 @@
 // The code-signing mapping: views, group lists from entitlements,
 // parent/child look-ups, invalidation, reference counts, the legacy
 // mapping-file import and command 19; the processing of code-signing info,
-// removal with children, invalidation of apps without a bundle container and
-// the import from a bundle container's metadata.
+// caller registration, removal with children, invalidation of apps without a
+// bundle container and the import from a bundle container's metadata.
 #include "Daemon/TarnCodeSigningMapping.h"
 
 #include <atomic>
+#include <chrono>
 #include <filesystem>
+#include <future>
 #include <stdexcept>
 
 #include "Daemon/TarnCommandQueue.h"
@@ -476,6 +478,81 @@ TEST_F(TarnCodeSigningMappingTest, ExceptionWhileProcessingIsFencedAndWritesNoth
     EXPECT_TRUE(
         process("com.a", infoWith({{"com.ostrea.security.application-groups", "g.a"}})).ok());
     EXPECT_EQ(writes_, 1);
+}
+
+// ---- caller-registered entitlements ----
+
+class TarnCallerRegistrationTest : public TarnCodeSigningMappingTest {
+protected:
+    TarnStatus registerSelf(const std::string& id, const PlistDict& entitlements) {
+        return mapping().processCallerRegisteredEntitlements(entitlements, id, &commands_);
+    }
+
+    // Runs a registration on another thread while this one holds the global
+    // write lock (and, with `suspendQueue`, keeps the mapping's queue from
+    // running anything); answers whether it finished within `wait`. Both are
+    // let go before returning, so a registration that waited finishes too.
+    bool finishesWhileHeld(const std::string& id, const PlistDict& entitlements, bool suspendQueue,
+                           std::chrono::milliseconds wait) {
+        gTarnLocks.write_lock_all_identifiers();
+        if (suspendQueue) mapping().queue()->suspend();
+        auto done = std::async(std::launch::async, [&] { return registerSelf(id, entitlements); });
+        const bool finished = done.wait_for(wait) == std::future_status::ready;
+        if (suspendQueue) mapping().queue()->resume();
+        gTarnLocks.unlock_all_identifiers();
+        EXPECT_TRUE(done.get().ok());
+        return finished;
+    }
+
+    const PlistDict e1_{{"com.ostrea.security.application-groups", PlistArray{"g.one"}},
+                        {"k", "v1"}};
+    const PlistDict e2_{{"com.ostrea.security.application-groups", PlistArray{"g.one"}},
+                        {"k", "v2"}};
+};
+
+TEST_F(TarnCallerRegistrationTest, InstallerInfoIsNeverReplaced) {
+    ASSERT_TRUE(process("com.inst", infoWith(e1_)).ok());
+    countStoreWrites();
+    ASSERT_TRUE(registerSelf("com.inst", e2_).ok());
+    // Once found installer-owned, answered without the lock or the queue.
+    EXPECT_TRUE(
+        finishesWhileHeld("com.inst", e2_, /*suspendQueue=*/true, std::chrono::seconds(10)));
+    EXPECT_EQ(writes_, 0);
+    EXPECT_FALSE(storedEntry("com.inst")->registeredByCaller());
+    EXPECT_EQ(mapping().entitlementsForIdentifier("com.inst"), e1_);
+    EXPECT_EQ(registerSelf("", e1_).code(TarnSuccess), TarnErrorMissingIdentifier);
+}
+
+TEST_F(TarnCallerRegistrationTest, IdenticalRegistrationIsFreeAndAChangeReRegisters) {
+    countStoreWrites();
+    ASSERT_TRUE(registerSelf("com.self", e1_).ok());
+    EXPECT_EQ(writes_, 1);
+    EXPECT_TRUE(mapping().identifierHasCallerRegisteredEntitlements("com.self"));
+    EXPECT_EQ(mapping().entitlementsForIdentifier("com.self"), e1_);
+
+    // The same again: no write and no lock; once found registered it is not
+    // even looked up (the queue is held still).
+    EXPECT_TRUE(
+        finishesWhileHeld("com.self", e1_, /*suspendQueue=*/false, std::chrono::seconds(10)));
+    EXPECT_TRUE(
+        finishesWhileHeld("com.self", e1_, /*suspendQueue=*/true, std::chrono::seconds(10)));
+    EXPECT_EQ(writes_, 1);
+
+    // Changed entitlements wait for the global write lock, then re-register.
+    EXPECT_FALSE(
+        finishesWhileHeld("com.self", e2_, /*suspendQueue=*/false, std::chrono::milliseconds(200)));
+    EXPECT_EQ(writes_, 2);
+    EXPECT_EQ(mapping().entitlementsForIdentifier("com.self"), e2_);
+    EXPECT_TRUE(mapping().identifierHasCallerRegisteredEntitlements("com.self"));
+
+    // What was remembered no longer holds once the store changed: a removed
+    // registration is made again.
+    ASSERT_TRUE(registerSelf("com.self", e2_).ok());
+    EXPECT_EQ(writes_, 2);
+    mapping().removeCodeSigningDictionariesForIdentifierAndItsChildren("com.self", &commands_);
+    ASSERT_TRUE(registerSelf("com.self", e2_).ok());
+    EXPECT_EQ(writes_, 3);
+    EXPECT_EQ(mapping().entitlementsForIdentifier("com.self"), e2_);
 }
 
 // ---- invalidation and import from bundle containers ----
