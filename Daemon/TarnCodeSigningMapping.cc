@@ -1,5 +1,6 @@
 #include "Daemon/TarnCodeSigningMapping.h"
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <filesystem>
@@ -9,7 +10,14 @@
 #include <system_error>
 #include <vector>
 
+#include "Daemon/TarnCommandQueue.h"
+#include "Daemon/TarnCommandStageForDelete.h"
+#include "Daemon/TarnContainerCache.h"
+#include "Daemon/TarnContainerIdentity.h"
+#include "Daemon/TarnExceptionFence.h"
 #include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnLocks.h"
+#include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnSQLiteDB.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/PlatformLog.h"
@@ -33,6 +41,29 @@ const std::optional<PlistDict> kNoInfo;
 
 // The store's answer for an identifier it has no record of.
 bool isNotFound(const TarnErrorRef& e) { return e && e->code() == TarnErrorDatabaseNotFound; }
+
+// The key under which a bundle container's cached info keeps its entitlements.
+constexpr const char* kCachedInfoEntitlementsKey = "Entitlements";
+
+// Distinct identifiers the registration memo keeps before it starts over: a
+// device has far fewer clients, so this only bounds a misbehaving one.
+constexpr size_t kRegistrationMemoCapacity = 4096;
+
+// A group list as log lines print it; "(null)" when absent.
+std::optional<PlistValue> describedIds(const std::optional<std::vector<std::string>>& ids) {
+    if (!ids) return std::nullopt;
+    return PlistValue(PlistArray(ids->begin(), ids->end()));
+}
+
+const PlistValue* optionValue(const PlistDict& options, const char* key) {
+    auto it = options.find(key);
+    return it == options.end() ? nullptr : &it->second;
+}
+
+bool optionIsTrue(const PlistDict& options, const char* key) {
+    const PlistValue* value = optionValue(options, key);
+    return value && value->truthy();
+}
 
 }  // namespace
 
@@ -244,17 +275,20 @@ TarnResult<std::set<std::string>> TarnCodeSigningMapping::_onQueue_identifiersWi
 TarnStatus TarnCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifier(
     const std::string& identifier) {
     assertOnQueue();
+    _onQueue_storeWillChange();
     return codeSigningMappingDB_->invalidateCodeSigningWithIdentifier(identifier);
 }
 
 TarnStatus TarnCodeSigningMapping::_onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(
     const std::string& identifier) {
     assertOnQueue();
+    _onQueue_storeWillChange();
     return codeSigningMappingDB_->invalidateCodeSigningForIdentifierAndAllChildren(identifier);
 }
 
 TarnStatus TarnCodeSigningMapping::_onQueue_removeAllAdvanceCopiesWithError() {
     assertOnQueue();
+    _onQueue_storeWillChange();
     return codeSigningMappingDB_->deleteAllAdvanceCopiesOfCodeSigningEntriesWithError();
 }
 
@@ -327,6 +361,7 @@ TarnStatus TarnCodeSigningMapping::_onQueue_setCodeSigningDictionaryValues(
         const TarnCodeSigningEntryRef stored = read.ok() ? std::move(*read) : nullptr;
         if (!entry || !entry->codeSigningInfo()) {
             if (!stored) continue;
+            _onQueue_storeWillChange();
             TarnStatus deleted = codeSigningMappingDB_->deleteCodeSigningEntryWithIdentifier(identifier);
             if (!deleted.ok()) {
                 TarnLog(kLogError, "_onQueue_setCodeSigningDictionaryValues",
@@ -338,6 +373,7 @@ TarnStatus TarnCodeSigningMapping::_onQueue_setCodeSigningDictionaryValues(
             continue;
         }
         if (TarnCodeSigningEntriesEqual(stored, entry)) continue;
+        _onQueue_storeWillChange();
         TarnStatus written = codeSigningMappingDB_->addCodeSigningEntry(entry, identifier);
         if (!written.ok()) {
             TarnLog(kLogError, "_onQueue_setCodeSigningDictionaryValues",
@@ -387,6 +423,7 @@ void TarnCodeSigningMapping::_onQueue_migrateFromMappingFileToDBIfNecessary() {
         // An entry that cannot be decoded goes to the store as nothing, which
         // refuses it with its own error.
         TarnCodeSigningEntryRef entry = TarnCodeSigningEntry::initWithSerializedDictionary(serialized);
+        _onQueue_storeWillChange();
         TarnStatus added = codeSigningMappingDB_->addCodeSigningEntry(entry, identifier);
         if (added.ok()) {
             ++migrated;
@@ -415,7 +452,45 @@ std::optional<PlistDict> TarnCodeSigningMapping::entitlementsForIdentifier(const
     if (identifier.empty()) return std::nullopt;
     std::optional<PlistDict> entitlements;
     runOnQueue([&] { entitlements = _onQueue_entitlementsForIdentifier(identifier); });
-    return entitlements;
+    if (entitlements) return entitlements;
+    return importCachedCodeSigningInfo(identifier);
+}
+
+std::optional<PlistDict> TarnCodeSigningMapping::importCachedCodeSigningInfo(
+    const std::string& identifier) {
+    // Bundle containers are global: they belong to the default user identity.
+    TarnResult<TarnContainerIdentityRef> bundle =
+        TarnContainerIdentity::containerIdentityWithUserIdentity(
+            TarnUserIdentityCache::defaultUserIdentity(), identifier, TarnContainerClass{1});
+    if (!bundle.ok()) return std::nullopt;
+    TarnResult<TarnMetadataRef> container =
+        TarnContainerCache::sharedInstance().containerForContainerIdentity(
+            *bundle, /*transient=*/false, /*updateSandbox=*/false);
+    if (!container.ok()) return std::nullopt;
+    const std::optional<PlistValue>& metadataInfo = (*container)->info();
+    const PlistValue* cached =
+        metadataInfo ? metadataInfo->find(kTarnInfoCachedCodeSigningInfoKey) : nullptr;
+    if (!cached || !cached->isDict()) return std::nullopt;
+
+    PlistDict info = *cached->asDict();
+    TarnLog(kLogNotice, "entitlementsForIdentifier",
+            "Migrating code signing info from bundle container upon request for %@", identifier);
+    if (auto it = info.find(kCachedInfoEntitlementsKey); it != info.end()) {
+        PlistValue entitlements = it->second;
+        info.insert_or_assign(kEntitlementsKey, std::move(entitlements));
+    }
+    auto entry = std::make_shared<const TarnCodeSigningEntry>(std::move(info), uint64_t{2});
+    TarnStatus stored;
+    runOnQueue([&] {
+        _onQueue_storeWillChange();
+        stored = codeSigningMappingDB_->addCodeSigningEntry(entry, identifier);
+    });
+    if (!stored.ok()) {
+        TarnLog(kLogError, "entitlementsForIdentifier",
+                "Failed to write code signing info to DB for %@ : %@", identifier, stored.error());
+    }
+    if (const PlistDict* entitlements = entry->entitlements()) return *entitlements;
+    return std::nullopt;
 }
 
 std::optional<PlistDict> TarnCodeSigningMapping::getCodeSigningInfoForIdentifier(const std::string& identifier) {
@@ -497,24 +572,18 @@ TarnStatus TarnCodeSigningMapping::invalidateCodeSigningInfoForIdentifier(const 
 
 void TarnCodeSigningMapping::removeCodeSigningDictionariesForIdentifierAndItsChildren(
     const std::string& identifier, TarnCommandQueue* commandQueue) {
-    // Group clean-up (reference counts, staged deletion of unused groups on
-    // `commandQueue`) joins here once the mapping's write side lands; until
-    // then only the records themselves go.
-    (void)commandQueue;
-    if (identifier.empty()) return;
-    runOnQueue([&] {
-        std::vector<std::string> identifiers = _onQueue_childBundleIdentifiersForParentIdentifier(identifier);
-        identifiers.push_back(identifier);
-        for (const std::string& each : identifiers) {
-            // An unreadable record is still deleted; only a missing one is skipped.
-            TarnResult<TarnCodeSigningEntryRef> stored = _onQueue_codeSigningEntryForIdentifier(each);
-            if (!stored.ok() && isNotFound(stored.error())) continue;
-            TarnStatus deleted = codeSigningMappingDB_->deleteCodeSigningEntryWithIdentifier(each);
-            if (deleted.ok()) continue;
+    // Children first: each is processed as a removal of its own, so that the
+    // groups and system container it alone claimed go with it.
+    std::vector<std::string> identifiers = childBundleIdentifiersForParentIdentifier(identifier);
+    identifiers.push_back(identifier);
+    for (const std::string& each : identifiers) {
+        TarnStatus cleared = processCodeSigningInfo(std::nullopt, each, PlistDict{}, commandQueue);
+        if (!cleared.ok()) {
             TarnLog(kLogError, "removeCodeSigningDictionariesForIdentifierAndItsChildren",
-                    "Failed to clear entitlements for %@ : %llu", each, deleted.code(TarnErrorDatabase));
+                    "Failed to clear entitlements for %@ : %llu", each,
+                    cleared.code(TarnErrorDatabase));
         }
-    });
+    }
 }
 
 TarnStatus TarnCodeSigningMapping::invalidateCodeSigningInfoForIdentifierAndItsChildren(
@@ -533,7 +602,82 @@ TarnStatus TarnCodeSigningMapping::removeAllAdvanceCopiesWithError() {
 TarnStatus TarnCodeSigningMapping::processCallerRegisteredEntitlements(const PlistDict& entitlements,
                                                                        const std::string& forIdentifier,
                                                                        TarnCommandQueue* commandQueue) {
-    return {};
+    if (forIdentifier.empty()) return TARN_ERROR_CODE(TarnErrorMissingIdentifier, nullptr);
+    // Every admitted request comes here: the common case must not touch the
+    // store or wait for the queue.
+    if (registrationIsCurrent(forIdentifier, entitlements)) return {};
+
+    TarnResult<TarnCodeSigningEntryRef> read = TarnCodeSigningEntryRef();
+    uint64_t generation = 0;
+    runOnQueue([&] {
+        read = _onQueue_codeSigningEntryForIdentifier(forIdentifier);
+        // Taken with the read, on the queue: a change after the read bumps it.
+        generation = storeGeneration();
+    });
+    if (!read.ok() && !isNotFound(read.error())) return read.error();
+    const TarnCodeSigningEntryRef stored = read.ok() ? std::move(*read) : nullptr;
+
+    if (stored && stored->codeSigningInfo() && !stored->registeredByCaller()) {
+        // The installer's info is never replaced by what a caller says of itself.
+        rememberRegistration(forIdentifier, entitlements, generation);
+        return {};
+    }
+    if (stored && stored->registeredByCaller()) {
+        const PlistDict* registered = stored->entitlements();
+        if (registered && *registered == entitlements) {
+            rememberRegistration(forIdentifier, entitlements, generation);
+            return {};
+        }
+        TarnLog(kLogNotice, "processCallerRegisteredEntitlements",
+                "%@ has changed entitlements. Re-registering.", forIdentifier);
+    }
+    // Not remembered here: the next request finds the registration in the
+    // store and remembers it then, so that a failed write is retried.
+    TarnGlobalLockHolder lock(TarnGlobalLockHolder::Mode::Write);
+    return processCodeSigningInfo(PlistDict{{kEntitlementsKey, entitlements}}, forIdentifier,
+                                  PlistDict{{kOptionRegisteredByCaller, true}}, commandQueue);
+}
+
+// ---- registration memo ----
+
+bool TarnCodeSigningMapping::registrationIsCurrent(const std::string& identifier,
+                                                   const PlistDict& entitlements) {
+    std::shared_ptr<const PlistDict> remembered;
+    {
+        MutexLock lock(memoMutex_);
+        auto it = registrationMemo_.find(identifier);
+        if (it == registrationMemo_.end() || it->second.generation != storeGeneration_)
+            return false;
+        remembered = it->second.entitlements;
+    }
+    // Compared outside the lock: concurrent requests of other clients need not
+    // wait for it. A change made meanwhile is ordered after this request.
+    return *remembered == entitlements;
+}
+
+void TarnCodeSigningMapping::rememberRegistration(const std::string& identifier,
+                                                  const PlistDict& entitlements,
+                                                  uint64_t generation) {
+    auto copy = std::make_shared<const PlistDict>(entitlements);
+    MutexLock lock(memoMutex_);
+    // Learnt before a change that has happened since: it may no longer hold.
+    if (generation != storeGeneration_) return;
+    if (registrationMemo_.size() >= kRegistrationMemoCapacity &&
+        !registrationMemo_.contains(identifier)) {
+        registrationMemo_.clear();
+    }
+    registrationMemo_.insert_or_assign(identifier, RegistrationMemo{std::move(copy), generation});
+}
+
+uint64_t TarnCodeSigningMapping::storeGeneration() {
+    MutexLock lock(memoMutex_);
+    return storeGeneration_;
+}
+
+void TarnCodeSigningMapping::_onQueue_storeWillChange() {
+    assertOnQueue();
+    MutexLock lock(memoMutex_);
+    ++storeGeneration_;
 }
 
 // ---- command 19 ----
@@ -558,26 +702,221 @@ void TarnHandleGetCodeSigningInfoCommand(const TarnRequestContext& context,
     reply.set("ReplyInfoDictionary", std::move(*info));
 }
 
-}  // namespace tarn
+// ---- processing of code-signing info ----
 
-namespace tarn {
-
-// Not built yet: the processing of code-signing information.
-TarnStatus TarnCodeSigningMapping::processCodeSigningInfo(const std::optional<PlistDict>&,
-                                                          const std::string&, const PlistDict&,
-                                                          TarnCommandQueue*) {
-    return {};
+TarnStatus TarnCodeSigningMapping::processCodeSigningInfo(
+    const std::optional<PlistDict>& codeSigningInfo, const std::string& forIdentifier,
+    const PlistDict& withOptions, TarnCommandQueue* commandQueue) {
+    // Off the queue: a miss may import from the bundle container, and the
+    // container cache must not be called on the queue.
+    std::optional<PlistDict> oldEntitlements = entitlementsForIdentifier(forIdentifier);
+    TarnStatus status;
+    runOnQueue([&] {
+        status = _onQueue_processCodeSigningInfo(codeSigningInfo, forIdentifier, withOptions,
+                                                 oldEntitlements, commandQueue);
+    });
+    return status;
 }
 
-TarnStatus TarnCodeSigningMapping::_onQueue_processCodeSigningInfo(const std::optional<PlistDict>&,
-                                                                   const std::string&,
-                                                                   const PlistDict&,
-                                                                   const std::optional<PlistDict>&,
-                                                                   TarnCommandQueue*) {
-    return {};
+TarnStatus TarnCodeSigningMapping::_onQueue_processCodeSigningInfo(
+    const std::optional<PlistDict>& codeSigningInfo, const std::string& forIdentifier,
+    const PlistDict& withOptions, const std::optional<PlistDict>& oldEntitlements,
+    TarnCommandQueue* commandQueue) {
+    assertOnQueue();
+    constexpr const char* kTag = "_onQueue_processCodeSigningInfo";
+    return TarnFenceExceptions(kTag, [&]() -> TarnStatus {
+        if (forIdentifier.empty())
+            return TARN_ERROR_CODE_IN(kTag, TarnErrorMissingIdentifier, nullptr);
+
+        TarnResult<TarnCodeSigningEntryRef> read =
+            _onQueue_codeSigningEntryForIdentifier(forIdentifier);
+        if (!read.ok() && !isNotFound(read.error())) return read.error();
+        const TarnCodeSigningEntryRef existing = read.ok() ? std::move(*read) : nullptr;
+
+        auto entry = std::make_shared<TarnCodeSigningEntry>();
+        if (const PlistValue* dataClass = optionValue(withOptions, kOptionDataContainerClass)) {
+            entry->setDataContainerClass(dataClass->asUInt64().value_or(0));
+        }
+
+        // Written in this order: the parent before the identifier.
+        std::vector<TarnCodeSigningEntryRef> values;
+        std::vector<std::string> identifiers;
+
+        const PlistValue* parentOption = optionValue(withOptions, kOptionParentBundleID);
+        const std::string* parentIdentifier = parentOption ? parentOption->asString() : nullptr;
+        if (parentIdentifier && !parentIdentifier->empty()) {
+            TarnResult<TarnCodeSigningEntryRef> parentRead =
+                _onQueue_codeSigningEntryForIdentifier(*parentIdentifier);
+            if (!parentRead.ok() && !isNotFound(parentRead.error())) return parentRead.error();
+            // A parent without a record gets an empty one, which the batch
+            // does not store: the child is recorded once the parent is.
+            auto parent = parentRead.ok() ? std::make_shared<TarnCodeSigningEntry>(**parentRead)
+                                          : std::make_shared<TarnCodeSigningEntry>();
+            std::vector<std::string> children = parent->childBundleIdentifiers();
+            if (std::find(children.begin(), children.end(), forIdentifier) == children.end()) {
+                children.push_back(forIdentifier);
+                TarnLog(kLogDebug, kTag,
+                        "Staging Child Bundles: %@ for parent ID: %@ by appending: %@",
+                        PlistValue(PlistArray(children.begin(), children.end())), *parentIdentifier,
+                        forIdentifier);
+                parent->setChildBundleIdentifiers(std::move(children));
+                values.push_back(std::move(parent));
+                identifiers.push_back(*parentIdentifier);
+            }
+        }
+
+        entry->setRegisteredByCaller(optionIsTrue(withOptions, kOptionRegisteredByCaller));
+        entry->setPlaceholder(optionIsTrue(withOptions, kOptionPlaceholder));
+        entry->setAdvanceCopy(optionIsTrue(withOptions, kOptionAdvanceCopy));
+        entry->setCodeSigningInfo(codeSigningInfo);
+
+        if (!existing || !existing->isEqual(*entry)) {
+            const PlistDict* newEntitlements = entry->entitlements();
+            const PlistDict* previous = oldEntitlements ? &*oldEntitlements : nullptr;
+
+            if (_entitlementsHasSystemContainer(previous) &&
+                !_entitlementsHasSystemContainer(newEntitlements)) {
+                _onQueue_stageSystemContainerForDelete(forIdentifier, commandQueue);
+            }
+
+            auto handOver = [&](const std::optional<std::vector<std::string>>& oldIds,
+                                const std::optional<std::vector<std::string>>& newIds,
+                                TarnGroupType type) {
+                if (!oldIds && !newIds) return;
+                if (TEST_groupChangeHook) TEST_groupChangeHook(oldIds, newIds, type);
+                _onQueue_handleChangeFromOldGroupContainerIds(oldIds, newIds, type, commandQueue);
+            };
+            const auto newAppGroups =
+                _appGroupIdentifiersForIdentifier(forIdentifier, newEntitlements);
+            const auto oldAppGroups = _appGroupIdentifiersForIdentifier(forIdentifier, previous);
+            handOver(oldAppGroups, newAppGroups, TarnGroupTypeApplication);
+
+            // The new list is read as the entitlement stands (the older key
+            // when the current one names none); the old one through the
+            // system-group rules.
+            auto newSystemGroups = _copyApplicationGroupEntitlementForIdentifier(
+                forIdentifier, newEntitlements, kTarnSystemGroupsEntitlement);
+            if (!newSystemGroups || newSystemGroups->empty()) {
+                newSystemGroups = _copyApplicationGroupEntitlementForIdentifier(
+                    forIdentifier, newEntitlements, kTarnSystemGroupContainersEntitlement);
+            }
+            const auto oldSystemGroups =
+                _systemGroupIdentifiersForIdentifier(forIdentifier, previous);
+            handOver(oldSystemGroups, newSystemGroups, TarnGroupTypeSystem);
+            PlatformLog("codesignmapping", PlatformLogType::Default,
+                        "Reconciled; old app groups: %@, new app groups: %@, "
+                        "old system groups: %@, new system groups: %@",
+                        describedIds(oldAppGroups), describedIds(newAppGroups),
+                        describedIds(oldSystemGroups), describedIds(newSystemGroups));
+
+            values.push_back(codeSigningInfo ? entry : std::make_shared<TarnCodeSigningEntry>());
+            identifiers.push_back(forIdentifier);
+        }
+
+        if (!values.empty()) {
+            // Write failures are logged by the batch and do not fail the
+            // processing; the arrays are built in pairs, so counts match.
+            (void)_onQueue_setCodeSigningDictionaryValues(values, identifiers);
+        }
+        return {};
+    });
 }
+
+void TarnCodeSigningMapping::_onQueue_stageSystemContainerForDelete(
+    const std::string& identifier, TarnCommandQueue* commandQueue) {
+    assertOnQueue();
+    TarnResult<TarnContainerIdentityRef> identity =
+        TarnContainerIdentity::containerIdentityWithIdentifier(identifier, TarnContainerClass{12});
+    if (!identity.ok()) {
+        TarnLog(kLogError, "_onQueue_processCodeSigningInfo",
+                "Failed to create system container identity for %@: %@", identifier,
+                identity.error());
+        return;
+    }
+    TarnLog(kLogError, "_onQueue_processCodeSigningInfo",
+            "Deleting system container for ID: %@ because it is no longer in the entitlements",
+            identifier);
+    // Without a command queue (tools, tests) there is nowhere to stage it.
+    if (!commandQueue) return;
+    commandQueue->insertCommand(
+        TarnCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+            {std::move(*identity)}, /*useLocking=*/true, [identifier](uint64_t error) {
+                TarnLog(kLogError, "_onQueue_processCodeSigningInfo",
+                        "Failed to destroy system container with identifier %@: %llu", identifier,
+                        error);
+            }));
+}
+
+// ---- invalidation of apps without a bundle container ----
 
 TarnStatus TarnCodeSigningMapping::invalidateCodeSigningInfoForAppsWithoutBundleContainer() {
+    constexpr const char* kTag = "invalidateCodeSigningInfoForAppsWithoutBundleContainer";
+    TarnGlobalLockHolder lock(TarnGlobalLockHolder::Mode::Write);
+    TarnResult<std::set<std::string>> identifiers = identifiersWithError();
+    if (!identifiers.ok()) {
+        TarnLog(kLogError, kTag,
+                "Failed to enumerate containers when invalidating code signing info: %@",
+                identifiers.error());
+        return identifiers.error();
+    }
+    const TarnUserIdentityRef bundleOwner = TarnUserIdentityCache::defaultUserIdentity();
+    TarnContainerCache& cache = TarnContainerCache::sharedInstance();
+    for (const std::string& identifier : *identifiers) {
+        TarnResult<TarnCodeSigningEntryRef> entry = TarnCodeSigningEntryRef();
+        bool isPlugIn = false;
+        bool hasParent = false;
+        runOnQueue([&] {
+            entry = codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier);
+            if (!entry.ok()) return;
+            const uint64_t dataClass = (*entry)->dataContainerClass();
+            isPlugIn = dataClass >= 3 && dataClass <= 6;
+            hasParent =
+                isPlugIn && !_onQueue_parentIdentifierForChildIdentifier(identifier).empty();
+        });
+        if (!entry.ok()) {
+            TarnLog(kLogError, kTag,
+                    "Error fetching code sign info for %@ to check for invalidation: %@",
+                    identifier, entry.error());
+            continue;
+        }
+        PlatformLog("codesignmapping", PlatformLogType::Info,
+                    "Checking for invalidation: identifier = %@, codeSigningEntry = <%p>, "
+                    "isRegisteredByCaller = %d, isPlugIn = %d, hasParent = %d",
+                    identifier, static_cast<const void*>(entry->get()),
+                    (*entry)->registeredByCaller(), isPlugIn, hasParent);
+        // A caller-registered entry has no bundle of its own; a plug-in with a
+        // parent goes with its parent.
+        if ((*entry)->registeredByCaller() || hasParent) continue;
+
+        bool hasBundle = false;
+        for (TarnContainerClass bundleClass :
+             {TarnContainerClass{1}, TarnContainerClass{3}, TarnContainerClass{5}}) {
+            TarnResult<TarnContainerIdentityRef> identity =
+                TarnContainerIdentity::containerIdentityWithUserIdentity(bundleOwner, identifier,
+                                                                         bundleClass);
+            if (!identity.ok()) continue;
+            // Only a container found counts: a class directory that does not
+            // exist (no VPN plug-in ever installed) fails the look-up too.
+            if (cache
+                    .containerForContainerIdentity(*identity, /*transient=*/false,
+                                                   /*updateSandbox=*/false)
+                    .ok()) {
+                hasBundle = true;
+                break;
+            }
+        }
+        if (hasBundle) continue;
+
+        PlatformLog("codesignmapping", PlatformLogType::Default,
+                    "Invalidating: identifier = %@, isPlugin = %d", identifier, isPlugIn);
+        TarnStatus invalidated = invalidateCodeSigningInfoForIdentifierAndItsChildren(identifier);
+        if (!invalidated.ok()) {
+            // Recorded for this identifier only; the others are still checked.
+            (void)TARN_ERROR_IN(kTag, TarnErrorDatabase, invalidated.error(),
+                                "Failed to invalidate code signing info for %@ : %@", identifier,
+                                invalidated.error());
+        }
+    }
     return {};
 }
 

@@ -6,9 +6,9 @@
 // Concurrency: every store access runs on the mapping's one serial queue,
 // "com.ostrea.TarnKeeper.EntitlementQueue". Public operations enter it
 // synchronously, so they must not be called from it (that would deadlock;
-// it is checked in every build, and stops the process). `_onQueue_` operations must run on it. Work on the queue
-// runs strictly one item at a time in submission order, so a read never sees
-// half of a write.
+// it is checked in every build, and stops the process). `_onQueue_`
+// operations must run on it. Work on the queue runs strictly one item at a
+// time in submission order, so a read never sees half of a write.
 //
 // Lifetime: the shared instance is made on first use and lives for the whole
 // process. Entries handed out are immutable snapshots.
@@ -20,6 +20,12 @@
 // Errors: operations that can fail answer a TarnResult (Daemon/TarnResult.h)
 // carrying the store's error values unchanged (TarnSQLiteDB.h lists them).
 // Reads that answer a plain value treat a failure as "none" after logging it.
+//
+// Locks: processCallerRegisteredEntitlements() and
+// invalidateCodeSigningInfoForAppsWithoutBundleContainer() take the global
+// identifier write lock (gTarnLocks), so their callers must hold no global or
+// identifier lock. The container cache is called only off the queue (its lock
+// comes before the queue).
 #pragma once
 
 #include <cstdint>
@@ -30,6 +36,7 @@
 #include <set>
 #include <string>
 #include <string_view>
+#include <unordered_map>
 #include <vector>
 
 #include "Daemon/TarnCodeSigningEntry.h"
@@ -41,6 +48,7 @@
 #include "Platform/Dispatch.h"
 #include "Platform/Path.h"
 #include "Platform/PropertyList.h"
+#include "Platform/ThreadAnnotations.h"
 
 namespace tarn {
 
@@ -97,13 +105,17 @@ public:
     TarnCodeSigningMapping& operator=(const TarnCodeSigningMapping&) = delete;
 
     const DispatchQueueRef& queue() const { return queue_; }
-    // Only to be used on queue().
+    // Only to be used on queue(); a change made through it calls
+    // _onQueue_storeWillChange() first.
     TarnSQLiteDB* codeSigningMappingDB() const { return codeSigningMappingDB_.get(); }
     TarnUserIdentitySharedCache* userIdentityCache() const { return userIdentityCache_; }
 
     // ---- reads ----
 
-    // Entitlements for the daemon's own decisions (internal view); empty when none.
+    // Entitlements for the daemon's own decisions (internal view); empty when
+    // none. On a miss, code-signing info still cached in the metadata of the
+    // identifier's application bundle container is stored (data-container
+    // class 2) and answered.
     std::optional<PlistDict> entitlementsForIdentifier(const std::string& identifier);
     // The code-signing info as a client may see it (external view); empty when none.
     std::optional<PlistDict> getCodeSigningInfoForIdentifier(const std::string& identifier);
@@ -140,28 +152,36 @@ public:
     // Records the installer's (or a caller's) code-signing info for the
     // identifier; empty info removes the identifier's record. Group and
     // system containers the new entitlements no longer claim are staged for
-    // deletion on `commandQueue`, to run after the mapping work. The old
-    // entitlements are read first, outside the queue.
+    // deletion on `commandQueue` (null: none are staged), to run after the
+    // mapping work. The old entitlements are read first, outside the queue.
+    // Info equal to what is stored writes nothing and stages nothing. Fails
+    // only for a missing identifier, an unreadable record (its error) or an
+    // exception (TarnErrorException); a failed store write is logged only.
     TarnStatus processCodeSigningInfo(const std::optional<PlistDict>& codeSigningInfo,
                                       const std::string& forIdentifier,
                                       const PlistDict& withOptions, TarnCommandQueue* commandQueue);
-    // Under the global write lock: invalidates every entry whose bundle has
-    // no container, except caller-registered ones and plug-ins with a parent.
+    // Under the global write lock: invalidates, with its children, every
+    // entry whose identifier has no bundle container (class 1, 3 or 5),
+    // except caller-registered ones and plug-ins with a parent. Fails only
+    // when the identifiers cannot be listed; a failed invalidation is logged
+    // and the others are still checked.
     TarnStatus invalidateCodeSigningInfoForAppsWithoutBundleContainer();
 
     TarnStatus invalidateCodeSigningInfoForIdentifier(const std::string& identifier);
     TarnStatus invalidateCodeSigningInfoForIdentifierAndItsChildren(const std::string& identifier);
     TarnStatus removeAllAdvanceCopiesWithError();
-    // Deletes the stored records of the identifier's children, then of the
-    // identifier itself; an identifier without a record is skipped. A failure
-    // is logged and the others are still removed. `commandQueue` receives the
-    // follow-up work of group clean-up.
+    // Processes empty info for each of the identifier's children, then for the
+    // identifier itself: their records go, and the group and system
+    // containers they alone claimed are staged for deletion on `commandQueue`.
+    // A failure is logged and the others are still removed.
     void removeCodeSigningDictionariesForIdentifierAndItsChildren(const std::string& identifier,
                                                                   TarnCommandQueue* commandQueue);
     // A connecting client's own entitlements, offered on every admitted
-    // request. Not built yet: registering them (and the group clean-up that
-    // follows) comes with the processing of code-signing information. Until
-    // then this answers success and stores nothing.
+    // request. Registers them (under the global write lock) unless the
+    // installer's info is stored for the identifier or the same entitlements
+    // are already registered. Answered from a memo, with no store read and no
+    // queue hop, while nothing in the store has changed since the identifier
+    // was last found registered with these entitlements (or installer-owned).
     TarnStatus processCallerRegisteredEntitlements(const PlistDict& entitlements,
                                                    const std::string& forIdentifier,
                                                    TarnCommandQueue* commandQueue);
@@ -183,11 +203,18 @@ public:
 
     // ---- on the queue ----
 
+    // Steps of processCodeSigningInfo() after the old entitlements are read;
+    // an exception inside is fenced here.
     TarnStatus _onQueue_processCodeSigningInfo(const std::optional<PlistDict>& codeSigningInfo,
                                                const std::string& forIdentifier,
                                                const PlistDict& withOptions,
                                                const std::optional<PlistDict>& oldEntitlements,
                                                TarnCommandQueue* commandQueue);
+
+    // Step of processing: stages the deletion of the identifier's system
+    // container (class 12), with locking, on `commandQueue`.
+    void _onQueue_stageSystemContainerForDelete(const std::string& identifier,
+                                                TarnCommandQueue* commandQueue);
 
     // ---- group containers (TarnCodeSigningMappingGroups.cc) ----
 
@@ -234,20 +261,55 @@ public:
                                                        const std::vector<std::string>& forIdentifiers);
     // Imports "tarn_code_signing_info.plist" from the library directory.
     void _onQueue_migrateFromMappingFileToDBIfNecessary();
+    // Every change of the store made through the mapping calls this first: it
+    // retires what the registration memo has learnt.
+    void _onQueue_storeWillChange();
     // The legacy mapping file: identifier -> serialised entry, or the error
     // when it cannot be read; a missing file is a POSIX ENOENT error.
     static TarnResult<PlistDict> _readCodeSigningMappingFromDiskAtURL(const FileURL& url);
+
+    // ---- test access ----
+
+    // Called on the queue with what processing hands to
+    // _onQueue_handleChangeFromOldGroupContainerIds(). Set only while no
+    // processing runs.
+    using GroupChangeHook = std::function<void(
+        const std::optional<std::vector<std::string>>& oldIds,
+        const std::optional<std::vector<std::string>>& newIds, TarnGroupType type)>;
+    GroupChangeHook TEST_groupChangeHook;
 
 private:
     // Runs `work` synchronously on the queue; must be called off it.
     void runOnQueue(const std::function<void()>& work);
     void assertOnQueue() const;
+    // entitlementsForIdentifier() after a miss: the import from the
+    // application bundle container's metadata. Off the queue.
+    std::optional<PlistDict> importCachedCodeSigningInfo(const std::string& identifier);
+
+    // The registration memo. The generation counts store changes; a memo
+    // entry holds for as long as the generation it was learnt at is current.
+    struct RegistrationMemo {
+        std::shared_ptr<const PlistDict> entitlements;
+        uint64_t generation = 0;
+    };
+    // True when `entitlements` are known to need no registration for `identifier`.
+    bool registrationIsCurrent(const std::string& identifier, const PlistDict& entitlements)
+        EXCLUDES(memoMutex_);
+    void rememberRegistration(const std::string& identifier, const PlistDict& entitlements,
+                              uint64_t generation) EXCLUDES(memoMutex_);
+    uint64_t storeGeneration() EXCLUDES(memoMutex_);
 
     // Constant after construction.
     TarnUserIdentitySharedCache* const userIdentityCache_;
     const DispatchQueueRef queue_;
     // Used on queue_ only.
     const std::unique_ptr<TarnSQLiteDB> codeSigningMappingDB_;
+
+    // Guarded by memoMutex_ (taken on and off the queue; never held while
+    // waiting for anything else).
+    Mutex memoMutex_;
+    uint64_t storeGeneration_ GUARDED_BY(memoMutex_) = 0;
+    std::unordered_map<std::string, RegistrationMemo> registrationMemo_ GUARDED_BY(memoMutex_);
 };
 
 // Command 19: answers "ReplyInfoDictionary" with the external view of the
