@@ -176,6 +176,31 @@ class TarnClientConnection {
     TarnStatus regenerateDirectoryUUIDWithContainerIdentity(
         const TarnConcreteContainerIdentityRef& identity);
 
+    // ---- User-managed assets and shared content (TarnClientConnectionAssets.cc) ----
+
+    struct AssetsPath {
+        std::string path;      // absolute, or relative to the container ("Library/...")
+        bool existed = false;  // the directory was there before this call
+    };
+    TarnResult<AssetsPath> userManagedAssetsPathWithContainerIdentity(
+        const TarnContainerIdentityRef& identity, bool isRelative, bool createIfNecessary);
+    // `relativePath` empty: the request's value was missing or not a string.
+    TarnStatus deleteUserManagedAssetWithContainerIdentity(
+        const TarnContainerIdentityRef& identity, const std::optional<std::string>& relativePath);
+    TarnStatus stageSharedContentForIdentifier(const std::optional<std::string>& identifier,
+                                               const std::optional<std::string>& sourceRelativePath,
+                                               const std::optional<std::string>& destRelativePath);
+
+    // ---- Group look-ups and the retry test (TarnClientConnectionGroups.cc) ----
+
+    // Group identifier -> the group's container, created when missing; a group
+    // whose container cannot be made is left out.
+    TarnResult<std::map<std::string, TarnMetadataRef>> groupContainersForOwnerIdentifier(
+        const std::string& ownerIdentifier, const TarnUserIdentityRef& userIdentity,
+        TarnContainerClass groupContainerClass);
+    // Ends the process while crashes remain (internal builds only call it).
+    TarnStatus retryTestWithNumCrashes(uint64_t numCrashes);
+
     // Runs the command queue until it is exhausted or a command fails; the
     // failing command's code goes into the request's error slot.
     bool completeWithError(uint64_t* error);

@@ -1,9 +1,11 @@
 #include "Daemon/TarnCommandTable.h"
 
+#include "Daemon/TarnAssetCommands.h"
 #include "Daemon/TarnCodeSigningCommands.h"
 #include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnContainerCommands.h"
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnGroupCommands.h"
 #include "Daemon/TarnTestLocks.h"
 
 namespace tarn {
@@ -32,11 +34,11 @@ const TarnCommandTableRow gTarnCommandTable[kTarnCommandCount] = {
     {.command = 10, .handler = TarnHandleDeleteContainerCommand, .entitlement = kAllowed},  // delete a container
     {.command = 11, .entitlement = kTarnEntitlementWipeContainer},  // wipe an entitled data container
     {.command = 12, .entitlement = kTarnEntitlementDeleteContainerContent},  // wipe any container
-    {.command = 13, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // the client's group containers
+    {.command = 13, .handler = TarnHandleGroupContainersCommand, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // the client's group containers
     {.command = 14, .handler = TarnHandleGroupIdentifiersCommand, .entitlement = kAllowed, .lookupAllowed = 1},  // group identifiers of an owner
-    {.command = 15, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // path of a system container
-    {.command = 16, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // system group containers of an owner
-    {.command = 17, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // path of one system group container
+    {.command = 15, .handler = TarnHandleSystemContainerPathCommand, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // path of a system container
+    {.command = 16, .handler = TarnHandleSystemGroupContainersCommand, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // system group containers of an owner
+    {.command = 17, .handler = TarnHandleSystemGroupContainerPathCommand, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // path of one system group container
     {.command = 18, .handler = TarnHandleProcessCodeSigningInfoCommand, .entitlement = kAllowed},  // record code-signing information
     {.command = 19, .handler = TarnHandleGetCodeSigningInfoCommand, .entitlement = kAllowed},  // read code-signing information
     {.command = 20, .handler = TarnHandleInvalidateAppsWithoutBundleCommand, .entitlement = kAllowed},  // invalidate code-signing info without bundle
@@ -44,14 +46,14 @@ const TarnCommandTableRow gTarnCommandTable[kTarnCommandCount] = {
     {.command = 22, .handler = TarnHandleRecreateStructureCommand, .entitlement = kAllowed},  // same as 8
     {.command = 23, .handler = TarnHandleDiskUsageCommand, .entitlement = kAllowed, .lookupAllowed = 1},  // disk usage
     {.command = 24, .entitlement = kTarnEntitlementDataMigration},  // data-migrator migration
-    {.command = 25, .entitlement = kTarnEntitlementTestability},  // crash-and-retry test
-    {.command = 26, .entitlement = kTarnEntitlementStageSharedContent},  // stage shared content
+    {.command = 25, .handler = TarnHandleRetryTestCommand, .entitlement = kTarnEntitlementTestability},  // crash-and-retry test
+    {.command = 26, .handler = TarnHandleStageSharedContentCommand, .entitlement = kTarnEntitlementStageSharedContent},  // stage shared content
     {.command = 27, .handler = TarnHandleUnsupportedCommand, .entitlement = kAllowed},  // not supported
-    {.command = 28, .entitlement = kTarnEntitlementUserManagedAssets, .anyClient = 1},  // user-managed assets path
-    {.command = 29, .entitlement = kTarnEntitlementUserManagedAssets},  // delete a user-managed asset
+    {.command = 28, .handler = TarnHandleUserManagedAssetsPathCommand, .entitlement = kTarnEntitlementUserManagedAssets, .anyClient = 1},  // user-managed assets path
+    {.command = 29, .handler = TarnHandleDeleteUserManagedAssetCommand, .entitlement = kTarnEntitlementUserManagedAssets},  // delete a user-managed asset
     {.command = 30, .entitlement = kAllowed},  // per-user data migration
     {.command = 31, .handler = TarnHandleTestLockCommand, .entitlement = kTarnEntitlementTestability},  // test locks
-    {.command = 32, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // persona unique strings
+    {.command = 32, .handler = TarnHandlePersonaStringsCommand, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // persona unique strings
 };
 // clang-format on
 
