@@ -74,6 +74,10 @@ class TarnClientConnection {
     static TarnClientConnection& sharedClientConnection();
 
     const TarnClientIdentityRef& clientIdentity() const { return clientIdentity_; }
+    // Only the retry test acts as someone else (the anonymous privileged identity).
+    void setClientIdentity(TarnClientIdentityRef clientIdentity) {
+        clientIdentity_ = std::move(clientIdentity);
+    }
     // The client identity's bundle identifier (not the stored field).
     std::string clientBundleIdentifier() const;
     void setClientBundleIdentifier(std::string clientBundleIdentifier) {
@@ -194,11 +198,20 @@ class TarnClientConnection {
     // ---- Group look-ups and the retry test (TarnClientConnectionGroups.cc) ----
 
     // Group identifier -> the group's container, created when missing; a group
-    // whose container cannot be made is left out.
+    // whose container cannot be made is logged and left out. A caller that
+    // fails the group-owner rule for `ownerIdentifier` gets
+    // TarnErrorNotEntitled; one that passes may afterwards look up group
+    // containers of any identifier (allowGroupIdLookup). Holds the global
+    // write lock while it creates, so the caller must hold no identifier lock.
     TarnResult<std::map<std::string, TarnMetadataRef>> groupContainersForOwnerIdentifier(
         const std::string& ownerIdentifier, const TarnUserIdentityRef& userIdentity,
         TarnContainerClass groupContainerClass);
-    // Ends the process while crashes remain (internal builds only call it).
+    // The retry-test container ("com.ostrea.retryTest", application data of
+    // the personal persona) counts the crashes still to come in its info key
+    // "CrashCounter". While one remains this ends the process (status 0,
+    // after 2 s) and never returns; on the last request the container is
+    // staged for deletion on the command queue. The connection acts as the
+    // anonymous privileged one from here on. Internal builds only call it.
     TarnStatus retryTestWithNumCrashes(uint64_t numCrashes);
 
     // Runs the command queue until it is exhausted or a command fails; the
@@ -220,7 +233,8 @@ class TarnClientConnection {
                            bool withGroupRule);
 
     // Read-only after construction, except the rights a handler adjusts
-    // (booleans, client bundle identifier) on the request's own thread.
+    // (booleans, client bundle identifier, the retry test's client identity)
+    // on the request's own thread.
     TarnClientIdentityRef clientIdentity_;
     bool entitled_;
     bool allowOtherIdLookup_;
