@@ -310,6 +310,103 @@ FileURL TarnFileManager::homeDirectoryURLForPOSIXUID(uid_t uid) {
     return RootPath("/private/var/mobile");
 }
 
+// ---- Client-named items below a directory held open ----
+
+TarnResult<TarnFileManager::ItemInDirectory> TarnFileManager::itemBelowDirectory(
+    const FsFd& base, const std::string& relativePath) {
+    const std::string standardized = PathStandardize(relativePath);
+    if (!standardized.empty() && standardized[0] == '/')
+        return TARN_POSIX_ERROR(EXDEV, "Absolute path %@ refused below a directory", relativePath);
+    if (standardized.empty() || standardized == ".")
+        return TARN_POSIX_ERROR(EINVAL, "Path %@ names the directory itself", relativePath);
+    ItemInDirectory item;
+    item.name = PathLastComponent(standardized);
+    if (item.name == "..")
+        return TARN_POSIX_ERROR(EXDEV, "Path %@ leaves its directory", relativePath);
+    item.directory = TARN_TRY(openDirectoryBelowDirectory(base, PathParent(standardized)));
+    FsStat st;
+    if (int err = FsStatAt(item.directory.get(), item.name, &st)) {
+        if (err != ENOENT)
+            return TARN_POSIX_ERROR(err, "stat of %@ failed: %s", relativePath, errText(err));
+    } else {
+        item.stat = st;
+    }
+    return item;
+}
+
+TarnResult<FsFd> TarnFileManager::openDirectoryBelowDirectory(const FsFd& base,
+                                                              const std::string& relativePath) {
+    if (!base) return TARN_POSIX_ERROR(EBADF, "No directory to resolve %@ below", relativePath);
+    FsFd directory;
+    if (int err = FsOpenDirectoryBeneath(base.get(), relativePath, &directory)) {
+        return TARN_POSIX_ERROR(err, "Failed to open %@ below its directory: %s", relativePath,
+                                errText(err));
+    }
+    return directory;
+}
+
+TarnStatus TarnFileManager::renameItemInDirectory(const FsFd& fromDirectory,
+                                                  const std::string& fromName,
+                                                  const FsFd& toDirectory,
+                                                  const std::string& toName) {
+    int err = 0;
+    if (auto fp = TARN_FAILPOINT("fm.move"))
+        err = *fp;
+    else
+        err = FsRenameAt(fromDirectory.get(), fromName, toDirectory.get(), toName);
+    if (err == 0) return {};
+    return TARN_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", fromName, toName, errText(err));
+}
+
+TarnResult<std::string> TarnFileManager::createTemporaryDirectoryInDirectory(
+    const FsFd& directory, const std::string& withNamePrefix) {
+    int err = 0;
+    std::string name;
+    if (auto fp = TARN_FAILPOINT("fm.createTemporaryDirectory"))
+        err = *fp;
+    else
+        err = FsMkdtempAt(directory.get(), withNamePrefix, &name);
+    if (err)
+        return TARN_POSIX_ERROR(err, "Failed to create temp dir with prefix %s : %s",
+                                withNamePrefix, errText(err));
+    return name;
+}
+
+TarnStatus TarnFileManager::setModeOfItemInDirectory(const FsFd& directory,
+                                                     const std::string& name, mode_t mode) {
+    int err = 0;
+    if (auto fp = TARN_FAILPOINT("fm.setMode"))
+        err = *fp;
+    else
+        err = FsChmodAt(directory.get(), name, mode);
+    if (err)
+        return TARN_POSIX_ERROR(err, "chmod(%o) of %@ failed: %s", mode, name, errText(err));
+    return {};
+}
+
+TarnStatus TarnFileManager::setOwnerOfItemInDirectory(const FsFd& directory,
+                                                      const std::string& name, uid_t uid,
+                                                      gid_t gid) {
+    int err = 0;
+    if (auto fp = TARN_FAILPOINT("fm.setOwner")) {
+        err = *fp;
+    } else if (!ProcessIsPrivileged()) {
+        logSkippedOwner(__func__, name);
+        return {};
+    } else {
+        // AT_SYMLINK_NOFOLLOW would change a link's own owner; a link is
+        // never what a caller of this means, so it is refused instead.
+        FsStat st;
+        err = FsStatAt(directory.get(), name, &st);
+        if (err == 0 && st.isSymlink()) err = ELOOP;
+        if (err == 0) err = FsChownAt(directory.get(), name, uid, gid);
+    }
+    if (err)
+        return TARN_POSIX_ERROR(err, "chown(%d,%d) of %@ failed: %s", uid, gid, name,
+                                errText(err));
+    return {};
+}
+
 // ---- Directories ----
 
 TarnStatus TarnFileManager::createDirectoryAtURL(const FileURL& url,
@@ -571,13 +668,19 @@ TarnResult<std::vector<FileURL>> TarnFileManager::urlsForItemsInDirectoryAtURL(c
     return out;
 }
 
-TarnStatus TarnFileManager::_traverseDirectory(const FileURL& url,
-                                               const TarnTraversalBlock& withBlock) {
+namespace {
+
+using FsVisit = std::function<bool(const FsWalkEntry&)>;
+
+// A traversal over the walk `walk` starts (FsWalk or FsWalkAt), handing every
+// entry to `withBlock`, under the name of `operation`.
+TarnStatus traverse(const char* operation, const FileURL& url,
+                    const std::function<int(const FsVisit&)>& walk,
+                    const TarnTraversalBlock& withBlock) {
     SignpostInterval interval(kLogCategory, "TraversingDirectory");
     uint64_t handed = 0;
     TarnErrorRef walkError;
-    const char* const operation = __func__;  // inside the walk's lambda __func__ is the lambda's
-    int err = FsWalk(url, [&](const FsWalkEntry& entry) {
+    int err = walk([&](const FsWalkEntry& entry) {
         if (entry.type == FsWalkType::Error) {
             walkError = TARN_POSIX_ERROR_IN(operation, entry.error, "Error for path %s: %s", url,
                                             errText(entry.error));
@@ -595,8 +698,26 @@ TarnStatus TarnFileManager::_traverseDirectory(const FileURL& url,
     interval.end({{"count", std::to_string(handed)}});
     if (walkError) return walkError;
     if (err)
-        return TARN_POSIX_ERROR(err, "fts_open failed for %s with error %s", url, errText(err));
+        return TARN_POSIX_ERROR_IN(operation, err, "fts_open failed for %s with error %s", url,
+                                   errText(err));
     return {};
+}
+
+}  // namespace
+
+TarnStatus TarnFileManager::_traverseDirectory(const FileURL& url,
+                                               const TarnTraversalBlock& withBlock) {
+    return traverse(
+        __func__, url, [&](const FsVisit& visit) { return FsWalk(url, visit); }, withBlock);
+}
+
+TarnStatus TarnFileManager::_traverseItemInDirectory(const FsFd& directory,
+                                                     const std::string& name, const FileURL& url,
+                                                     const TarnTraversalBlock& withBlock) {
+    return traverse(
+        __func__, url,
+        [&](const FsVisit& visit) { return FsWalkAt(directory.get(), name, url, visit); },
+        withBlock);
 }
 
 void TarnFileManager::printDirectoryStructureAtURL(const FileURL& url) {
@@ -758,18 +879,24 @@ TarnStatus TarnFileManager::setTopLevelSystemContainerACLAtURL(const FileURL& ur
     return {};
 }
 
-TarnStatus TarnFileManager::standardizeACLsAtURL(const FileURL& url, bool isSystemContainer) {
-    const char* tag = __func__;
-    const TarnACLRef topLevel = TARN_TRY(_CopyTopLevelSystemContainerACLWithError());
+namespace {
+
+// The ACL standardisation of a tree; `traverseWith` walks it (from a path or
+// from an entry of an open directory).
+using TarnTraversal = std::function<TarnStatus(const TarnTraversalBlock&)>;
+
+TarnStatus standardizeACLs(TarnFileManager& fm, const char* tag, const FileURL& url,
+                           bool isSystemContainer, const TarnTraversal& traverseWith) {
+    const TarnACLRef topLevel = TARN_TRY(fm._CopyTopLevelSystemContainerACLWithError());
     const TarnACLRef dirACL =
-        TARN_TRY(_CopySystemContainerACLWithNumACEs(1, /*isDir=*/true, /*inheritOnly=*/false));
+        TARN_TRY(fm._CopySystemContainerACLWithNumACEs(1, /*isDir=*/true, /*inheritOnly=*/false));
     const TarnACLRef fileACL =
-        TARN_TRY(_CopySystemContainerACLWithNumACEs(1, /*isDir=*/false, /*inheritOnly=*/false));
+        TARN_TRY(fm._CopySystemContainerACLWithNumACEs(1, /*isDir=*/false, /*inheritOnly=*/false));
     if (auto fp = TARN_FAILPOINT("fm.standardizeACLs"))
-        return TARN_POSIX_ERROR(*fp, "Error for path %s: %s", url, errText(*fp));
+        return TARN_POSIX_ERROR_IN(tag, *fp, "Error for path %s: %s", url, errText(*fp));
     bool privileged = ProcessIsPrivileged();
     bool skipNoted = false;
-    return _traverseDirectory(url, [&](const TarnTraversalEntry& e) -> TarnStatus {
+    return traverseWith([&](const TarnTraversalEntry& e) -> TarnStatus {
         if (e.type == FsWalkType::DirectoryPost || containsMetadataName(e.path)) return {};
         bool isDir = e.type == FsWalkType::Directory;
         if (e.level == 0 && isSystemContainer && isDir) {
@@ -796,6 +923,25 @@ TarnStatus TarnFileManager::standardizeACLsAtURL(const FileURL& url, bool isSyst
         }
         return {};
     });
+}
+
+}  // namespace
+
+TarnStatus TarnFileManager::standardizeACLsAtURL(const FileURL& url, bool isSystemContainer) {
+    return standardizeACLs(*this, __func__, url, isSystemContainer,
+                           [&](const TarnTraversalBlock& block) {
+                               return _traverseDirectory(url, block);
+                           });
+}
+
+TarnStatus TarnFileManager::standardizeACLsOfItemInDirectory(const FsFd& directory,
+                                                             const std::string& name,
+                                                             const FileURL& url,
+                                                             bool isSystemContainer) {
+    return standardizeACLs(*this, __func__, url, isSystemContainer,
+                           [&](const TarnTraversalBlock& block) {
+                               return _traverseItemInDirectory(directory, name, url, block);
+                           });
 }
 
 TarnStatus TarnFileManager::standardizeACLsForSystemContainerAtURL(const FileURL& url) {

@@ -130,6 +130,47 @@ public:
     // back to /private/var/mobile.
     static FileURL homeDirectoryURLForPOSIXUID(uid_t uid);
 
+    // ---- Client-named items below a directory held open ----
+    //
+    // A path a client hands in is resolved below a directory the daemon has
+    // opened itself, one descriptor at a time, never through a link (see
+    // FsOpenDirectoryBeneath); the caller then acts through the descriptor it
+    // got, so a link swapped in after the check cannot redirect the act.
+
+    // The item a relative path names: the directory that holds it, opened,
+    // and its last component. `stat` is the item itself, not followed (a
+    // link reads as a link); empty when nothing is there yet.
+    struct ItemInDirectory {
+        FsFd directory;
+        std::string name;
+        std::optional<FsStat> stat;
+    };
+    // Resolves `relativePath` below the open directory `base`. POSIX errors:
+    // EXDEV when the path would leave `base` (absolute, a ".." component),
+    // ELOOP when a directory on the way is a link, EINVAL when it names `base`
+    // itself ("", "."), ENOENT / ENOTDIR for a directory on the way that is
+    // missing or not one.
+    TarnResult<ItemInDirectory> itemBelowDirectory(const FsFd& base,
+                                                   const std::string& relativePath);
+    // The directory `relativePath` names below `base`, opened the same way
+    // (ELOOP when it is a link itself); "" opens `base` again.
+    TarnResult<FsFd> openDirectoryBelowDirectory(const FsFd& base,
+                                                 const std::string& relativePath);
+    // One renameat(2) between two open directories; never a copy.
+    TarnStatus renameItemInDirectory(const FsFd& fromDirectory, const std::string& fromName,
+                                     const FsFd& toDirectory, const std::string& toName);
+    // createTemporaryDirectoryInDirectoryURL inside an open directory: a new
+    // owner-only directory prefix + 6 random characters; answers its name.
+    TarnResult<std::string> createTemporaryDirectoryInDirectory(const FsFd& directory,
+                                                                const std::string& withNamePrefix);
+    // Mode and owner of the entry `name` of an open directory, never through
+    // a link (a link fails: ELOOP / EOPNOTSUPP). Not privileged: the owner is
+    // left alone with a notice, as everywhere in this class.
+    TarnStatus setModeOfItemInDirectory(const FsFd& directory, const std::string& name,
+                                        mode_t mode);
+    TarnStatus setOwnerOfItemInDirectory(const FsFd& directory, const std::string& name, uid_t uid,
+                                         gid_t gid);
+
     // ---- Directories ----
 
     // Owner 0 leaves the owner alone (it is used as user and group id);
@@ -208,6 +249,9 @@ public:
     // Pre-order walk with post-order directory visits, physical, one file
     // system. Entries with unreadable metadata stop the walk with their errno.
     TarnStatus _traverseDirectory(const FileURL& url, const TarnTraversalBlock& withBlock);
+    // The same from the entry `name` of an open directory (`url` for messages).
+    TarnStatus _traverseItemInDirectory(const FsFd& directory, const std::string& name,
+                                        const FileURL& url, const TarnTraversalBlock& withBlock);
     // Logs every item of the tree at error level (orphaned data).
     void printDirectoryStructureAtURL(const FileURL& url);
 
@@ -232,6 +276,10 @@ public:
     TarnStatus standardizeOwnershipAtURL(const FileURL& url, uid_t toUID, gid_t GID);
     TarnStatus setTopLevelSystemContainerACLAtURL(const FileURL& url);
     TarnStatus standardizeACLsAtURL(const FileURL& url, bool isSystemContainer);
+    // The same for the entry `name` of an open directory (`url` names it in
+    // messages); the walk starts there and never follows a link.
+    TarnStatus standardizeACLsOfItemInDirectory(const FsFd& directory, const std::string& name,
+                                                const FileURL& url, bool isSystemContainer);
     TarnStatus standardizeACLsForSystemContainerAtURL(const FileURL& url);
     // Every item of `url` as a system container; a missing `url` succeeds.
     // The other items are still tried after a failure; the last failure is

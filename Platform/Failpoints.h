@@ -37,6 +37,8 @@ inline constexpr const char* kFailpointNames[] = {
     "fm.standardizeOwnership",
     "fm.setTopLevelACL",
     "fm.standardizeACLs",
+    "fm.setMode",
+    "fm.setOwner",
     // Daemon start-up (tests of requests that arrive during start-up)
     "daemon.startup",
 };

@@ -5,15 +5,18 @@
 #include <fcntl.h>
 #include <limits.h>
 #include <linux/fs.h>
+#include <linux/openat2.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/acl.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/sysmacros.h>
 #include <sys/xattr.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
 #include <cstdio>
 #include <unordered_set>
@@ -296,6 +299,124 @@ int FsFsyncDirectoryOf(const std::string& path) {
 
 int FsOpenParent(const std::string& path, FsFd* parent, std::string* name) {
     return openParent(path, parent, name);
+}
+
+// ---- Client-named paths below a directory held open ----
+
+namespace {
+
+std::atomic<bool> gForceComponentWalk{false};
+// Set once openat2(2) has answered ENOSYS: the kernel will not grow it.
+std::atomic<bool> gNoOpenat2{false};
+
+constexpr int kBeneathOpenFlags = O_RDONLY | O_DIRECTORY | O_CLOEXEC;
+
+// The components of a client's relative path that name something: empty and
+// "." ones dropped. EXDEV for what would leave the starting directory.
+int beneathComponents(const std::string& relativePath, std::vector<std::string>* out) {
+    if (!relativePath.empty() && relativePath[0] == '/') return EXDEV;
+    size_t start = 0;
+    while (start <= relativePath.size()) {
+        size_t slash = relativePath.find('/', start);
+        if (slash == std::string::npos) slash = relativePath.size();
+        std::string component = relativePath.substr(start, slash - start);
+        if (component == "..") return EXDEV;
+        if (!component.empty() && component != ".") out->push_back(std::move(component));
+        start = slash + 1;
+    }
+    return 0;
+}
+
+// 1: opened; 0: the kernel has no openat2(2); otherwise -errno.
+int openBeneathWithOpenat2(int dirFd, const std::string& relativePath, FsFd* out) {
+#ifdef SYS_openat2
+    if (gNoOpenat2.load(std::memory_order_relaxed)) return 0;
+    struct open_how how = {};
+    how.flags = kBeneathOpenFlags;
+    how.resolve = RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS;
+    const char* path = relativePath.empty() ? "." : relativePath.c_str();
+    // EAGAIN: a rename elsewhere on the file system raced the lookup; the
+    // kernel asks for a retry rather than risk a wrong answer.
+    long fd = -1;
+    for (int attempt = 0; attempt < 16; ++attempt) {
+        fd = noEintr([&] { return ::syscall(SYS_openat2, dirFd, path, &how, sizeof how); });
+        if (fd >= 0 || errno != EAGAIN) break;
+    }
+    if (fd >= 0) {
+        *out = FsFd(static_cast<int>(fd));
+        return 1;
+    }
+    if (errno == ENOSYS) {
+        gNoOpenat2.store(true, std::memory_order_relaxed);
+        return 0;
+    }
+    return -errnoOr(EIO);
+#else
+    (void)dirFd;
+    (void)relativePath;
+    (void)out;
+    return 0;
+#endif
+}
+
+}  // namespace
+
+int FsOpenDirectoryBeneath(int dirFd, const std::string& relativePath, FsFd* out) {
+    std::vector<std::string> components;
+    // Refused here for both ways alike: openat2 would answer EXDEV as well.
+    if (int err = beneathComponents(relativePath, &components)) return err;
+    if (!gForceComponentWalk.load(std::memory_order_relaxed)) {
+        const int opened = openBeneathWithOpenat2(dirFd, relativePath, out);
+        if (opened == 1) return 0;
+        if (opened < 0) return -opened;
+    }
+    int f = noEintr([&] { return ::openat(dirFd, ".", kBeneathOpenFlags); });
+    if (f < 0) return errnoOr(EIO);
+    FsFd current(f);
+    for (const std::string& component : components) {
+        f = noEintr([&] {
+            return ::openat(current.get(), component.c_str(), kBeneathOpenFlags | O_NOFOLLOW);
+        });
+        if (f < 0) {
+            int err = errnoOr(EIO);
+            // With O_DIRECTORY a link fails as ENOTDIR; it is answered as
+            // RESOLVE_NO_SYMLINKS answers it. The check is only for the
+            // answer: nothing was opened through the link either way.
+            struct stat s;
+            if (err == ENOTDIR &&
+                ::fstatat(current.get(), component.c_str(), &s, AT_SYMLINK_NOFOLLOW) == 0 &&
+                S_ISLNK(s.st_mode))
+                err = ELOOP;
+            return err;
+        }
+        current = FsFd(f);
+    }
+    *out = std::move(current);
+    return 0;
+}
+
+void FsTEST_forceComponentWalk(bool force) { gForceComponentWalk.store(force); }
+
+int FsRenameAt(int fromDirFd, const std::string& fromName, int toDirFd, const std::string& toName) {
+    return ::renameat(fromDirFd, fromName.c_str(), toDirFd, toName.c_str()) == 0 ? 0
+                                                                                   : errnoOr(EIO);
+}
+
+int FsMkdtempAt(int dirFd, const std::string& prefix, std::string* name) {
+    static constexpr char kLetters[] =
+        "abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ0123456789";
+    // As mkdtemp(3): a taken name is tried again with another suffix.
+    for (int attempt = 0; attempt < 100; ++attempt) {
+        std::string candidate = prefix;
+        for (int i = 0; i < 6; ++i)
+            candidate += kLetters[::arc4random_uniform(sizeof kLetters - 1)];
+        if (::mkdirat(dirFd, candidate.c_str(), 0700) == 0) {
+            *name = std::move(candidate);
+            return 0;
+        }
+        if (errno != EEXIST) return errnoOr(EIO);
+    }
+    return EEXIST;
 }
 
 int FsForEachNameAt(int dirFd, const std::function<void(std::string_view name)>& each) {
@@ -618,19 +739,37 @@ struct Walker {
 
 namespace {
 
-// The entry of a tree's root, addressed through its open parent without
-// following a link; fills `st` with what was found there.
-int rootEntry(const std::string& root, FsFd* parent, FsWalkEntry* e, struct stat* st) {
-    std::string name;
-    if (int err = openParent(root, parent, &name)) return err;
-    if (::fstatat(parent->get(), name.c_str(), st, AT_SYMLINK_NOFOLLOW) != 0) return errnoOr(EIO);
-    e->path = root;
+// The entry `name` of the open directory `parentFd` as a tree's root, not
+// followed when it is a link; fills `st` with what was found there.
+int rootEntryAt(int parentFd, std::string name, const std::string& path, FsWalkEntry* e,
+                struct stat* st) {
+    if (::fstatat(parentFd, name.c_str(), st, AT_SYMLINK_NOFOLLOW) != 0) return errnoOr(EIO);
+    e->path = path;
     e->level = 0;
-    e->parentFd = parent->get();
+    e->parentFd = parentFd;
     e->name = std::move(name);
     e->st = fromStat(*st);
     e->type = walkTypeOf(st->st_mode);
     return 0;
+}
+
+// The same for a root named by its path, through its open parent.
+int rootEntry(const std::string& root, FsFd* parent, FsWalkEntry* e, struct stat* st) {
+    std::string name;
+    if (int err = openParent(root, parent, &name)) return err;
+    return rootEntryAt(parent->get(), std::move(name), root, e, st);
+}
+
+int walkFrom(FsWalkEntry e, const struct stat& s,
+             const std::function<bool(const FsWalkEntry&)>& visit) {
+    Walker w{visit, s.st_dev};
+    if (e.type == FsWalkType::Directory) {
+        const int parentFd = e.parentFd;
+        w.directory(parentFd, std::move(e), s.st_dev);
+    } else if (!visit(e)) {
+        w.stopped = true;
+    }
+    return w.stopped ? ECANCELED : 0;
 }
 
 }  // namespace
@@ -640,12 +779,15 @@ int FsWalk(const std::string& root, const std::function<bool(const FsWalkEntry&)
     FsWalkEntry e;
     struct stat s;
     if (int err = rootEntry(root, &parent, &e, &s)) return err;
-    Walker w{visit, s.st_dev};
-    if (e.type == FsWalkType::Directory)
-        w.directory(parent.get(), std::move(e), s.st_dev);
-    else if (!visit(e))
-        w.stopped = true;
-    return w.stopped ? ECANCELED : 0;
+    return walkFrom(std::move(e), s, visit);
+}
+
+int FsWalkAt(int parentFd, const std::string& name, const std::string& path,
+             const std::function<bool(const FsWalkEntry&)>& visit) {
+    FsWalkEntry e;
+    struct stat s;
+    if (int err = rootEntryAt(parentFd, name, path, &e, &s)) return err;
+    return walkFrom(std::move(e), s, visit);
 }
 
 namespace {

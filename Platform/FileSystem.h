@@ -94,6 +94,28 @@ int FsFsyncDirectoryOf(const std::string& path);
 // named it) and gives the last component, for the *At calls below.
 int FsOpenParent(const std::string& path, FsFd* parent, std::string* name);
 
+// ---- Client-named paths below a directory held open ----
+//
+// A client names an item by a path relative to a directory the daemon opened
+// itself; these resolve it without ever leaving that directory or passing a
+// link, so that a link swapped in while a request runs cannot redirect it.
+
+// Opens the directory `relativePath` names below the open directory `dirFd`.
+// Empty and "." components are skipped (an empty path opens `dirFd` again).
+// EXDEV: the path is absolute or has a ".." component; ELOOP: a component is
+// a symbolic link; ENOENT / ENOTDIR as openat(2). Uses openat2(2) with
+// RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS where the kernel has it, otherwise a
+// walk opening one component at a time with O_NOFOLLOW; both answer alike.
+int FsOpenDirectoryBeneath(int dirFd, const std::string& relativePath, FsFd* out);
+// Tests: true makes FsOpenDirectoryBeneath take the component walk even
+// where openat2(2) exists.
+void FsTEST_forceComponentWalk(bool force);
+// renameat(2): both names are single components of the open directories.
+int FsRenameAt(int fromDirFd, const std::string& fromName, int toDirFd, const std::string& toName);
+// A new directory `prefix` + 6 random characters inside the open directory
+// `dirFd`, mode 0700 (as mkdtemp(3)); `name` receives its name.
+int FsMkdtempAt(int dirFd, const std::string& prefix, std::string* name);
+
 enum class FsEntryType : uint8_t { Unknown, Directory, File, Symlink, Other };
 struct FsDirEntry {
     std::string name;
@@ -168,6 +190,10 @@ struct FsWalkEntry {
 // directory or item is delivered as an Error entry. The root's failure to
 // open is the result.
 int FsWalk(const std::string& root, const std::function<bool(const FsWalkEntry&)>& visit);
+// The same from the entry `name` of the open directory `parentFd` (not
+// followed when it is a link); `path` names it in the entries' paths.
+int FsWalkAt(int parentFd, const std::string& name, const std::string& path,
+             const std::function<bool(const FsWalkEntry&)>& visit);
 
 // Children-first removal. For every item that cannot be removed `onError`
 // is called with the entry and errno and answers whether the item has been
