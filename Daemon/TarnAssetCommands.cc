@@ -32,10 +32,11 @@ TarnResult<TarnContainerIdentityRef> assetsContainerIdentity(
 void TarnHandleStageSharedContentCommand(const TarnRequestContext& context,
                                          const PlistValue& request, PlistValue& reply,
                                          TarnClientConnection* connection, uint64_t* error) {
-    (void)TarnReport(connection->stageSharedContentForIdentifier(
-                         stringForKey(request, "Identifier"), stringForKey(request, "SourcePath"),
-                         stringForKey(request, "DestPath")),
-                     error, kHandlerFallback);
+    TarnResult<FileURL> staged = connection->stageSharedContentForIdentifier(
+        stringForKey(request, "Identifier"), stringForKey(request, "SourcePath"),
+        stringForKey(request, "DestPath"));
+    if (!TarnReport(staged, error, kHandlerFallback)) return;
+    reply.set("ReplyPath", std::move(*staged));
 }
 
 void TarnHandleUserManagedAssetsPathCommand(const TarnRequestContext& context,

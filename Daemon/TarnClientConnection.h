@@ -191,9 +191,11 @@ class TarnClientConnection {
     // `relativePath` empty: the request's value was missing or not a string.
     TarnStatus deleteUserManagedAssetWithContainerIdentity(
         const TarnContainerIdentityRef& identity, const std::optional<std::string>& relativePath);
-    TarnStatus stageSharedContentForIdentifier(const std::optional<std::string>& identifier,
-                                               const std::optional<std::string>& sourceRelativePath,
-                                               const std::optional<std::string>& destRelativePath);
+    // Answers where the content now is: the destination's absolute path.
+    TarnResult<FileURL> stageSharedContentForIdentifier(
+        const std::optional<std::string>& identifier,
+        const std::optional<std::string>& sourceRelativePath,
+        const std::optional<std::string>& destRelativePath);
 
     // ---- Group look-ups and the retry test (TarnClientConnectionGroups.cc) ----
 

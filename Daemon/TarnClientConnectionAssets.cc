@@ -309,7 +309,7 @@ TarnStatus TarnClientConnection::deleteUserManagedAssetWithContainerIdentity(
 
 // ---- Shared content ----
 
-TarnStatus TarnClientConnection::stageSharedContentForIdentifier(
+TarnResult<FileURL> TarnClientConnection::stageSharedContentForIdentifier(
     const std::optional<std::string>& identifier,
     const std::optional<std::string>& sourceRelativePath,
     const std::optional<std::string>& destRelativePath) {
@@ -345,7 +345,7 @@ TarnStatus TarnClientConnection::stageSharedContentForIdentifier(
                              error);
     };
     return withWriteLockedContainer(
-        identity, notFound, [&](const TarnMetadataRef& container) -> TarnStatus {
+        identity, notFound, [&](const TarnMetadataRef& container) -> TarnResult<FileURL> {
             TarnFileManager& fm = fileManager();
             const FileURL& containerURL = container->url();
             const FileURL sourceURL = PathJoin(containerURL, *sourceRelativePath);
@@ -402,7 +402,7 @@ TarnStatus TarnClientConnection::stageSharedContentForIdentifier(
                                      "Failed move for %@ from %@ to: %@: %@", identifier, sourceURL,
                                      destURL, moved.error());
             }
-            return {};
+            return destURL;
         });
 }
 

@@ -335,6 +335,12 @@ TEST_F(SharedContentTest, AnEntitledMemberMovesContentInsideItsGroup) {
     FsStat st;
     ASSERT_EQ(0, FsLstat(group_ + "/shared/doc", &st));
     EXPECT_EQ(65534u, st.uid) << "standardised as shared content";
+    // The reply says where the content now is.
+    PlistValue moved =
+        send(member_, R"({"Command": 26, "Identifier": ")" + std::string(kGroup) +
+                          R"(", "SourcePath": "shared/doc", "DestPath": "shared/kept"})");
+    EXPECT_EQ(stringOf(moved, "ReplyPath"), group_ + "/shared/kept");
+    ASSERT_EQ(stage(member_, kGroup, "shared/kept", "shared/doc"), TarnSuccess);
 
     std::string outsider = addMember("outsider", "");
     EXPECT_EQ(stage(outsider, kGroup, "shared/doc", "doc"), TarnErrorNotEntitled);
