@@ -35,6 +35,16 @@ namespace tarn {
 
 namespace {
 
+// The assets operations' answer when the data container is not there.
+TarnErrorRef assetsContainerNotFound(const char* operation,
+                                     const TarnContainerIdentityRef& identity,
+                                     const TarnErrorRef& error) {
+    return TARN_ERROR_IN(operation, TarnErrorInvalidArgument, error,
+                         "Failed to create app data container for user managed assets path for "
+                         "%@: %@",
+                         identity, error);
+}
+
 constexpr const char* kLibraryDirName = "Library";
 constexpr const char* kAssetsDirNamePrefix = "com.ostrea.UserManagedAssets.";
 constexpr mode_t kAssetsDirMode = 0755;
@@ -149,11 +159,8 @@ TarnClientConnection::userManagedAssetsPathWithContainerIdentity(
                           "%@ trying to retrieve path for identifier: %@ without entitlement",
                           clientBundleIdentifier(), identity->identifier());
     }
-    auto notFound = [&](const TarnErrorRef& error) -> TarnErrorRef {
-        return TARN_ERROR_IN(operation, TarnErrorInvalidArgument, error,
-                             "Failed to create app data container for user managed assets path "
-                             "for %@: %@",
-                             identity, error);
+    auto notFound = [&](const TarnErrorRef& error) {
+        return assetsContainerNotFound(operation, identity, error);
     };
     return withWriteLockedContainer(
         identity, notFound, [&](const TarnMetadataRef& container) -> TarnResult<AssetsPath> {
@@ -241,11 +248,8 @@ TarnStatus TarnClientConnection::deleteUserManagedAssetWithContainerIdentity(
         return TARN_ERROR(TarnErrorInvalidArgument, nullptr,
                           "Can't act on invalid input: ID: %@, Path: %@", identity, relativePath);
     }
-    auto notFound = [&](const TarnErrorRef& error) -> TarnErrorRef {
-        return TARN_ERROR_IN(operation, TarnErrorInvalidArgument, error,
-                             "Failed to create app data container for user managed assets path "
-                             "for %@: %@",
-                             identity, error);
+    auto notFound = [&](const TarnErrorRef& error) {
+        return assetsContainerNotFound(operation, identity, error);
     };
     return withWriteLockedContainer(
         identity, notFound, [&](const TarnMetadataRef& container) -> TarnStatus {

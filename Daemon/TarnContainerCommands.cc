@@ -29,15 +29,6 @@ constexpr const char* kDecodingCategory = "conduit";
 // Shared-device mode: every request acts for the caller's own user.
 constexpr uint64_t kMultiUserSharedDeviceBit = 1ull << 31;
 
-std::string describe(const TarnUserIdentitySet& identities) {
-    std::string text = "(";
-    for (const auto& identity : identities) {
-        if (text.size() > 1) text += ", ";
-        text += identity ? identity->description() : std::string("(null)");
-    }
-    return text + ")";
-}
-
 TarnUserIdentityRef clientUserIdentity(const TarnClientConnection& connection) {
     const auto& client = connection.clientIdentity();
     return client ? client->userIdentity() : nullptr;
@@ -112,7 +103,8 @@ TarnResult<TarnUserIdentityRef> userIdentityForContainerIdentifier(
         PlatformLog(
             kDecodingCategory, PlatformLogType::Debug,
             "Chose bundleIdentifier: %@, userIdentities: %@ for identifier: %@, class: %llu",
-            bundleIdentifier, describe(candidates), identifier, containerClass);
+            bundleIdentifier, TarnUserIdentitySetDescription(candidates), identifier,
+            containerClass);
     }
 
     if (candidates.size() == 1) return *candidates.begin();
@@ -120,7 +112,8 @@ TarnResult<TarnUserIdentityRef> userIdentityForContainerIdentifier(
         if (candidates.count(own)) return own;
         PlatformLog(kDecodingCategory, PlatformLogType::Fault,
                     "Ambiguous user identity from [%@]. Expected one of [%@], got %@",
-                    connection.clientBundleIdentifier(), describe(candidates), own);
+                    connection.clientBundleIdentifier(), TarnUserIdentitySetDescription(candidates),
+                    own);
     } else {
         TarnLog(kLogError, __func__, "%@ trying to look up persona for %llu:%@",
                 connection.clientBundleIdentifier(), containerClass, identifier);

@@ -30,15 +30,6 @@ constexpr const char* kCategory = "conduit";
 // Any client may reach this system group: the platform's shared-device logging.
 constexpr const char* kSharedLoggingSystemGroup = "systemgroup.com.ostrea.sharedpclogging";
 
-std::string describe(const TarnUserIdentitySet& identities) {
-    std::string text = "(";
-    for (const auto& identity : identities) {
-        if (text.size() > 1) text += ", ";
-        text += identity ? identity->description() : std::string("(null)");
-    }
-    return text + ")";
-}
-
 PlistValue stringArray(const std::vector<std::string>& strings) {
     return PlistValue(PlistArray(strings.begin(), strings.end()));
 }
@@ -65,14 +56,15 @@ TarnResult<TarnUserIdentityRef> groupOwnerUserIdentity(TarnClientConnection& con
     PlatformLog(kCategory, PlatformLogType::Debug,
                 "Chose bundleIdentifier: %@ for group container lookup, userIdentities: %@ for "
                 "identifier: %@",
-                bundleIdentifier, describe(candidates), identifier);
+                bundleIdentifier, TarnUserIdentitySetDescription(candidates), identifier);
 
     if (candidates.size() == 1) return *candidates.begin();
     if (candidates.size() > 1) {
         if (own && candidates.count(own)) return own;
         PlatformLog(kCategory, PlatformLogType::Fault,
                     "Ambiguous user identity from [%@]. Expected one of [%@], got %@",
-                    connection.clientBundleIdentifier(), describe(candidates), own);
+                    connection.clientBundleIdentifier(), TarnUserIdentitySetDescription(candidates),
+                    own);
     } else {
         TarnLog(kLogError, "createOrLookupGroupContainers",
                 "%@ trying to look up persona for group owner %@",

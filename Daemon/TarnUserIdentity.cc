@@ -237,4 +237,13 @@ std::string TarnUserIdentity::description() const {
         posixGID_, kernelPersonaID_, personaUniqueString_, homeDirectoryURL_);
 }
 
+std::string TarnUserIdentitySetDescription(const TarnUserIdentitySet& identities) {
+    std::string text = "(";
+    for (const auto& identity : identities) {
+        if (text.size() > 1) text += ", ";
+        text += identity ? identity->description() : std::string("(null)");
+    }
+    return text + ")";
+}
+
 }  // namespace tarn

@@ -145,6 +145,8 @@ private:
 // Unordered containers of identities, by identifier equality.
 using TarnUserIdentitySet = std::unordered_set<TarnUserIdentityRef, TarnRefHash<TarnUserIdentity>,
                                                TarnRefEqual<TarnUserIdentity>>;
+// "(a, b)" with each identity's description, "(null)" for an empty slot.
+std::string TarnUserIdentitySetDescription(const TarnUserIdentitySet& identities);
 template <class V>
 using TarnUserIdentityMap = std::unordered_map<TarnUserIdentityRef, V, TarnRefHash<TarnUserIdentity>,
                                                TarnRefEqual<TarnUserIdentity>>;

@@ -22,6 +22,7 @@
 #include "Platform/FileSystem.h"
 #include "Tools/tarnctl/Json.h"
 #include "support/DaemonHarness.h"
+#include "support/IpcTest.h"
 
 namespace tarn {
 namespace {
@@ -50,33 +51,15 @@ struct Canary {
     }
 };
 
-class AssetCommandsTest : public test::ScratchRootTest {
+class AssetCommandsTest : public test::IpcTest {
   protected:
     void SetUp() override {
-        TARN_REQUIRE_DAEMON_BINARIES();
-        TARN_REQUIRE_ROOT();
-        daemon_ = std::make_unique<DaemonHarness>(root_);
-        admin_ = daemon_->addPrivilegedClient();
+        IpcTest::SetUp();
+        if (IsSkipped()) return;
         root_.writeFile("/private/var/canary/file", "canary");
         ::chmod(root_.at("/private/var/canary/file").c_str(), 0600);
     }
 
-    PlistValue send(const std::string& client, const std::string& json) {
-        auto reply = daemon_->send(client, json);
-        EXPECT_TRUE(reply) << json << ": " << daemon_->lastResult().err;
-        return reply ? *reply : PlistValue(PlistDict{});
-    }
-    uint64_t ask(const std::string& client, const std::string& json) {
-        return errorOf(send(client, json));
-    }
-    static uint64_t errorOf(const PlistValue& reply) {
-        const PlistValue* e = reply.find("ReplyError");
-        return e ? e->asUInt64().value_or(0) : 0;
-    }
-    static std::string stringOf(const PlistValue& reply, const char* key) {
-        const PlistValue* v = reply.find(key);
-        return v && v->asString() ? *v->asString() : std::string();
-    }
     static std::optional<bool> boolOf(const PlistValue& reply, const char* key) {
         const PlistValue* v = reply.find(key);
         return v ? v->asBool() : std::nullopt;
@@ -165,9 +148,6 @@ class AssetCommandsTest : public test::ScratchRootTest {
             if (it.depth() == 1) items.push_back(it->path().filename());
         return items;
     }
-
-    std::unique_ptr<DaemonHarness> daemon_;
-    std::string admin_;
 };
 
 TEST_F(AssetCommandsTest, TheAssetsDirectoryIsMadeOnceAndFoundAfterwards) {

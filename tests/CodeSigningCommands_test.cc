@@ -13,6 +13,7 @@
 #include "Platform/Failpoints.h"
 #include "Tools/tarnctl/Json.h"
 #include "support/DaemonHarness.h"
+#include "support/IpcTest.h"
 
 namespace tarn {
 namespace {
@@ -20,26 +21,10 @@ namespace {
 namespace fs = std::filesystem;
 using test::DaemonHarness;
 
-class CodeSigningCommandsTest : public test::ScratchRootTest {
+class CodeSigningCommandsTest : public test::IpcTest {
   protected:
-    void SetUp() override {
-        TARN_REQUIRE_DAEMON_BINARIES();
-        TARN_REQUIRE_ROOT();
-        daemon_ = std::make_unique<DaemonHarness>(root_);
-        admin_ = daemon_->addPrivilegedClient();
-    }
-
-    PlistValue send(const std::string& client, const std::string& json) {
-        auto reply = daemon_->send(client, json);
-        EXPECT_TRUE(reply) << json << ": " << daemon_->lastResult().err;
-        return reply ? *reply : PlistValue(PlistDict{});
-    }
     // Sends as the installer (admin) and answers the reply's code.
     uint64_t ask(const std::string& json) { return errorOf(send(admin_, json)); }
-    static uint64_t errorOf(const PlistValue& reply) {
-        const PlistValue* e = reply.find("ReplyError");
-        return e ? e->asUInt64().value_or(0) : 0;
-    }
 
     // Command 18 for `identifier` with these entitlements (JSON object text)
     // and options (JSON members, without braces).
@@ -78,9 +63,6 @@ class CodeSigningCommandsTest : public test::ScratchRootTest {
     size_t storeWritesFor(const std::string& identifier) {
         return countInLog("Set Code Signing Mapping for ID: " + identifier + " ");
     }
-
-    std::unique_ptr<DaemonHarness> daemon_;
-    std::string admin_;
 };
 
 TEST_F(CodeSigningCommandsTest, AGroupGoesWithItsLastReferenceAndNotBefore) {

@@ -11,6 +11,7 @@
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Tools/tarnctl/Json.h"
 #include "support/DaemonHarness.h"
+#include "support/IpcTest.h"
 
 namespace tarn {
 namespace {
@@ -21,15 +22,8 @@ using test::DaemonHarness;
 constexpr const char* kPersonal = "PERSONAL-0000";
 constexpr const char* kEnterprise = "ENTERPRISE-0001";
 
-class ContainerCommandsTest : public test::ScratchRootTest {
+class ContainerCommandsTest : public test::IpcTest {
   protected:
-    void SetUp() override {
-        TARN_REQUIRE_DAEMON_BINARIES();
-        TARN_REQUIRE_ROOT();
-        daemon_ = std::make_unique<DaemonHarness>(root_);
-        admin_ = daemon_->addPrivilegedClient();
-    }
-
     // One personal and one enterprise persona; the enterprise persona lists
     // com.ostrea.test.ent.
     void enablePersonas() {
@@ -51,19 +45,6 @@ class ContainerCommandsTest : public test::ScratchRootTest {
         root_.writeFile("/etc/tarnkeeper/personas.plist", std::string(bytes.begin(), bytes.end()));
     }
 
-    PlistValue send(const std::string& client, const std::string& json) {
-        auto reply = daemon_->send(client, json);
-        EXPECT_TRUE(reply) << json << ": " << daemon_->lastResult().err;
-        return reply ? *reply : PlistValue(PlistDict{});
-    }
-    static uint64_t errorOf(const PlistValue& reply) {
-        const PlistValue* e = reply.find("ReplyError");
-        return e ? e->asUInt64().value_or(0) : 0;
-    }
-    static std::string stringOf(const PlistValue& reply, const char* key) {
-        const PlistValue* v = reply.find(key);
-        return v && v->asString() ? *v->asString() : std::string();
-    }
     static std::string uuidOf(const PlistValue& reply) {
         const PlistValue* v = reply.find("ReplyUUID");
         return v && v->asUuid() ? v->asUuid()->string() : std::string();
@@ -83,9 +64,6 @@ class ContainerCommandsTest : public test::ScratchRootTest {
             ++n;
         return n;
     }
-
-    std::unique_ptr<DaemonHarness> daemon_;
-    std::string admin_;
 };
 
 TEST_F(ContainerCommandsTest, CreateLookUpAndRefuseBadIdentities) {

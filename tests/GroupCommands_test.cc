@@ -13,6 +13,7 @@
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnFileManager.h"
 #include "support/DaemonHarness.h"
+#include "support/IpcTest.h"
 
 namespace tarn {
 namespace {
@@ -24,15 +25,8 @@ constexpr const char* kPersonal = "PERSONAL-0000";
 constexpr const char* kEnterprise = "ENTERPRISE-0001";
 constexpr const char* kSecondEnterprise = "ENTERPRISE-0002";
 
-class GroupCommandsTest : public test::ScratchRootTest {
+class GroupCommandsTest : public test::IpcTest {
   protected:
-    void SetUp() override {
-        TARN_REQUIRE_DAEMON_BINARIES();
-        TARN_REQUIRE_ROOT();
-        daemon_ = std::make_unique<DaemonHarness>(root_);
-        admin_ = daemon_->addPrivilegedClient();
-    }
-
     // A personal persona and two enterprise ones: com.ostrea.test.ent belongs
     // to the first, com.ostrea.test.both to both.
     void enablePersonas() {
@@ -68,19 +62,6 @@ class GroupCommandsTest : public test::ScratchRootTest {
         return daemon_->addClient(name, identifier, PlistValue(PlistDict{}), sandboxed, persona);
     }
 
-    PlistValue send(const std::string& client, const std::string& json) {
-        auto reply = daemon_->send(client, json);
-        EXPECT_TRUE(reply) << json << ": " << daemon_->lastResult().err;
-        return reply ? *reply : PlistValue(PlistDict{});
-    }
-    static uint64_t errorOf(const PlistValue& reply) {
-        const PlistValue* e = reply.find("ReplyError");
-        return e ? e->asUInt64().value_or(0) : 0;
-    }
-    static std::string stringOf(const PlistValue& value, const std::string& key) {
-        const PlistValue* v = value.find(key);
-        return v && v->asString() ? *v->asString() : std::string();
-    }
     // The string members of a reply dictionary, by key; empty when absent.
     static std::map<std::string, std::string> stringDict(const PlistValue& reply, const char* key) {
         std::map<std::string, std::string> out;
@@ -116,9 +97,6 @@ class GroupCommandsTest : public test::ScratchRootTest {
         if (path) *path = stringOf(reply, "ReplyPath");
         return errorOf(reply);
     }
-
-    std::unique_ptr<DaemonHarness> daemon_;
-    std::string admin_;
 };
 
 TEST_F(GroupCommandsTest, SystemGroupPathIsForTheEntitledTheWellKnownAndSharedLogging) {
