@@ -24,25 +24,10 @@ constexpr const char* kEnterprise = "ENTERPRISE-0001";
 
 class ContainerCommandsTest : public test::IpcTest {
   protected:
-    // One personal and one enterprise persona; the enterprise persona lists
-    // com.ostrea.test.ent.
+    // One enterprise persona, listing com.ostrea.test.ent.
     void enablePersonas() {
-        PlistValue host{PlistDict{}};
-        host.set("InternalBuild", true);
-        host.set("DeviceSupportsPersonas", true);
-        daemon_->writeHostConfig(host);
-        PlistValue personal{PlistDict{}};
-        personal.set("Type", "personal");
-        personal.set("UniqueString", kPersonal);
-        personal.set("PersonaID", uint64_t{1000});
-        PlistValue enterprise{PlistDict{}};
-        enterprise.set("Type", "enterprise");
-        enterprise.set("UniqueString", kEnterprise);
-        enterprise.set("PersonaID", uint64_t{1001});
-        enterprise.set("LayoutPath", "/private/var/personas/enterprise");
-        enterprise.set("BundleIDs", PlistArray{PlistValue("com.ostrea.test.ent")});
-        auto bytes = PlistValue(PlistArray{personal, enterprise}).toBinary();
-        root_.writeFile("/etc/tarnkeeper/personas.plist", std::string(bytes.begin(), bytes.end()));
+        IpcTest::enablePersonas(
+            {{kEnterprise, 1001, "/private/var/personas/enterprise", {"com.ostrea.test.ent"}}});
     }
 
     static std::string uuidOf(const PlistValue& reply) {

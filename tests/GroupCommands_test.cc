@@ -27,33 +27,15 @@ constexpr const char* kSecondEnterprise = "ENTERPRISE-0002";
 
 class GroupCommandsTest : public test::IpcTest {
   protected:
-    // A personal persona and two enterprise ones: com.ostrea.test.ent belongs
-    // to the first, com.ostrea.test.both to both.
+    // Two enterprise personas: com.ostrea.test.ent belongs to the first,
+    // com.ostrea.test.both to both.
     void enablePersonas() {
-        PlistValue host{PlistDict{}};
-        host.set("InternalBuild", true);
-        host.set("DeviceSupportsPersonas", true);
-        daemon_->writeHostConfig(host);
-        PlistValue personal{PlistDict{}};
-        personal.set("Type", "personal");
-        personal.set("UniqueString", kPersonal);
-        personal.set("PersonaID", uint64_t{1000});
-        auto enterprise = [](const char* unique, uint64_t id, const char* layout, PlistArray apps) {
-            PlistValue p{PlistDict{}};
-            p.set("Type", "enterprise");
-            p.set("UniqueString", unique);
-            p.set("PersonaID", id);
-            p.set("LayoutPath", layout);
-            p.set("BundleIDs", std::move(apps));
-            return p;
-        };
-        PlistValue first = enterprise(
-            kEnterprise, 1001, "/private/var/personas/enterprise",
-            PlistArray{PlistValue("com.ostrea.test.ent"), PlistValue("com.ostrea.test.both")});
-        PlistValue second = enterprise(kSecondEnterprise, 1002, "/private/var/personas/second",
-                                       PlistArray{PlistValue("com.ostrea.test.both")});
-        auto bytes = PlistValue(PlistArray{personal, first, second}).toBinary();
-        root_.writeFile("/etc/tarnkeeper/personas.plist", std::string(bytes.begin(), bytes.end()));
+        IpcTest::enablePersonas(
+            {{kEnterprise,
+              1001,
+              "/private/var/personas/enterprise",
+              {"com.ostrea.test.ent", "com.ostrea.test.both"}},
+             {kSecondEnterprise, 1002, "/private/var/personas/second", {"com.ostrea.test.both"}}});
     }
 
     std::string addClient(const std::string& name, const std::string& identifier,

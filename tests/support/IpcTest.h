@@ -8,6 +8,7 @@
 #include <cstdint>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "Platform/PropertyList.h"
 #include "support/DaemonHarness.h"
@@ -30,6 +31,16 @@ class IpcTest : public ScratchRootTest {
     static uint64_t errorOf(const PlistValue& reply);
     // The string under `key`, or "" when missing or not a string.
     static std::string stringOf(const PlistValue& reply, const std::string& key);
+
+    // Personas on (host configuration, internal build): one personal persona,
+    // "PERSONAL-0000" (id 1000), and these enterprise ones.
+    struct EnterprisePersona {
+        std::string uniqueString;
+        uint64_t personaID;
+        std::string layoutPath;
+        std::vector<std::string> bundleIdentifiers;
+    };
+    void enablePersonas(const std::vector<EnterprisePersona>& enterprise);
 
     std::unique_ptr<DaemonHarness> daemon_;
     std::string admin_;
