@@ -1,6 +1,8 @@
-// Throws link layouts and relative paths at the child test and checks the
-// one property that matters: every path it accepts lies inside the base once
-// everything that exists of it is resolved.
+// Throws link layouts and relative paths at the two ways the daemon keeps a
+// client's path inside a directory, and checks the one property that
+// matters: the child test accepts only paths that lie inside the base once
+// everything that exists of them is resolved, and the descriptor-relative
+// resolution hands back only a directory inside the base and a plain name.
 //
 // Input: lines of a small layout language, all names relative to a work
 // directory W that holds the base W/base and a sibling W/out:
@@ -61,6 +63,25 @@ std::string resolveWhatExists(const std::string& path) {
     return "";
 }
 
+// The descriptor-relative resolution: whatever it accepts names one entry
+// directly inside a directory that is itself inside the base.
+void checkBelow(const std::string& base, const std::string& baseReal, const std::string& relative) {
+    auto& fm = tarn::TarnFileManager::defaultManager();
+    tarn::FsFd baseFd;
+    if (fm.openDirectoryAtURL(base, &baseFd) != 0) std::abort();
+    auto item = fm.itemBelowDirectory(baseFd, relative);
+    if (!item.ok()) return;
+    std::error_code ec;
+    const std::string directory =
+        stdfs::read_symlink("/proc/self/fd/" + std::to_string(item->directory.get()), ec).string();
+    if (ec || !insideOf(directory, baseReal) || item->name.empty() ||
+        item->name.find('/') != std::string::npos || item->name == "." || item->name == "..") {
+        std::fprintf(stderr, "resolved %s to %s / %s outside %s\n", relative.c_str(),
+                     directory.c_str(), item->name.c_str(), baseReal.c_str());
+        std::abort();
+    }
+}
+
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
@@ -112,9 +133,10 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (suspicious.find('\0') != std::string::npos || suspicious.size() > 512) return 0;
 
     std::string base = w + "/base";
+    std::string baseReal = stdfs::canonical(base).string();
+    checkBelow(base, baseReal, suspicious);
     auto accepted = tarn::TarnFileManager::defaultManager().realPathForURL(tarn::PathJoin(base, suspicious), base);
     if (!accepted) return 0;
-    std::string baseReal = stdfs::canonical(base).string();
     std::string resolved = resolveWhatExists(*accepted);
     if (resolved.empty() || !insideOf(resolved, baseReal) || !insideOf(*accepted, baseReal)) {
         std::fprintf(stderr, "accepted %s -> %s (resolves to %s) outside %s\n", suspicious.c_str(),
