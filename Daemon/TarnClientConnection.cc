@@ -171,6 +171,21 @@ TarnStatus TarnClientConnection::_passesGroupOwnerRuleForContainerClass(
 TarnStatus TarnClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, bool isDir,
                                                           bool startDeletionThread) {
     auto& fm = TarnFileManager::defaultManager();
+    const bool moved = TARN_TRY(_moveIntoDeathRowSlot(
+        url,
+        [&](const FileURL& slot) {
+            return fm.moveItemAtURL(url, PathJoin(slot, PathLastComponent(url)));
+        },
+        [&] { return fm.itemDoesNotExistAtURL(url); }));
+    // Something already gone leaves nothing for a pass to do.
+    if (moved && startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
+    return {};
+}
+
+TarnResult<bool> TarnClientConnection::_moveIntoDeathRowSlot(
+    const FileURL& url, const std::function<TarnStatus(const FileURL&)>& moveInto,
+    const std::function<bool()>& gone) {
+    auto& fm = TarnFileManager::defaultManager();
     // A deletion pass running meanwhile may remove the still empty slot before
     // the rename lands; the item is then still here and needs a new slot.
     constexpr int kAttempts = 3;
@@ -182,19 +197,17 @@ TarnStatus TarnClientConnection::_moveItemAtURLToDeathRow(const FileURL& url, bo
             return TARN_ERROR(TarnErrorDeathRowMoveFailed, unique.error(),
                               "Failed to create unique directory at: %@", url);
         }
-        const FileURL destination = PathJoin(*unique, PathLastComponent(url));
-        const TarnStatus moved = fm.moveItemAtURL(url, destination);
-        if (moved.ok()) break;
+        const TarnStatus moved = moveInto(*unique);
+        if (moved.ok()) return true;
         if (moved.error() && moved.error()->posixCode() == ENOENT) {
             // Already gone; the empty slot goes with the next pass.
-            if (fm.itemDoesNotExistAtURL(url)) return {};
+            if (gone()) return false;
             if (attempt < kAttempts) continue;
         }
         return TARN_ERROR(TarnErrorDeathRowMoveFailed, moved.error(),
-                          "Failed to move item at: %@ to: %@", url, destination);
+                          "Failed to move item at: %@ to: %@", url,
+                          PathJoin(*unique, PathLastComponent(url)));
     }
-    if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
-    return {};
 }
 
 void TarnClientConnection::deleteContainersOnDeathRowWithCompletion(

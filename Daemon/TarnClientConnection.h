@@ -126,6 +126,14 @@ class TarnClientConnection {
     // Renames the item into a new unique directory on death row; a missing
     // item succeeds without starting a pass. Fails with TarnErrorDeathRowMoveFailed.
     TarnStatus _moveItemAtURLToDeathRow(const FileURL& url, bool isDir, bool startDeletionThread);
+    // The slot loop behind every move to death row: makes a unique directory
+    // there and hands it to `moveInto`. ENOENT from it means the item left by
+    // itself (`gone()`: success) or a pass removed the empty slot first
+    // (another slot, up to three). Answers whether it moved the item (false:
+    // it was gone). `url` names the item in the failure lines.
+    static TarnResult<bool> _moveIntoDeathRowSlot(
+        const FileURL& url, const std::function<TarnStatus(const FileURL&)>& moveInto,
+        const std::function<bool()>& gone);
     // Queues a deletion pass and returns at once; `completion` (may be empty)
     // gets TarnSuccess, or the code of the pass's last failure
     // (TarnErrorDestroyFailed or TarnErrorDeleteFailed), on the death-row queue.

@@ -48,9 +48,6 @@ TarnErrorRef assetsContainerNotFound(const char* operation,
 constexpr const char* kLibraryDirName = "Library";
 constexpr const char* kAssetsDirNamePrefix = "com.ostrea.UserManagedAssets.";
 constexpr mode_t kAssetsDirMode = 0755;
-// Attempts at a death-row slot: a deletion pass may remove an empty slot
-// before the rename into it lands.
-constexpr int kDeathRowAttempts = 3;
 
 using ItemInDirectory = TarnFileManager::ItemInDirectory;
 
@@ -113,31 +110,20 @@ auto withWriteLockedContainer(const TarnContainerIdentityRef& identity, NotFound
 // names the item in messages.
 TarnStatus moveItemToDeathRow(const ItemInDirectory& item, const FileURL& url) {
     TarnFileManager& fm = fileManager();
-    const FileURL deathRow = TarnGlobalConfiguration::sharedInstance().deathrowDirectory();
-    for (int attempt = 1;; ++attempt) {
-        TarnResult<FileURL> slot = fm.createTemporaryDirectoryInDirectoryURL(deathRow);
-        if (!slot.ok()) {
-            return TARN_ERROR(TarnErrorDeathRowMoveFailed, slot.error(),
-                              "Failed to create unique directory at: %@", url);
-        }
-        const FileURL destination = PathJoin(*slot, item.name);
-        FsFd slotDirectory;
-        TarnStatus moved;
-        if (int err = fm.openDirectoryAtURL(*slot, &slotDirectory)) {
-            moved = TARN_POSIX_ERROR(err, "opendir of %@ failed: %s", *slot, FsErrorText(err));
-        } else {
-            moved = fm.renameItemInDirectory(item.directory, item.name, slotDirectory, item.name);
-        }
-        if (moved.ok()) return {};
-        if (posixCodeOf(moved.error()) == ENOENT) {
-            // Either the item is gone (done) or the slot went with a pass.
+    TarnResult<bool> moved = TarnClientConnection::_moveIntoDeathRowSlot(
+        url,
+        [&](const FileURL& slot) -> TarnStatus {
+            FsFd slotDirectory;
+            if (int err = fm.openDirectoryAtURL(slot, &slotDirectory))
+                return TARN_POSIX_ERROR(err, "opendir of %@ failed: %s", slot, FsErrorText(err));
+            return fm.renameItemInDirectory(item.directory, item.name, slotDirectory, item.name);
+        },
+        [&] {
             TarnResult<ItemInDirectory> still = fm.itemBelowDirectory(item.directory, item.name);
-            if (still.ok() && !still->stat) return {};
-            if (attempt < kDeathRowAttempts) continue;
-        }
-        return TARN_ERROR(TarnErrorDeathRowMoveFailed, moved.error(),
-                          "Failed to move item at: %@ to: %@", url, destination);
-    }
+            return still.ok() && !still->stat;
+        });
+    if (!moved.ok()) return moved.error();
+    return {};
 }
 
 }  // namespace
