@@ -29,11 +29,6 @@ constexpr const char* kDecodingCategory = "conduit";
 // Shared-device mode: every request acts for the caller's own user.
 constexpr uint64_t kMultiUserSharedDeviceBit = 1ull << 31;
 
-TarnUserIdentityRef clientUserIdentity(const TarnClientConnection& connection) {
-    const auto& client = connection.clientIdentity();
-    return client ? client->userIdentity() : nullptr;
-}
-
 const PlistArray* arrayForKey(const PlistValue& request, std::string_view key) {
     const PlistValue* value = request.find(key);
     return value ? value->asArray() : nullptr;
@@ -107,16 +102,31 @@ TarnResult<TarnUserIdentityRef> userIdentityForContainerIdentifier(
             containerClass);
     }
 
+    return soleUserIdentity(connection, candidates, own, [&] {
+        TarnLog(kLogError, "userIdentityForContainerIdentifier",
+                "%@ trying to look up persona for %llu:%@", connection.clientBundleIdentifier(),
+                containerClass, identifier);
+    });
+}
+
+TarnUserIdentityRef clientUserIdentity(const TarnClientConnection& connection) {
+    const auto& client = connection.clientIdentity();
+    return client ? client->userIdentity() : nullptr;
+}
+
+TarnResult<TarnUserIdentityRef> soleUserIdentity(const TarnClientConnection& connection,
+                                                 const TarnUserIdentitySet& candidates,
+                                                 const TarnUserIdentityRef& own,
+                                                 const std::function<void()>& logNone) {
     if (candidates.size() == 1) return *candidates.begin();
     if (candidates.size() > 1) {
-        if (candidates.count(own)) return own;
+        if (own && candidates.count(own)) return own;
         PlatformLog(kDecodingCategory, PlatformLogType::Fault,
                     "Ambiguous user identity from [%@]. Expected one of [%@], got %@",
                     connection.clientBundleIdentifier(), TarnUserIdentitySetDescription(candidates),
                     own);
     } else {
-        TarnLog(kLogError, __func__, "%@ trying to look up persona for %llu:%@",
-                connection.clientBundleIdentifier(), containerClass, identifier);
+        logNone();
     }
     return TARN_ERROR_CODE(TarnErrorPersonaMismatch, nullptr);
 }

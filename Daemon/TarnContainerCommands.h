@@ -11,6 +11,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -49,6 +50,17 @@ std::optional<std::string> identifierWithDefault(const PlistValue& request,
 // class is mapped to the one persona the application belongs to (plug-in data
 // follows its parent application). TarnErrorPersonaMismatch when no single
 // identity fits.
+// The caller's user identity, or null for a caller without an identity.
+TarnUserIdentityRef clientUserIdentity(const TarnClientConnection& connection);
+// The last step of choosing a persona for a caller without a specific one:
+// the single candidate, or the caller's own among several (else the
+// "Ambiguous user identity" fault); TarnErrorPersonaMismatch otherwise.
+// `logNone` writes the line for an empty set, which differs by command.
+TarnResult<TarnUserIdentityRef> soleUserIdentity(const TarnClientConnection& connection,
+                                                 const TarnUserIdentitySet& candidates,
+                                                 const TarnUserIdentityRef& own,
+                                                 const std::function<void()>& logNone);
+
 TarnResult<TarnUserIdentityRef> userIdentityForContainerIdentifier(
     const TarnClientConnection& connection, const std::optional<std::string>& identifier,
     TarnContainerClass containerClass);

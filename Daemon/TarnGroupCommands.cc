@@ -34,11 +34,6 @@ PlistValue stringArray(const std::vector<std::string>& strings) {
     return PlistValue(PlistArray(strings.begin(), strings.end()));
 }
 
-TarnUserIdentityRef clientUserIdentity(const TarnClientConnection& connection) {
-    const TarnClientIdentityRef& client = connection.clientIdentity();
-    return client ? client->userIdentity() : nullptr;
-}
-
 // The user identity whose group containers command 13 answers with. A
 // caller without a specific persona gets the persona the owning application
 // (a plug-in's parent) belongs to, which must be one.
@@ -58,19 +53,11 @@ TarnResult<TarnUserIdentityRef> groupOwnerUserIdentity(TarnClientConnection& con
                 "identifier: %@",
                 bundleIdentifier, TarnUserIdentitySetDescription(candidates), identifier);
 
-    if (candidates.size() == 1) return *candidates.begin();
-    if (candidates.size() > 1) {
-        if (own && candidates.count(own)) return own;
-        PlatformLog(kCategory, PlatformLogType::Fault,
-                    "Ambiguous user identity from [%@]. Expected one of [%@], got %@",
-                    connection.clientBundleIdentifier(), TarnUserIdentitySetDescription(candidates),
-                    own);
-    } else {
+    return soleUserIdentity(connection, candidates, own, [&] {
         TarnLog(kLogError, "createOrLookupGroupContainers",
                 "%@ trying to look up persona for group owner %@",
                 connection.clientBundleIdentifier(), identifier);
-    }
-    return TARN_ERROR_CODE(TarnErrorPersonaMismatch, nullptr);
+    });
 }
 
 // Every group operation names its owner; a request whose "Identifier" is not
