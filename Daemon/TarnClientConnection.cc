@@ -593,17 +593,6 @@ bool TarnClientConnection::completeWithError(uint64_t* error) {
                       TarnErrorInvalidArgument);
 }
 
-// Boot set-up and clean-up steps arrive with the boot maintenance work; start-up
-// already calls them in order so that the sequence and its notifications hold.
-void TarnClientConnection::rebootKeeperSetup() {}
-void TarnClientConnection::keeperSetup() {}
-void TarnClientConnection::rebootKeeperCleanupWithCompletion(std::function<void()> completion) {
-    transactionAsync(_sharedBackgroundQueue(), std::move(completion));
-}
-void TarnClientConnection::keeperCleanupWithCompletion(std::function<void()> completion) {
-    transactionAsync(_sharedBackgroundQueue(), std::move(completion));
-}
-
 DispatchQueueRef TarnClientConnection::_sharedBackgroundQueue() {
     static DispatchQueueRef q = DispatchQueue::createSerial("com.ostrea.tarnkeeperd.background",
                                                             DispatchQueue::global(QoS::Background));

@@ -228,11 +228,17 @@ class TarnClientConnection {
     // failing command's code goes into the request's error slot.
     bool completeWithError(uint64_t* error);
 
-    // Boot work run by start-up on the shared connection.
+    // ---- Boot work run by start-up on the shared connection
+    //      (TarnClientConnectionBoot.cc) ----
     void rebootKeeperSetup();
     void keeperSetup();
     void rebootKeeperCleanupWithCompletion(std::function<void()> completion);
     void keeperCleanupWithCompletion(std::function<void()> completion);
+
+    // ---- Replacement and its recovery (TarnClientConnectionReplace.cc) ----
+
+    // Finishes or rolls back every replacement a previous run left behind.
+    TarnStatus _recoverFromReplaceOperationsWithError();
 
     static DispatchQueueRef _sharedBackgroundQueue();
 

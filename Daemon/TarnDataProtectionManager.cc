@@ -55,3 +55,17 @@ int32_t TarnDataProtectionManager::intendedDataProtectionClassBasedOnEntitlement
 }
 
 }  // namespace tarn
+
+namespace tarn {
+
+void TarnDataProtectionManager::setDataProtectionOnDataContainerForContainerIdentity(
+    const TarnContainerIdentityRef& identity, int32_t dataProtectionClass,
+    bool isSecondOrThirdPartyApp, bool retryIfLocked, std::function<void(uint64_t)> completion) {
+    if (completion) completion(TarnErrorInvalidCommand);
+}
+
+TarnStatus TarnDataProtectionManager::restartPendingDataProtectionOperationsWithError() {
+    return {};
+}
+
+}  // namespace tarn

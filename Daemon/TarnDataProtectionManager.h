@@ -10,8 +10,11 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <string>
 
+#include "Daemon/TarnContainerIdentity.h"
+#include "Daemon/TarnResult.h"
 #include "Platform/PropertyList.h"
 
 namespace tarn {
@@ -48,6 +51,17 @@ class TarnDataProtectionManager {
     static int32_t dataProtectionClassForEntitlementValue(const std::string& value);
     // The first of the three entitlements that holds a string, mapped.
     static int32_t dataProtectionClassForEntitlements(const PlistDict& entitlements);
+
+    // Changes the class of a data container's user data. Every outcome,
+    // including a refusal, reaches `completion` (when given) exactly once as
+    // a code (TarnSuccess on success); it may run later, on another queue.
+    void setDataProtectionOnDataContainerForContainerIdentity(
+        const TarnContainerIdentityRef& identity, int32_t dataProtectionClass,
+        bool isSecondOrThirdPartyApp, bool retryIfLocked, std::function<void(uint64_t)> completion);
+
+    // Restarts the changes a previous run left pending. Called once, by the
+    // every-launch set-up.
+    TarnStatus restartPendingDataProtectionOperationsWithError();
 
   private:
     TarnDataProtectionManager() = default;
