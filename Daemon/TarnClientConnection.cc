@@ -351,16 +351,11 @@ int TarnClientConnection::_dataProtectionClassForContainerMetadata(
     if (!containerMetadata || !TarnContainerClassIsPerUser(containerMetadata->containerClass()))
         return kTarnDataProtectionClassNone;
     // A class recorded by an earlier change wins over what the entitlements ask for.
-    if (const std::optional<PlistValue>& info = containerMetadata->info()) {
-        const PlistValue* recorded = info->find(kTarnInfoContentProtectionClassKey);
-        if (recorded && recorded->isNumber()) {
-            if (auto i = recorded->asInt64()) return static_cast<int>(*i);
-            if (auto d = recorded->asReal()) return static_cast<int>(*d);
-        }
-    }
-    return TarnDataProtectionManager::defaultManager()
-        .intendedDataProtectionClassBasedOnEntitlementsForIdentifier(
-            containerMetadata->identifier());
+    auto& manager = TarnDataProtectionManager::defaultManager();
+    if (auto recorded = manager.recordedDataProtectionClassOfContainer(*containerMetadata))
+        return *recorded;
+    return manager.intendedDataProtectionClassBasedOnEntitlementsForIdentifier(
+        containerMetadata->identifier());
 }
 
 // ---- Create or look up ----

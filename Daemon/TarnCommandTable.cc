@@ -4,6 +4,7 @@
 #include "Daemon/TarnCodeSigningCommands.h"
 #include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnContainerCommands.h"
+#include "Daemon/TarnDataProtectionCommands.h"
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnGroupCommands.h"
 #include "Daemon/TarnTestLocks.h"
@@ -42,7 +43,7 @@ const TarnCommandTableRow gTarnCommandTable[kTarnCommandCount] = {
     {.command = 18, .handler = TarnHandleProcessCodeSigningInfoCommand, .entitlement = kAllowed},  // record code-signing information
     {.command = 19, .handler = TarnHandleGetCodeSigningInfoCommand, .entitlement = kAllowed},  // read code-signing information
     {.command = 20, .handler = TarnHandleInvalidateAppsWithoutBundleCommand, .entitlement = kAllowed},  // invalidate code-signing info without bundle
-    {.command = 21, .entitlement = kAllowed, .replyOnReturn = 0},  // set data protection
+    {.command = 21, .handler = TarnHandleSetDataProtectionCommand, .entitlement = kAllowed, .replyOnReturn = 0},  // set data protection
     {.command = 22, .handler = TarnHandleRecreateStructureCommand, .entitlement = kAllowed},  // same as 8
     {.command = 23, .handler = TarnHandleDiskUsageCommand, .entitlement = kAllowed, .lookupAllowed = 1},  // disk usage
     {.command = 24, .entitlement = kTarnEntitlementDataMigration},  // data-migrator migration

@@ -1,20 +1,26 @@
 // TarnDataProtectionManager: decides which data-protection class a data
-// container should get. One per process (defaultManager, also reachable as
-// sharedInstance), living for the whole process; stateless so far, so every
-// operation may run on any thread (off the code-signing mapping's queue,
-// because it reads the mapping synchronously).
+// container should get, accepts requests to change it, refuses classes that
+// are not allowed, persists each accepted change as a pending operation
+// (TarnDataProtectionChangeOperation) before running it, and restarts pending
+// operations after a restart.
 //
-// For now only the policy side is here: the class an application asks for in
-// its entitlements. The operations that change a container's class and the
-// pending-operation files behind them come later.
+// One per process (defaultManager, also reachable as sharedInstance), living
+// for the whole process. Every operation may run on any thread, but off the
+// code-signing mapping's queue (it reads the mapping synchronously) and
+// without identifier locks held (a change takes them). Pending-operation files
+// are touched only on `protectionOperationFileQueue`.
 #pragma once
 
 #include <cstdint>
 #include <functional>
+#include <optional>
 #include <string>
 
 #include "Daemon/TarnContainerIdentity.h"
+#include "Daemon/TarnDataProtectionChangeOperation.h"
+#include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnResult.h"
+#include "Platform/Dispatch.h"
 #include "Platform/PropertyList.h"
 
 namespace tarn {
@@ -51,10 +57,15 @@ class TarnDataProtectionManager {
     static int32_t dataProtectionClassForEntitlementValue(const std::string& value);
     // The first of the three entitlements that holds a string, mapped.
     static int32_t dataProtectionClassForEntitlements(const PlistDict& entitlements);
+    // The class a container's info records ("com.ostrea.Pallet.ContentProtectionClass"
+    // holding a number); none when it records none.
+    static std::optional<int32_t> recordedDataProtectionClassOfContainer(
+        const TarnMetadata& metadata);
 
     // Changes the class of a data container's user data. Every outcome,
     // including a refusal, reaches `completion` (when given) exactly once as
-    // a code (TarnSuccess on success); it may run later, on another queue.
+    // a code (TarnSuccess on success): on the calling thread when the change
+    // ends at once, later on the lock-state queue when it waited for an unlock.
     void setDataProtectionOnDataContainerForContainerIdentity(
         const TarnContainerIdentityRef& identity, int32_t dataProtectionClass,
         bool isSecondOrThirdPartyApp, bool retryIfLocked, std::function<void(uint64_t)> completion);
@@ -63,8 +74,26 @@ class TarnDataProtectionManager {
     // every-launch set-up.
     TarnStatus restartPendingDataProtectionOperationsWithError();
 
+    // Runs one change. Before its first retry after an unlock the application
+    // is kept from running (a termination assertion, held until the end);
+    // after success the new class is recorded in the container's info.
+    void _startDataProtectionChangeOperation(const TarnDataProtectionChangeOperationRef& operation,
+                                             std::function<void(uint64_t)> completion);
+
+    // The change type for going from `currentClass` to `requestedClass`:
+    // directories and files (files only towards stronger classes) when the
+    // class gets stronger, directories only otherwise.
+    static uint32_t changeTypeForClassChange(int32_t currentClass, int32_t requestedClass);
+
+    const DispatchQueueRef& protectionOperationFileQueue() const {
+        return protectionOperationFileQueue_;
+    }
+
   private:
-    TarnDataProtectionManager() = default;
+    TarnDataProtectionManager();
+
+    // Constant after construction.
+    const DispatchQueueRef protectionOperationFileQueue_;
 };
 
 }  // namespace tarn

@@ -760,8 +760,14 @@ TarnResult<int32_t> TarnFileManager::dataProtectionClassOfItemAtURL(const FileUR
 
 TarnStatus TarnFileManager::setDataProtectionClassOfItemAtURL(
     const FileURL& url, int32_t toClass, const TarnDataProtectionPredicate& ifPredicate) {
+    return setDataProtectionClassOfItemInDirectory(-1, url, url, toClass, ifPredicate);
+}
+
+TarnStatus TarnFileManager::setDataProtectionClassOfItemInDirectory(
+    int directoryFd, const std::string& name, const FileURL& url, int32_t toClass,
+    const TarnDataProtectionPredicate& ifPredicate) {
     FsFd fd;
-    if (int err = FsOpenItem(-1, url, &fd))
+    if (int err = FsOpenItem(directoryFd, name, &fd))
         return TARN_POSIX_ERROR(err, "Failed to open %s : %s", url, errText(err));
     if (ifPredicate) {
         int32_t current = 0;

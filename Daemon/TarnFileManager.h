@@ -267,6 +267,12 @@ public:
     // class is 1. A predicate answering false ends with success and no change.
     TarnStatus setDataProtectionClassOfItemAtURL(const FileURL& url, int32_t toClass,
                                                  const TarnDataProtectionPredicate& ifPredicate);
+    // The same for the entry `name` of the open directory `directoryFd`, not
+    // through a link (`url` names it in messages): a walk sets each entry
+    // without resolving its path again.
+    TarnStatus setDataProtectionClassOfItemInDirectory(
+        int directoryFd, const std::string& name, const FileURL& url, int32_t toClass,
+        const TarnDataProtectionPredicate& ifPredicate);
 
     // ---- Ownership, ACLs, disk usage ----
 
