@@ -4,7 +4,9 @@
 // default user's library directory. The system scope also folds the older
 // one-marker-file-per-migration scheme into its file.
 //
-// Not thread-safe: each user makes its own object for one pass.
+// Not thread-safe: each user makes its own object for one pass. A status file
+// that exists but cannot be read gives no object, so that no migration runs
+// on a guess and the file is left as it is for inspection.
 #pragma once
 
 #include <memory>
@@ -24,13 +26,14 @@ inline constexpr const char* kTarnMigrationTypeSubdirectory = "SubdirectoryMigra
 
 class TarnMigrationStatus {
   public:
-    // Empty when the file cannot be read (a missing file reads as empty).
+    // Null when the file exists but cannot be read; a missing file reads as
+    // an empty status.
     static std::unique_ptr<TarnMigrationStatus> initForSystemMigration();
     static std::unique_ptr<TarnMigrationStatus> init() { return initForSystemMigration(); }
     static std::unique_ptr<TarnMigrationStatus> initForMobileUserMigration();
 
-    // The running build's version, read once; "Unknown" when unreadable.
-    static const std::string& currentBuildVersion();
+    // The running build's version; "Unknown" when unreadable.
+    static std::string currentBuildVersion();
 
     bool hasMigrationOccurredForType(const std::string& type) const;
     // Records `type` as completed now on the current build and writes the
@@ -45,6 +48,7 @@ class TarnMigrationStatus {
     explicit TarnMigrationStatus(FileURL fileURL) : migrationFileURL_(std::move(fileURL)) {}
 
   private:
+    static std::unique_ptr<TarnMigrationStatus> loaded(FileURL url, const char* failure);
     bool _readMigrationStatusFromDisk();
     bool _writeMigrationStatusToDisk();
     void _migrateFromManyMarkerFilesToOne();

@@ -39,6 +39,8 @@ inline constexpr const char* kFailpointNames[] = {
     "fm.standardizeACLs",
     "fm.setMode",
     "fm.setOwner",
+    // Sandbox state (the durable write of a user's table)
+    "sandbox.recordChanges",
     // Daemon start-up (tests of requests that arrive during start-up)
     "daemon.startup",
 };

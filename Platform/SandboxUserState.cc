@@ -4,12 +4,13 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <cerrno>
 #include <algorithm>
+#include <cerrno>
 #include <cstring>
 #include <mutex>
 #include <vector>
 
+#include "Platform/Failpoints.h"
 #include "Platform/PlatformLog.h"
 #include "Platform/PropertyList.h"
 #include "Platform/RootPrefix.h"
@@ -257,6 +258,7 @@ int FileSandboxUserState::_lock_writeSnapshot(uint32_t uid) {
 }
 
 int FileSandboxUserState::_lock_recordChanges(uint32_t uid, const std::vector<Change>& changes) {
+    if (auto err = TARN_FAILPOINT("sandbox.recordChanges")) return *err;
     constexpr size_t kMinJournalRecords = 256;
     size_t& records = journalRecords_[uid];
     // Many changes at once (a class rebuild) cost less as one snapshot.
@@ -309,10 +311,22 @@ int FileSandboxUserState::setUserStateItemWithPersona(uint32_t uid, uint32_t per
         return 0;
     }
     int err = _lock_recordChanges(uid, {Change{key, after}});
-    if (err != 0)
+    if (err != 0) {
+        // The table must not run ahead of the disk: a later push of the same
+        // pair would be skipped as already recorded and never reach the file.
+        _lock_restore(table, key, before);
         PlatformLog("sandbox", PlatformLogType::Error, "Cannot write sandbox state for user %u: %s",
                     uid, std::strerror(err));
+    }
     return err;
+}
+
+void FileSandboxUserState::_lock_restore(Table& table, const Key& key,
+                                         const std::optional<std::string>& before) {
+    if (before)
+        table[key] = *before;
+    else
+        table.erase(key);
 }
 
 bool FileSandboxUserState::userStateItemIsRecordedWithPersona(uint32_t uid, uint32_t personaID,
@@ -365,6 +379,8 @@ int FileSandboxUserState::endBatch() {
         if (changes.empty()) continue;
         int err = _lock_recordChanges(uid, changes);
         if (err != 0) {
+            Table& writable = tables_[uid];
+            for (const auto& [key, before] : originals) _lock_restore(writable, key, before);
             PlatformLog("sandbox", PlatformLogType::Error,
                         "Cannot write sandbox state for user %u: %s", uid, std::strerror(err));
             if (first == 0) first = err;

@@ -175,6 +175,9 @@ class FileSandboxUserState : public SandboxUserState {
     // Appends the changes (or rewrites the snapshot when the journal has grown
     // past the table); 0 or an errno value.
     int _lock_recordChanges(uint32_t uid, const std::vector<Change>& changes) REQUIRES(mu_);
+    // Puts one entry back as it was before an unrecorded change.
+    static void _lock_restore(Table& table, const Key& key,
+                              const std::optional<std::string>& before);
     int _lock_writeSnapshot(uint32_t uid) REQUIRES(mu_);
 
     // Constant after construction.

@@ -6,6 +6,7 @@
 #include <filesystem>
 #include <fstream>
 
+#include "Platform/Failpoints.h"
 #include "Platform/PlatformLog.h"
 #include "Platform/Sandbox.h"
 #include "Platform/SandboxUserState.h"
@@ -159,6 +160,28 @@ TEST_F(SandboxUserStateTest, AnAppendRemakesADirectoryThatWentAway) {
     ASSERT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.b", "/b"), 0);
     FileSandboxUserState restarted(dir());
     EXPECT_EQ(items(restarted, 501), std::vector<std::string>{"1:com.b:501=/b"});
+}
+
+TEST_F(SandboxUserStateTest, AFailedWriteLeavesTheTableAsTheDiskHasIt) {
+    FailpointClearAll();
+    FileSandboxUserState state(dir());
+    ASSERT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.a", "/old"), 0);
+
+    ASSERT_TRUE(FailpointSet("sandbox.recordChanges", "errno:28"));
+    EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.a", "/new"), ENOSPC);
+    EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.b", "/b"), ENOSPC);
+    state.beginBatch();
+    EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.a", nullptr), 0);
+    EXPECT_EQ(state.endBatch(), ENOSPC);
+    EXPECT_EQ(items(state, 501), (std::vector<std::string>{"1:com.a:501=/old"}));
+    FailpointClearAll();
+
+    // The same pushes again are real changes now and reach the disk.
+    EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.a", "/new"), 0);
+    EXPECT_EQ(state.setUserStateItemWithPersona(501, 501, 1, "com.b", "/b"), 0);
+    FileSandboxUserState restarted(dir());
+    EXPECT_EQ(items(restarted, 501),
+              (std::vector<std::string>{"1:com.a:501=/new", "1:com.b:501=/b"}));
 }
 
 TEST_F(SandboxUserStateTest, MalformedStateFilesCountAsEmpty) {
