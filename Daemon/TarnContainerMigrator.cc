@@ -178,6 +178,10 @@ TarnStatus TarnContainerMigrator::_performWhitelistMigration() {
     const TarnWhitelist& wellKnown = TarnWhitelist::sharedWhitelist();
     for (TarnContainerClass systemClass :
          {TarnContainerClassSystemData, TarnContainerClassSystemGroup}) {
+        // No base directory, no containers to rename; listing would make it.
+        const std::optional<FileURL> base = configuration().globalContainerBaseURLWithContentClass(
+            systemClass, /*transient=*/false);
+        if (!base || !fileManager().itemExistsAtURL(*base)) continue;
         TarnResult<std::vector<TarnMetadataRef>> containers =
             cache().allContainersForUserIdentity(userIdentity, systemClass, /*transient=*/false);
         if (!containers.ok()) {
@@ -186,11 +190,9 @@ TarnStatus TarnContainerMigrator::_performWhitelistMigration() {
                     containers.error(), containers.code(TarnErrorCacheRebuildFailed));
             return containers.error();
         }
-        const std::optional<FileURL> base = configuration().containerDirectoryURLForUserIdentity(
-            userIdentity, systemClass, /*transient=*/false);
         for (const TarnMetadataRef& container : *containers) {
             const std::string& identifier = container->identifier();
-            if (!base || !wellKnown.containerIdIsWellknown(identifier, systemClass)) continue;
+            if (!wellKnown.containerIdIsWellknown(identifier, systemClass)) continue;
             const std::optional<std::string> name =
                 wellKnown.wellknownContainerForId(identifier, systemClass);
             if (!name) continue;
