@@ -3,6 +3,7 @@
 // app-group identifiers in data container metadata) and the boot pass that
 // runs them with the app-group reconciliation.
 #include <filesystem>
+#include <functional>
 #include <optional>
 #include <string>
 #include <system_error>
@@ -55,11 +56,15 @@ const PlistValue* tableValue(const PlistDict* table, const std::string& identifi
 }
 
 // The import's clean-up: the metadata value is cleared once its content is
-// in the store (or was there already). The global write lock is held by
-// the boot pass, so no identifier lock is taken.
-TarnStatus clearInfoValue(const TarnMetadataRef& container, const char* key) {
-    return TarnClientConnection::sharedClientConnection().setInfoValue(
-        std::nullopt, std::string(key), container->containerIdentity(), /*useLocking=*/false);
+// in the store (or was there already); `failed` logs a failure. The global
+// write lock is held by the boot pass, so no identifier lock is taken.
+void clearInfoValues(const std::vector<TarnMetadataRef>& containers, const char* key,
+                     const std::function<void(const TarnMetadataRef&, uint64_t code)>& failed) {
+    for (const TarnMetadataRef& container : containers) {
+        const TarnStatus cleared = TarnClientConnection::sharedClientConnection().setInfoValue(
+            std::nullopt, std::string(key), container->containerIdentity(), /*useLocking=*/false);
+        if (!cleared.ok()) failed(container, cleared.code(TarnErrorWriteFailed));
+    }
 }
 
 // Every non-transient container of the class for `userIdentity`; a listing
@@ -222,13 +227,12 @@ void TarnCodeSigningMapping::migrateCachedCodeSigningInfoFromBundleContainersToM
                 _onQueue_migrateCachedCodeSigningInfoFromBundleContainersToMappingWithContainers(
                     holding, bundleClass);
         });
-        for (const TarnMetadataRef& container : toClear) {
-            if (TarnStatus cleared = clearInfoValue(container, kTarnInfoCachedCodeSigningInfoKey);
-                !cleared.ok()) {
-                TarnLog(kLogError, kTag, "Error setting info value for identity %@ : %llu",
-                        container->containerIdentity(), cleared.code(TarnErrorWriteFailed));
-            }
-        }
+        clearInfoValues(toClear, kTarnInfoCachedCodeSigningInfoKey,
+                        [](const TarnMetadataRef& container, uint64_t code) {
+                            TarnLog(kLogError, kTag,
+                                    "Error setting info value for identity %@ : %llu",
+                                    container->containerIdentity(), code);
+                        });
     }
     (void)status->setMigrationCompleteForType(kTarnMigrationTypeCodeSigning);  // logged there
 }
@@ -298,13 +302,12 @@ void TarnCodeSigningMapping::migrateAppGroupIdsFromDataContainersToFile() {
         runOnQueue([&] {
             toClear = _onQueue_migrateAppGroupIdsFromDataContainersToFileUsingContainers(holding);
         });
-        for (const TarnMetadataRef& container : toClear) {
-            if (TarnStatus cleared = clearInfoValue(container, kTarnInfoGroupContainerIDsKey);
-                !cleared.ok()) {
-                TarnLog(kLogError, kTag, "Failed to clear group id metadata for %@ : %llu",
-                        container->identifier(), cleared.code(TarnErrorWriteFailed));
-            }
-        }
+        clearInfoValues(toClear, kTarnInfoGroupContainerIDsKey,
+                        [](const TarnMetadataRef& container, uint64_t code) {
+                            TarnLog(kLogError, kTag,
+                                    "Failed to clear group id metadata for %@ : %llu",
+                                    container->identifier(), code);
+                        });
     }
     (void)status->setMigrationCompleteForType(kTarnMigrationTypeGroupId);  // logged there
 }
