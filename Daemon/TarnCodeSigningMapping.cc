@@ -42,9 +42,6 @@ const std::optional<PlistDict> kNoInfo;
 // The store's answer for an identifier it has no record of.
 bool isNotFound(const TarnErrorRef& e) { return e && e->code() == TarnErrorDatabaseNotFound; }
 
-// The key under which a bundle container's cached info keeps its entitlements.
-constexpr const char* kCachedInfoEntitlementsKey = "Entitlements";
-
 // Distinct identifiers the registration memo keeps before it starts over: a
 // device has far fewer clients, so this only bounds a misbehaving one.
 constexpr size_t kRegistrationMemoCapacity = 4096;
@@ -472,14 +469,9 @@ std::optional<PlistDict> TarnCodeSigningMapping::importCachedCodeSigningInfo(
         metadataInfo ? metadataInfo->find(kTarnInfoCachedCodeSigningInfoKey) : nullptr;
     if (!cached || !cached->isDict()) return std::nullopt;
 
-    PlistDict info = *cached->asDict();
     TarnLog(kLogNotice, "entitlementsForIdentifier",
             "Migrating code signing info from bundle container upon request for %@", identifier);
-    if (auto it = info.find(kCachedInfoEntitlementsKey); it != info.end()) {
-        PlistValue entitlements = it->second;
-        info.insert_or_assign(kEntitlementsKey, std::move(entitlements));
-    }
-    auto entry = std::make_shared<const TarnCodeSigningEntry>(std::move(info), uint64_t{2});
+    TarnCodeSigningEntryRef entry = _entryFromCachedCodeSigningInfo(*cached->asDict(), 2);
     TarnStatus stored;
     runOnQueue([&] {
         _onQueue_storeWillChange();

@@ -42,6 +42,7 @@
 #include "Daemon/TarnCodeSigningEntry.h"
 #include "Daemon/TarnContainerClass.h"
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnRequestContext.h"
 #include "Daemon/TarnResult.h"
 #include "Daemon/TarnUserIdentity.h"
@@ -267,6 +268,53 @@ public:
     // The legacy mapping file: identifier -> serialised entry, or the error
     // when it cannot be read; a missing file is a POSIX ENOENT error.
     static TarnResult<PlistDict> _readCodeSigningMappingFromDiskAtURL(const FileURL& url);
+
+    // ---- imports of older records and the boot reconciliation
+    //      (TarnCodeSigningMappingImports.cc) ----
+    //
+    // Every import logs its failures and goes on with the next item; none
+    // fails the pass. Legacy files are removed and container metadata values
+    // cleared after their import, so each import runs to completion once.
+
+    // Under the global write lock (the caller holds no global or identifier
+    // lock): imports the app-group identifiers of data containers, the legacy
+    // entitlements file and the code-signing info cached in bundle
+    // containers, then stages the deletion of unreferenced app-group
+    // containers on `commandQueue`. In multi-user mode the two app-group
+    // steps are skipped.
+    void performAllCodeSigningMigrationAndReconciliationWithCommandQueue(
+        TarnCommandQueue* commandQueue);
+    // "tarn_entitlements.plist" of the library directory, removed afterwards.
+    void _onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
+    // Once per device (recorded as "CodeSigningMigration"); off the queue,
+    // with the global write lock held by the caller.
+    void migrateCachedCodeSigningInfoFromBundleContainersToMapping();
+    // Stores the cached info of those containers that need it; answers the
+    // containers whose cached value is to be cleared (all that held one).
+    std::vector<TarnMetadataRef>
+    _onQueue_migrateCachedCodeSigningInfoFromBundleContainersToMappingWithContainers(
+        const std::vector<TarnMetadataRef>& containers, TarnContainerClass containerClass);
+    // Once per device (recorded as "GroupIdMigration"); like the previous.
+    void migrateAppGroupIdsFromDataContainersToFile();
+    std::vector<TarnMetadataRef> _onQueue_migrateAppGroupIdsFromDataContainersToFileUsingContainers(
+        const std::vector<TarnMetadataRef>& containers);
+
+    // One entry of the legacy entitlements file, decoded; `entry` is empty
+    // when the identifier's value cannot be imported (`why` says so).
+    struct LegacyEntitlementsEntry {
+        std::string identifier;
+        TarnCodeSigningEntryRef entry;
+        std::string why;
+    };
+    // Decodes the legacy entitlements file's dictionary: every key but the
+    // three per-identifier tables is an identifier whose value is its
+    // entitlements. In key order. Never fails: bad values are reported per entry.
+    static std::vector<LegacyEntitlementsEntry> _entriesFromLegacyEntitlements(
+        const PlistDict& file);
+    // The entry for code-signing info cached in a container's metadata: the
+    // info with its "Entitlements" also under the entitlements key.
+    static TarnCodeSigningEntryRef _entryFromCachedCodeSigningInfo(PlistDict cachedInfo,
+                                                                   uint64_t dataContainerClass);
 
     // ---- test access ----
 

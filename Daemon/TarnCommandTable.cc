@@ -7,6 +7,7 @@
 #include "Daemon/TarnDataProtectionCommands.h"
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnGroupCommands.h"
+#include "Daemon/TarnMigrationCommands.h"
 #include "Daemon/TarnTestLocks.h"
 
 namespace tarn {
@@ -46,13 +47,13 @@ const TarnCommandTableRow gTarnCommandTable[kTarnCommandCount] = {
     {.command = 21, .handler = TarnHandleSetDataProtectionCommand, .entitlement = kAllowed, .replyOnReturn = 0},  // set data protection
     {.command = 22, .handler = TarnHandleRecreateStructureCommand, .entitlement = kAllowed},  // same as 8
     {.command = 23, .handler = TarnHandleDiskUsageCommand, .entitlement = kAllowed, .lookupAllowed = 1},  // disk usage
-    {.command = 24, .entitlement = kTarnEntitlementDataMigration},  // data-migrator migration
+    {.command = 24, .handler = TarnHandleDataMigrationCommand, .entitlement = kTarnEntitlementDataMigration},  // data-migrator migration
     {.command = 25, .handler = TarnHandleRetryTestCommand, .entitlement = kTarnEntitlementTestability},  // crash-and-retry test
     {.command = 26, .handler = TarnHandleStageSharedContentCommand, .entitlement = kTarnEntitlementStageSharedContent},  // stage shared content
     {.command = 27, .handler = TarnHandleUnsupportedCommand, .entitlement = kAllowed},  // not supported
     {.command = 28, .handler = TarnHandleUserManagedAssetsPathCommand, .entitlement = kTarnEntitlementUserManagedAssets, .anyClient = 1},  // user-managed assets path
     {.command = 29, .handler = TarnHandleDeleteUserManagedAssetCommand, .entitlement = kTarnEntitlementUserManagedAssets},  // delete a user-managed asset
-    {.command = 30, .entitlement = kAllowed},  // per-user data migration
+    {.command = 30, .handler = TarnHandlePerUserDataMigrationCommand, .entitlement = kAllowed},  // per-user data migration
     {.command = 31, .handler = TarnHandleTestLockCommand, .entitlement = kTarnEntitlementTestability},  // test locks
     {.command = 32, .handler = TarnHandlePersonaStringsCommand, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // persona unique strings
 };

@@ -672,6 +672,14 @@ namespace {
 
 using FsVisit = std::function<bool(const FsWalkEntry&)>;
 
+// A directory the walk found but could not open (no search or read
+// permission): its stat is known, its contents are not. A directory swapped
+// between the stat and the open (EAGAIN) is no such thing and still stops the walk.
+bool unreadableDirectory(const FsWalkEntry& entry) {
+    return entry.type == FsWalkType::Error && entry.st.isDirectory() && !entry.name.empty() &&
+           entry.fd < 0 && (entry.error == EACCES || entry.error == EPERM);
+}
+
 // A traversal over the walk `walk` starts (FsWalk or FsWalkAt), handing every
 // entry to `withBlock`, under the name of `operation`.
 TarnStatus traverse(const char* operation, const FileURL& url,
@@ -681,13 +689,20 @@ TarnStatus traverse(const char* operation, const FileURL& url,
     uint64_t handed = 0;
     TarnErrorRef walkError;
     int err = walk([&](const FsWalkEntry& entry) {
-        if (entry.type == FsWalkType::Error) {
+        // An unreadable directory is handed on like any directory (its own
+        // owner, mode and ACL can still be set through its parent) and the
+        // walk goes on with its siblings; only its contents stay unseen.
+        std::optional<FsWalkEntry> unreadable;
+        if (unreadableDirectory(entry)) {
+            unreadable = entry;
+            unreadable->type = FsWalkType::Directory;
+        } else if (entry.type == FsWalkType::Error) {
             walkError = TARN_POSIX_ERROR_IN(operation, entry.error, "Error for path %s: %s", url,
                                             errText(entry.error));
             return false;
         }
         ++handed;
-        if (TarnStatus visited = withBlock(entry); !visited.ok()) {
+        if (TarnStatus visited = withBlock(unreadable ? *unreadable : entry); !visited.ok()) {
             walkError = visited.error();
             if (!walkError)
                 walkError = TARN_POSIX_ERROR_IN(operation, ECANCELED, "traversal of %s stopped", url);

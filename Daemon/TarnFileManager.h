@@ -248,6 +248,9 @@ public:
     TarnResult<std::vector<FileURL>> urlsForItemsInDirectoryAtURL(const FileURL& url);
     // Pre-order walk with post-order directory visits, physical, one file
     // system. Entries with unreadable metadata stop the walk with their errno.
+    // A directory that cannot be opened for lack of permission is handed on
+    // as a directory with `error` set and no descriptor, and the walk goes on:
+    // its contents are skipped and no post-order visit follows.
     TarnStatus _traverseDirectory(const FileURL& url, const TarnTraversalBlock& withBlock);
     // The same from the entry `name` of an open directory (`url` for messages).
     TarnStatus _traverseItemInDirectory(const FsFd& directory, const std::string& name,
