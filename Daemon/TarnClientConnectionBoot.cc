@@ -207,6 +207,20 @@ void reconcileApplicationGroups() {
     }
 }
 
+// Runs `block` for every accessible user whose home exists: one without a
+// home has nothing to sweep, and asking for its directories would make them.
+void forEachUserWithAHome(
+    TarnUserIdentitySharedCache& users,
+    const std::function<void(const TarnUserIdentityRef&, TarnPerUserConfiguration&)>& block) {
+    auto& configuration = TarnGlobalConfiguration::sharedInstance();
+    users.forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
+        [&](const TarnUserIdentityRef& userIdentity) {
+            const std::shared_ptr<TarnPerUserConfiguration> perUser =
+                configuration.getPerUserConfigurationForUserIdentity(userIdentity);
+            if (perUser && perUser->existsUserBaseDirectory()) block(userIdentity, *perUser);
+        });
+}
+
 // Where the orphan sweep of one class looks.
 TarnResult<std::vector<FileURL>> listContainerDirectory(const std::optional<FileURL>& directory) {
     if (!directory) return TARN_ERROR_CODE(TarnErrorInvalidArgument, nullptr);
@@ -290,43 +304,30 @@ void TarnClientConnection::rebootKeeperCleanupWithCompletion(std::function<void(
     // A step that throws costs the rest of the listing, never the completion.
     (void)TarnFenceExceptions(kTag, [&] {
         auto& configuration = TarnGlobalConfiguration::sharedInstance();
-        const FileURL transientURL = configuration.transientDirectory();
-        if (const TarnStatus moved = _moveItemAtURLToDeathRow(transientURL, true, false);
-            !moved.ok())
-            TarnLog(kLogError, kTag, "Failed to delete shared transient URL %@ : %@", transientURL,
-                    moved.error());
+        // Transient data does not outlive a boot.
+        auto discard = [&](const FileURL& url, const char* failureFormat) {
+            if (const TarnStatus moved = _moveItemAtURLToDeathRow(url, true, false); !moved.ok())
+                TarnLog(kLogError, kTag, failureFormat, url, moved.error());
+        };
+        discard(configuration.transientDirectory(),
+                "Failed to delete shared transient URL %@ : %@");
         if (const std::optional<FileURL> legacyURL =
                 configuration.legacyTransientBundleDirectory()) {
             TarnLog(kLogNotice, kTag,
                     "Sentencing legacy transient bundle directory [%@] to final deletion",
                     *legacyURL);
-            if (const TarnStatus moved = _moveItemAtURLToDeathRow(*legacyURL, true, false);
-                !moved.ok())
-                TarnLog(kLogError, kTag,
-                        "Failed to delete legacy shared transient bundle URL %@ : %@", *legacyURL,
-                        moved.error());
+            discard(*legacyURL, "Failed to delete legacy shared transient bundle URL %@ : %@");
         }
-        const FileURL transientBundleURL = configuration.transientBundleDirectory();
-        if (const TarnStatus moved = _moveItemAtURLToDeathRow(transientBundleURL, true, false);
-            !moved.ok())
-            TarnLog(kLogError, kTag, "Failed to delete shared transient bundle URL %@ : %@",
-                    transientBundleURL, moved.error());
+        discard(configuration.transientBundleDirectory(),
+                "Failed to delete shared transient bundle URL %@ : %@");
 
-        userIdentityCache_.forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
-            [&](const TarnUserIdentityRef& userIdentity) {
-                const std::shared_ptr<TarnPerUserConfiguration> perUser =
-                    configuration.getPerUserConfigurationForUserIdentity(userIdentity);
-                // A user without a home has nothing to sweep; looking would create it.
-                if (!perUser || !perUser->existsUserBaseDirectory()) return;
-                const FileURL userTransientURL = perUser->transientDirectory();
-                if (const TarnStatus moved =
-                        _moveItemAtURLToDeathRow(userTransientURL, true, false);
-                    !moved.ok())
-                    TarnLog(kLogError, kTag, "Failed to delete per-user transient URL %@ : %@",
-                            userTransientURL, moved.error());
+        forEachUserWithAHome(
+            userIdentityCache_, [&](const TarnUserIdentityRef&, TarnPerUserConfiguration& perUser) {
+                discard(perUser.transientDirectory(),
+                        "Failed to delete per-user transient URL %@ : %@");
                 for (TarnContainerClass containerClass : {2, 4, 6, 7, 9, 10, 11})
                     _submitOrphanSweep(
-                        listContainerDirectory(perUser->containerDirectoryURLForContentClass(
+                        listContainerDirectory(perUser.containerDirectoryURLForContentClass(
                             containerClass, /*transient=*/false)),
                         containerClass);
             });
@@ -417,13 +418,10 @@ void TarnClientConnection::keeperCleanupWithCompletion(std::function<void()> com
         else if (!isNoSuchFile(items.error()))
             TarnLog(kLogError, kTag, "Failed to get items at global staging URL: %@ : %@",
                     globalStagingURL, items.error());
-        userIdentityCache_.forEachAccessibleUserIdentitySynchronouslyExecuteBlock(
-            [&](const TarnUserIdentityRef& userIdentity) {
-                // Nothing is staged below a home that does not exist; asking
-                // for its staging directory would create one.
-                const std::shared_ptr<TarnPerUserConfiguration> perUser =
-                    configuration.getPerUserConfigurationForUserIdentity(userIdentity);
-                if (!perUser || !perUser->existsUserBaseDirectory()) return;
+        // Nothing is staged below a home that does not exist.
+        forEachUserWithAHome(
+            userIdentityCache_,
+            [&](const TarnUserIdentityRef& userIdentity, TarnPerUserConfiguration&) {
                 const FileURL stagingURL = configuration.stagingDirectoryURLForUserIdentity(
                     userIdentity, TarnContainerClassAppData);
                 auto items = fm.urlsForItemsInDirectoryAtURL(stagingURL);
