@@ -230,10 +230,28 @@ class TarnClientConnection {
 
     // ---- Boot work run by start-up on the shared connection
     //      (TarnClientConnectionBoot.cc) ----
+    // The set-ups run synchronously before the listener opens (the reboot
+    // ones on the first start after boot only). The clean-ups return at once:
+    // their work runs on the serial background queue, and each calls its
+    // completion (may be empty) exactly once, after that work, failed or not,
+    // inside a process transaction. None of them fails: failures are logged.
     void rebootKeeperSetup();
     void keeperSetup();
     void rebootKeeperCleanupWithCompletion(std::function<void()> completion);
     void keeperCleanupWithCompletion(std::function<void()> completion);
+    // Gives every system (group) container of the connection's user a new
+    // UUID directory, except the well-known ones (after a build upgrade).
+    void _regenerateAllSystemContainerPaths();
+    // Moves to death row every listed directory that is not a container of
+    // the class with its metadata file. `directories` is a directory listing:
+    // a failed one (ENOENT: silently) means nothing to do.
+    void _cleanupOrphanedDataForDirectories(const TarnResult<std::vector<FileURL>>& directories,
+                                            TarnContainerClass containerClass);
+    void _cleanupOprhanedCodeSigningMappingData();
+    // Queues _cleanupOrphanedDataForDirectories on the background queue; the
+    // connection must outlive it (the shared one lives for the process).
+    void _submitOrphanSweep(TarnResult<std::vector<FileURL>> directories,
+                            TarnContainerClass containerClass);
 
     // ---- Replacement and its recovery (TarnClientConnectionReplace.cc) ----
 

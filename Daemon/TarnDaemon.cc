@@ -5,8 +5,10 @@
 #include <atomic>
 #include <cstring>
 #include <mutex>
+#include <system_error>
 
 #include "Daemon/TarnClientConnection.h"
+#include "Daemon/TarnExceptionFence.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnLog.h"
 #include "Platform/ContainerLibrary.h"
@@ -65,6 +67,18 @@ void firstBootCleanupCompleted() {
         PlatformLog("startup", PlatformLogType::Error, "Failed to post reboot-cleanup-complete: %u",
                     status);
     gFirstBootCleanupInterval.reset();
+}
+
+// Runs one start-up step at the exception fence: on internal builds a throw
+// ends in the fatal report, elsewhere it is logged and start-up goes on (a
+// half-done step is repaired by the next start, a missing listener is not).
+template <class Step>
+void runStartupStep(const char* name, Step&& step) {
+    (void)TarnFenceExceptions(name, [&] {
+        if (auto err = TARN_FAILPOINT("daemon.startup.step"))
+            throw std::system_error(*err, std::generic_category(), name);
+        step();
+    });
 }
 
 }  // namespace
@@ -132,12 +146,12 @@ void TarnDaemonStartupWork(const std::function<void()>& onFinished) {
     if (!FirstBootMarkerExists()) {
         TarnLog(kLogNotice, kInitTag, "tarnkeeperd performing first boot initialization");
         SignpostInterval firstBoot("startup", "FirstBootSetup");
-        shared.rebootKeeperSetup();
+        runStartupStep("rebootKeeperSetup", [&] { shared.rebootKeeperSetup(); });
         firstLaunchSinceBoot = true;
     }
     {
         SignpostInterval bootSetup("startup", "BootSetup");
-        shared.keeperSetup();
+        runStartupStep("keeperSetup", [&] { shared.keeperSetup(); });
     }
     // The kernel upcall service starts here once it exists on this platform.
 
@@ -149,10 +163,13 @@ void TarnDaemonStartupWork(const std::function<void()>& onFinished) {
 
     if (firstLaunchSinceBoot) {
         gFirstBootCleanupInterval = std::make_unique<SignpostInterval>("startup", "FirstBootCleanup");
-        shared.rebootKeeperCleanupWithCompletion(firstBootCleanupCompleted);
+        runStartupStep("rebootKeeperCleanupWithCompletion", [&] {
+            shared.rebootKeeperCleanupWithCompletion(firstBootCleanupCompleted);
+        });
     }
     gBootCleanupInterval = std::make_unique<SignpostInterval>("startup", "BootCleanup");
-    shared.keeperCleanupWithCompletion(bootCleanupCompleted);
+    runStartupStep("keeperCleanupWithCompletion",
+                   [&] { shared.keeperCleanupWithCompletion(bootCleanupCompleted); });
     startingUp.end();
     if (onFinished) onFinished();
 }

@@ -43,6 +43,10 @@ inline constexpr const char* kFailpointNames[] = {
     "sandbox.recordChanges",
     // Daemon start-up (tests of requests that arrive during start-up)
     "daemon.startup",
+    // Boot set-up and clean-up: a start-up step that throws (the Nth hit is
+    // the Nth step run), a restored item whose destination cannot be removed
+    "daemon.startup.step",
+    "boot.restore.removeTarget",
 };
 
 bool FailpointIsKnown(std::string_view name);
