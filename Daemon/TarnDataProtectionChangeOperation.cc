@@ -440,6 +440,10 @@ void TarnDataProtectionChangeOperation::performChangeOperation() {
         TarnLog(kLogNotice, kPerformTag,
                 "Retrying container protection update to %d on next unlock for %@",
                 newDataProtectionClass_, describeContainer());
+        // Act on the lock now rather than when its notification arrives: until
+        // the queue is suspended the retry would run at once and meet the lock
+        // again, over and over.
+        TarnLockStateCallback();
         transactionAsync(TarnLockStateQueue(), [self = shared_from_this()] {
             (void)TarnFenceExceptions(kPerformTag, [&] {
                 if (!self->retried_ && self->retryStartBlock_) self->retryStartBlock_();
