@@ -6,6 +6,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <thread>
 
 #include "Daemon/TarnError.h"
 #include "support/IpcTest.h"
@@ -89,6 +90,38 @@ TEST_F(MigrationCommandsTest, ASecondPerUserMigrationRepeatsAllButTheSubdirector
     ASSERT_EQ(TarnSuccess, errorOf(reply));
     ASSERT_TRUE(reply.find("ReplyInfoValue"));
     EXPECT_EQ(3u, reply.find("ReplyInfoValue")->asUInt64().value_or(0));
+}
+
+// A data container whose application has no bundle container is brought to
+// the class its entitlements ask for; the change runs after the reply.
+TEST_F(MigrationCommandsTest, APerUserMigrationAppliesTheEntitledClassWithoutABundle) {
+    if (IsSkipped()) return;
+    daemon_->start();
+    PlistValue entitlements{PlistDict{}};
+    entitlements.set("com.ostrea.private.TarnKeeper.allowed", true);
+    entitlements.set("data-protection-class", "com.ostrea.file-protection.complete");
+    // The application's first request records its entitlements.
+    const std::string app = daemon_->addClient("app", "com.example.entitled", entitlements);
+    std::string uuid;
+    const std::string path = create(*daemon_, app, "com.example.entitled", 2, &uuid);
+    ASSERT_FALSE(path.empty());
+    const std::string identity = R"("Identifier": "com.example.entitled", "ContainerClass": 2, )"
+                                 R"("UUID": {"$uuid": ")" +
+                                 uuid + R"("}, )";
+    ASSERT_EQ(TarnSuccess,
+              ask(admin_, R"({"Command": 5, )" + identity +
+                              R"("Key": "com.ostrea.Pallet.ContentProtectionClass", "Value": 3})"));
+
+    EXPECT_EQ(TarnSuccess, ask(admin_, R"({"Command": 30})"));
+    uint64_t recorded = 0;
+    for (int i = 0; i < 200 && recorded != 1; ++i) {
+        auto reply = send(admin_, R"({"Command": 6, )" + identity +
+                                      R"("Key": "com.ostrea.Pallet.ContentProtectionClass"})");
+        const PlistValue* value = reply.find("ReplyInfoValue");
+        recorded = value ? value->asUInt64().value_or(0) : 0;
+        if (recorded != 1) std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    EXPECT_EQ(1u, recorded);
 }
 
 // Kill the daemon in the middle of command 24 (after the ACL step, in the
