@@ -55,24 +55,22 @@ TarnStatus TarnClientConnection::deleteDataContainerContentWithContainerIdentity
     // The wipe has been authorised above; the look-ups below must not ask again.
     allowOtherIdLookup_ = true;
 
-    TarnResult<TarnMetadataRef> existing = createOrLookupContainerWithContainerIdentity(
-        identity, /*createIfNecessary=*/false, /*transient=*/false, /*useLocking=*/true);
-    TarnConcreteContainerIdentityRef oldIdentity =
-        existing.ok() ? (*existing)->containerIdentity() : nullptr;
-    if (!oldIdentity) {
-        TarnLog(kLogError, __func__, "Failed to lookup existing container to wipe-identifier: %@",
-                identifier);
-        return existing.ok() ? refused(TarnErrorInvalidArgument) : existing.error();
-    }
-    TarnResult<TarnMetadataRef> fresh = createOrLookupContainerWithContainerIdentity(
-        identity, /*createIfNecessary=*/true, /*transient=*/true, /*useLocking=*/true);
-    TarnConcreteContainerIdentityRef newIdentity =
-        fresh.ok() ? (*fresh)->containerIdentity() : nullptr;
-    if (!newIdentity) {
-        TarnLog(kLogError, __func__, "Failed to create transient container for wipe-identifier: %@",
-                identifier);
-        return fresh.ok() ? refused(TarnErrorInvalidArgument) : fresh.error();
-    }
+    // The container of the identity, existing or made fresh in the transient
+    // tree; a failure writes `line` and answers the look-up's error.
+    const auto concrete = [&](bool fresh,
+                              const char* line) -> TarnResult<TarnConcreteContainerIdentityRef> {
+        TarnResult<TarnMetadataRef> found = createOrLookupContainerWithContainerIdentity(
+            identity, /*createIfNecessary=*/fresh, /*transient=*/fresh, /*useLocking=*/true);
+        TarnConcreteContainerIdentityRef made =
+            found.ok() ? (*found)->containerIdentity() : nullptr;
+        if (made) return made;
+        TarnLog(kLogError, "deleteDataContainerContentWithContainerIdentity", line, identifier);
+        return found.ok() ? refused(TarnErrorInvalidArgument) : found.error();
+    };
+    const TarnConcreteContainerIdentityRef oldIdentity =
+        TARN_TRY(concrete(false, "Failed to lookup existing container to wipe-identifier: %@"));
+    const TarnConcreteContainerIdentityRef newIdentity =
+        TARN_TRY(concrete(true, "Failed to create transient container for wipe-identifier: %@"));
     if (TarnStatus replaced = replaceContainerIdentity(oldIdentity, newIdentity,
                                                        /*preserveOldUUID=*/true,
                                                        /*startDeletionThread=*/true);
