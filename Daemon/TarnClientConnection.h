@@ -255,8 +255,52 @@ class TarnClientConnection {
 
     // ---- Replacement and its recovery (TarnClientConnectionReplace.cc) ----
 
+    // The four places of one replacement, as its replace file records them:
+    // where the old container lives (and must be back after a failure), where
+    // the new one lives before, where the old one is parked meanwhile, and
+    // where the new one ends up.
+    struct ReplaceInfo {
+        FileURL oldURL;
+        FileURL newURL;
+        FileURL stagingURL;
+        FileURL destURL;
+    };
+
+    // Puts the container `newIdentity` in the place of `oldIdentity`; a null
+    // `oldIdentity` promotes the new container into the permanent tree.
+    // `preserveOldUUID`: the new container takes the old one's directory and
+    // UUID. `startDeletionThread`: a death-row pass starts at the end.
+    // Holds the global write lock throughout, so the caller holds no
+    // identifier lock. Whatever moment the process dies at, the old container
+    // is either back at its place or the new one has arrived at its own (the
+    // replace file written first tells start-up recovery which).
+    TarnStatus replaceContainerIdentity(const TarnConcreteContainerIdentityRef& oldIdentity,
+                                        const TarnConcreteContainerIdentityRef& newIdentity,
+                                        bool preserveOldUUID, bool startDeletionThread);
+    // Writes the replace file atomically and durably (file and directory
+    // synced). TarnErrorInvalidReplaceInfo for an empty URL, TarnErrorWriteFailed.
+    static TarnStatus _writeToDiskReplaceAt(const FileURL& replaceURL, const FileURL& old,
+                                            const FileURL& withNew, const FileURL& usingStaging,
+                                            const FileURL& toDestination);
+    // Reads one back: TarnErrorReplaceRecoveryFailed for a file that cannot be
+    // read or does not hold the four absolute paths below the root prefix.
+    static TarnResult<ReplaceInfo> _readAndValidateReplaceFileAtUrl(const FileURL& url);
+    // The checks of the reader on a parsed file (`url` names it in messages).
+    static TarnResult<ReplaceInfo> _validateReplaceDictionary(const PlistValue& root,
+                                                              const FileURL& url);
     // Finishes or rolls back every replacement a previous run left behind.
+    // Start-up only, before requests are served: it takes no lock.
     TarnStatus _recoverFromReplaceOperationsWithError();
+
+    // ---- Wiping a data container (TarnClientConnectionWipe.cc) ----
+
+    // Swaps a fresh container in for the data container `identity` (null: no
+    // identifier), keeping its path and UUID; the old contents go to death
+    // row and a deletion pass starts. A caller that is not unrestricted may
+    // wipe only plug-in data containers named in its wipe entitlement.
+    // Sets allowOtherIdLookup for the rest of the request.
+    TarnStatus deleteDataContainerContentWithContainerIdentity(
+        const TarnContainerIdentityRef& identity);
 
     static DispatchQueueRef _sharedBackgroundQueue();
 

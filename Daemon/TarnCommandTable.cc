@@ -8,6 +8,7 @@
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnGroupCommands.h"
 #include "Daemon/TarnMigrationCommands.h"
+#include "Daemon/TarnReplaceCommands.h"
 #include "Daemon/TarnTestLocks.h"
 
 namespace tarn {
@@ -25,7 +26,7 @@ constexpr const char* kAllowed = kTarnEntitlementAllowed;
 const TarnCommandTableRow gTarnCommandTable[kTarnCommandCount] = {
     {.command = 0, .handler = TarnHandleCreateOrLookupCommand, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // create or look up a container
     {.command = 1, .handler = TarnHandleContainersWithClassCommand, .entitlement = kAllowed, .lookupAllowed = 1},  // list the containers of a class
-    {.command = 2, .entitlement = kAllowed},  // replace one container by another
+    {.command = 2, .handler = TarnHandleReplaceCommand, .entitlement = kAllowed},  // replace one container by another
     {.command = 3, .handler = TarnHandleStageForDeleteCommand, .entitlement = kAllowed},  // stage containers for deletion
     {.command = 4, .handler = TarnHandleDeleteDeathRowCommand, .entitlement = kTarnEntitlementUserManagedAssets, .replyOnReturn = 0},  // delete death row
     {.command = 5, .handler = TarnHandleSetInfoValueCommand, .entitlement = kAllowed},  // set a metadata info value
@@ -34,8 +35,8 @@ const TarnCommandTableRow gTarnCommandTable[kTarnCommandCount] = {
     {.command = 8, .handler = TarnHandleRecreateStructureCommand, .entitlement = kAllowed},  // recreate the default structure
     {.command = 9, .handler = TarnHandleRegenerateUUIDCommand, .entitlement = kAllowed},  // new directory UUID
     {.command = 10, .handler = TarnHandleDeleteContainerCommand, .entitlement = kAllowed},  // delete a container
-    {.command = 11, .entitlement = kTarnEntitlementWipeContainer},  // wipe an entitled data container
-    {.command = 12, .entitlement = kTarnEntitlementDeleteContainerContent},  // wipe any container
+    {.command = 11, .handler = TarnHandleWipeContainerCommand, .entitlement = kTarnEntitlementWipeContainer},  // wipe an entitled data container
+    {.command = 12, .handler = TarnHandleWipeAnyContainerCommand, .entitlement = kTarnEntitlementDeleteContainerContent},  // wipe any container
     {.command = 13, .handler = TarnHandleGroupContainersCommand, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // the client's group containers
     {.command = 14, .handler = TarnHandleGroupIdentifiersCommand, .entitlement = kAllowed, .lookupAllowed = 1},  // group identifiers of an owner
     {.command = 15, .handler = TarnHandleSystemContainerPathCommand, .entitlement = kAllowed, .anyClient = 1, .lookupAllowed = 1},  // path of a system container

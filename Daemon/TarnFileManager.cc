@@ -524,6 +524,21 @@ TarnStatus TarnFileManager::renameItemAtURL(const FileURL& url, const FileURL& t
     return TARN_POSIX_ERROR(err, "rename of %@ to %@ failed: %s", url, toURL, errText(err));
 }
 
+TarnStatus TarnFileManager::exchangeItemAtURL(const FileURL& url, const FileURL& withURL) {
+    int err = 0;
+    if (auto fp = TARN_FAILPOINT("fm.exchange"))
+        err = *fp;
+    else
+        err = FsRenameExchange(url, withURL);
+    if (err == 0) return {};
+    return TARN_POSIX_ERROR(err, "exchange of %@ and %@ failed: %s", url, withURL, errText(err));
+}
+
+bool TarnFileManager::exchangeIsUnsupported(const TarnErrorRef& error) {
+    const int err = error ? error->posixCode() : 0;
+    return err == EINVAL || err == ENOSYS || err == EOPNOTSUPP;
+}
+
 TarnStatus TarnFileManager::_moveItemAtURL(const FileURL& url, const FileURL& toURL,
                                            bool failIfSrcMissing) {
     if (!failIfSrcMissing) {

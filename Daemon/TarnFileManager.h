@@ -202,6 +202,11 @@ public:
     // than copy. For an item whose removal failed, a copy would only leave a
     // second one behind.
     TarnStatus renameItemAtURL(const FileURL& url, const FileURL& toURL);
+    // The two items trade places in one step (both must exist). POSIX errors;
+    // EINVAL, ENOSYS or EOPNOTSUPP where the file system cannot do it
+    // (exchangeIsUnsupported()), and nothing has moved then.
+    TarnStatus exchangeItemAtURL(const FileURL& url, const FileURL& withURL);
+    static bool exchangeIsUnsupported(const TarnErrorRef& error);
     // Recursive copy: data, mode, owner, times, xattrs, ACLs; links as links.
     TarnStatus copyItemAtURL(const FileURL& url, const FileURL& toURL);
     TarnStatus copyItemIfExistsAtURL(const FileURL& url, const FileURL& toURL);

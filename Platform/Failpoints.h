@@ -47,6 +47,21 @@ inline constexpr const char* kFailpointNames[] = {
     // the Nth step run), a restored item whose destination cannot be removed
     "daemon.startup.step",
     "boot.restore.removeTarget",
+    // Replacement (TarnClientConnectionReplace.cc): each names the step it
+    // stands before, so "kill" there dies between two steps and "errno:N"
+    // fails that step. "fm.exchange" is the facade's two-way rename.
+    "fm.exchange",
+    "replace.writeFile",
+    "replace.uncacheOld",
+    "replace.invalidate",
+    "replace.park",
+    "replace.moveNew",
+    "replace.uncacheNew",
+    "replace.cacheNew",
+    "replace.discardStaging",
+    "replace.discardFile",
+    "replace.recover.restore",
+    "replace.recover.discard",
 };
 
 bool FailpointIsKnown(std::string_view name);

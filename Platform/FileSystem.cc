@@ -267,6 +267,12 @@ int FsRename(const std::string& from, const std::string& to) {
     return ::rename(from.c_str(), to.c_str()) == 0 ? 0 : errnoOr(EIO);
 }
 
+int FsRenameExchange(const std::string& first, const std::string& second) {
+    return ::renameat2(AT_FDCWD, first.c_str(), AT_FDCWD, second.c_str(), RENAME_EXCHANGE) == 0
+               ? 0
+               : errnoOr(EIO);
+}
+
 int FsUnlinkAt(int dirFd, const std::string& name, bool directory) {
     return ::unlinkat(dirFd, name.c_str(), directory ? AT_REMOVEDIR : 0) == 0 ? 0 : errnoOr(EIO);
 }

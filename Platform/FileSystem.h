@@ -83,6 +83,10 @@ int FsMakePath(const std::string& path, mode_t mode, bool* created = nullptr);
 // `pathTemplate` ends in XXXXXX, replaced in place.
 int FsMkdtemp(std::string* pathTemplate);
 int FsRename(const std::string& from, const std::string& to);
+// renameat2(2) with RENAME_EXCHANGE: both names must exist and trade places
+// in one step. EINVAL / ENOSYS / EOPNOTSUPP where the file system (or the
+// kernel) cannot exchange.
+int FsRenameExchange(const std::string& first, const std::string& second);
 int FsUnlinkAt(int dirFd, const std::string& name, bool directory);
 // Opens a directory without following a final link.
 int FsOpenDirectory(const std::string& path, FsFd* fd);
