@@ -41,6 +41,8 @@ inline constexpr const char* kFailpointNames[] = {
     "fm.setOwner",
     // Daemon start-up (tests of requests that arrive during start-up)
     "daemon.startup",
+    // Kernel upcall: one container of an upcall that cannot be made
+    "upcall.createOrLookup",
 };
 
 bool FailpointIsKnown(std::string_view name);
