@@ -26,6 +26,17 @@ int fail(std::string* why, std::string reason, int fd = -1) {
     return -1;
 }
 
+bool socketAddress(const std::string& path, struct sockaddr_un* addr, std::string* why) {
+    *addr = {};
+    addr->sun_family = AF_UNIX;
+    if (path.empty() || path.size() >= sizeof addr->sun_path) {
+        if (why) *why = Format("socket path too long: %s", path);
+        return false;
+    }
+    std::memcpy(addr->sun_path, path.data(), path.size());
+    return true;
+}
+
 }  // namespace
 
 int TakeActivatedSocket(const std::string& path, int type) {
@@ -46,11 +57,8 @@ int TakeActivatedSocket(const std::string& path, int type) {
 }
 
 int BindListeningSocket(const std::string& path, int type, mode_t mode, std::string* why) {
-    struct sockaddr_un addr = {};
-    addr.sun_family = AF_UNIX;
-    if (path.empty() || path.size() >= sizeof addr.sun_path)
-        return fail(why, Format("socket path too long: %s", path));
-    std::memcpy(addr.sun_path, path.data(), path.size());
+    struct sockaddr_un addr;
+    if (!socketAddress(path, &addr, why)) return -1;
 
     std::error_code ec;
     std::filesystem::create_directories(std::filesystem::path(path).parent_path(), ec);
@@ -78,6 +86,19 @@ int BindListeningSocket(const std::string& path, int type, mode_t mode, std::str
         (void)::unlink(path.c_str());  // ours, just made
         return fail(why, reason, fd);
     }
+    return fd;
+}
+
+int ConnectUnixSocket(const std::string& path, int type, std::string* why) {
+    struct sockaddr_un addr;
+    if (!socketAddress(path, &addr, why)) return -1;
+    const int fd = ::socket(AF_UNIX, type | SOCK_CLOEXEC, 0);
+    if (fd < 0) return fail(why, Format("socket: %s", std::strerror(errno)));
+    int r;
+    do {
+        r = ::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+    } while (r != 0 && errno == EINTR);
+    if (r != 0) return fail(why, Format("connect %s: %s", path, std::strerror(errno)), fd);
     return fd;
 }
 

@@ -1,5 +1,6 @@
-// Listening Unix sockets of the daemon's services: the ones systemd hands
-// over (socket activation) and the ones the daemon binds itself.
+// Unix sockets of the daemon's services: the listening ones systemd hands
+// over (socket activation), the ones the daemon binds itself, and the
+// client's end.
 //
 // A unit may hand over several sockets; each service takes its own by the
 // path it is bound to, so the order of the unit's Listen lines does not
@@ -23,5 +24,9 @@ int TakeActivatedSocket(const std::string& path, int type);
 // at the path by an earlier run is replaced, a live one (or any other file)
 // is not. -1 with a reason on failure.
 int BindListeningSocket(const std::string& path, int type, mode_t mode, std::string* why);
+
+// A blocking, close-on-exec Unix socket of `type` connected to `path`; -1
+// with a reason on failure.
+int ConnectUnixSocket(const std::string& path, int type, std::string* why);
 
 }  // namespace tarn

@@ -4,7 +4,6 @@
 #include <poll.h>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <atomic>
@@ -171,19 +170,8 @@ std::optional<DecodedReply> DecodeReplyDatagram(std::span<const uint8_t> datagra
 
 std::unique_ptr<UpcallClient> UpcallClient::connect(const std::string& socketPath,
                                                     std::string* why) {
-    struct sockaddr_un addr = {};
-    addr.sun_family = AF_UNIX;
-    if (socketPath.empty() || socketPath.size() >= sizeof addr.sun_path) {
-        if (why) *why = Format("socket path too long: %s", socketPath);
-        return nullptr;
-    }
-    std::memcpy(addr.sun_path, socketPath.data(), socketPath.size());
-    const int fd = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0);
-    if (fd < 0 || ::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
-        if (why) *why = Format("connect %s: %s", socketPath, std::strerror(errno));
-        if (fd >= 0) ::close(fd);
-        return nullptr;
-    }
+    const int fd = ConnectUnixSocket(socketPath, SOCK_SEQPACKET, why);
+    if (fd < 0) return nullptr;
     return std::unique_ptr<UpcallClient>(new UpcallClient(fd));
 }
 
