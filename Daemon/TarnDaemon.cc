@@ -10,6 +10,7 @@
 #include "Daemon/TarnClientConnection.h"
 #include "Daemon/TarnExceptionFence.h"
 #include "Daemon/TarnGlobalConfiguration.h"
+#include "Daemon/TarnKernServer.h"
 #include "Daemon/TarnLog.h"
 #include "Platform/ContainerLibrary.h"
 #include "Platform/Failpoints.h"
@@ -119,7 +120,8 @@ void TEST_resetLockState() {
     gSavedLockState = 3;
 }
 
-void TarnDaemonStartupWork(const std::function<void()>& onFinished) {
+void TarnDaemonStartupWork(const DispatchQueueRef& listenerQueue,
+                           const std::function<void()>& onFinished) {
     SignpostInterval startingUp("conduit", "StartingUp");
     (void)TARN_FAILPOINT("daemon.startup");  // only ever stalls: tests of early requests
     auto& config = TarnGlobalConfiguration::sharedInstance();
@@ -153,7 +155,11 @@ void TarnDaemonStartupWork(const std::function<void()>& onFinished) {
         SignpostInterval bootSetup("startup", "BootSetup");
         runStartupStep("keeperSetup", [&] { shared.keeperSetup(); });
     }
-    // The kernel upcall service starts here once it exists on this platform.
+    if (!TarnKernServerStart(listenerQueue)) {
+        PlatformLogWrite("daemon", PlatformLogType::Fault,
+                         "Failed to initialize kernel upcall interface.");
+        std::abort();
+    }
 
     if (int status = LockStateRegister(TarnLockStateCallback); status != 0) {
         TarnLog(kLogError, kInitTag, "notify_register_dispatch for notification \"%s\" failed; returned %d\n",

@@ -9,9 +9,11 @@
 
 namespace tarn {
 
-// Runs the start-up work (log, queues, boot set-up, lock state, clean-ups).
+// Runs the start-up work (log, queues, boot set-up, kernel upcall service,
+// lock state, clean-ups) on `listenerQueue`, which the upcall queue targets.
 // `onFinished` runs at its very end (readiness notification).
-void TarnDaemonStartupWork(const std::function<void()>& onFinished);
+void TarnDaemonStartupWork(const DispatchQueueRef& listenerQueue,
+                           const std::function<void()>& onFinished);
 
 DispatchQueueRef TarnDeathRowQueue();   // "com.ostrea.tarnkeeperd.deathrow"
 DispatchQueueRef TarnLockStateQueue();  // "com.ostrea.tarnkeeperd.lockstate"

@@ -62,8 +62,8 @@ int main(int argc, char** argv) {
 
     auto listenerQueue = DispatchQueue::createSerial("com.ostrea.tarnkeeperd.listener");
     Transaction::begin();
-    listenerQueue->async([] {
-        TarnDaemonStartupWork([] { ServiceNotifyReady(); });
+    listenerQueue->async([listenerQueue] {
+        TarnDaemonStartupWork(listenerQueue, [] { ServiceNotifyReady(); });
         Transaction::end();
     });
 

@@ -21,6 +21,7 @@
 #include "Platform/ConduitSocket.h"
 #include "Platform/ConduitWire.h"
 #include "Platform/Format.h"
+#include "Platform/ListeningSocket.h"
 #include "Platform/PlatformLog.h"
 #include "Platform/RootPrefix.h"
 
@@ -634,65 +635,22 @@ std::shared_ptr<Listener> failCreate(std::string* why, std::string reason, int f
 
 std::shared_ptr<Listener> Listener::create(const std::string& serviceName, DispatchQueueRef queue,
                                            std::string* why) {
-    const int n = ::sd_listen_fds(1);
-    if (n > 0) {
-        const int fd = SD_LISTEN_FDS_START;
-        if (::sd_is_socket_unix(fd, SOCK_SEQPACKET, 1, nullptr, 0) <= 0)
-            return failCreate(why, "socket handed over by systemd is not a listening "
-                                   "SOCK_SEQPACKET Unix socket");
-        (void)::fcntl(fd, F_SETFD, FD_CLOEXEC);  // best effort; children never need it
-        const int flags = ::fcntl(fd, F_GETFL);
-        if (flags < 0 || ::fcntl(fd, F_SETFL, flags | O_NONBLOCK) != 0)
-            return failCreate(why, Format("fcntl: %s", std::strerror(errno)));
-        struct sockaddr_un addr = {};
-        socklen_t len = sizeof addr;
-        std::string path;
-        if (::getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len) == 0 &&
-            len > offsetof(sockaddr_un, sun_path))
-            path.assign(addr.sun_path, strnlen(addr.sun_path, sizeof addr.sun_path));
+    // systemd may hand over the upcall socket too: take ours by its path.
+    const std::string path = ServiceSocketPath(serviceName);
+    if (const int fd = TakeActivatedSocket(path, SOCK_SEQPACKET); fd >= 0) {
         auto l = std::make_shared<Listener>(PrivateTag{}, fd, path, false, std::move(queue));
         l->io_->owner = l;
         return l;
     }
-    return createAtPath(ServiceSocketPath(serviceName), std::move(queue), why);
+    return createAtPath(path, std::move(queue), why);
 }
 
 std::shared_ptr<Listener> Listener::createAtPath(const std::string& path, DispatchQueueRef queue,
                                                  std::string* why) {
-    struct sockaddr_un addr = {};
-    addr.sun_family = AF_UNIX;
-    if (path.empty() || path.size() >= sizeof addr.sun_path)
-        return failCreate(why, Format("socket path too long: %s", path));
-    std::memcpy(addr.sun_path, path.data(), path.size());
-
-    std::error_code ec;
-    std::filesystem::create_directories(std::filesystem::path(path).parent_path(), ec);
-    if (ec) return failCreate(why, Format("cannot create %s: %s", path, ec.message()));
-
-    struct stat st;
-    if (::lstat(path.c_str(), &st) == 0) {
-        if (!S_ISSOCK(st.st_mode))
-            return failCreate(why, Format("%s exists and is not a socket", path));
-        // A stale socket from an earlier run is replaced; a live one is not.
-        const int probe = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0);
-        const bool live =
-            probe >= 0 && ::connect(probe, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
-        sock::CloseFd(probe);
-        if (live) return failCreate(why, Format("another process is listening on %s", path));
-        if (::unlink(path.c_str()) != 0 && errno != ENOENT)
-            return failCreate(why, Format("unlink %s: %s", path, std::strerror(errno)));
-    }
-
-    const int fd = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
-    if (fd < 0) return failCreate(why, Format("socket: %s", std::strerror(errno)));
-    if (::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0)
-        return failCreate(why, Format("bind %s: %s", path, std::strerror(errno)), fd);
     // Any local process may ask; what it may do is decided by its entitlements.
-    if (::chmod(path.c_str(), 0666) != 0 || ::listen(fd, SOMAXCONN) != 0) {
-        const std::string reason = Format("listen %s: %s", path, std::strerror(errno));
-        (void)::unlink(path.c_str());  // ours, just made
-        return failCreate(why, reason, fd);
-    }
+    std::string reason;
+    const int fd = BindListeningSocket(path, SOCK_SEQPACKET, 0666, &reason);
+    if (fd < 0) return failCreate(why, std::move(reason));
     auto l = std::make_shared<Listener>(PrivateTag{}, fd, path, true, std::move(queue));
     l->io_->owner = l;
     return l;

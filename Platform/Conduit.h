@@ -224,7 +224,7 @@ class Listener : public std::enable_shared_from_this<Listener> {
 
 public:
     // Socket at ServiceSocketPath(serviceName), or the socket systemd hands
-    // over (sd_listen_fds, fd 3) when present. nullptr + reason on failure.
+    // over for that path when present. nullptr + reason on failure.
     static std::shared_ptr<Listener> create(const std::string& serviceName,
                                             DispatchQueueRef queue, std::string* why = nullptr);
     // Same on an explicit socket path (tests, tools).

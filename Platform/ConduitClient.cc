@@ -11,6 +11,7 @@
 #include "Platform/ConduitSocket.h"
 #include "Platform/ConduitWire.h"
 #include "Platform/Format.h"
+#include "Platform/ListeningSocket.h"
 
 namespace tarn::conduit {
 
@@ -34,27 +35,8 @@ Client::Client(PrivateTag, int fd) : fd_(fd), assembly_(std::make_unique<Assembl
 Client::~Client() { sock::CloseFd(fd_); }
 
 std::unique_ptr<Client> Client::connect(const std::string& socketPath, std::string* why) {
-    struct sockaddr_un addr = {};
-    addr.sun_family = AF_UNIX;
-    if (socketPath.empty() || socketPath.size() >= sizeof addr.sun_path) {
-        if (why) *why = Format("socket path too long: %s", socketPath);
-        return nullptr;
-    }
-    std::memcpy(addr.sun_path, socketPath.data(), socketPath.size());
-    const int fd = ::socket(AF_UNIX, SOCK_SEQPACKET | SOCK_CLOEXEC, 0);
-    if (fd < 0) {
-        if (why) *why = Format("socket: %s", std::strerror(errno));
-        return nullptr;
-    }
-    int r;
-    do {
-        r = ::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
-    } while (r != 0 && errno == EINTR);
-    if (r != 0) {
-        if (why) *why = Format("connect %s: %s", socketPath, std::strerror(errno));
-        sock::CloseFd(fd);
-        return nullptr;
-    }
+    const int fd = ConnectUnixSocket(socketPath, SOCK_SEQPACKET, why);
+    if (fd < 0) return nullptr;
     return std::make_unique<Client>(PrivateTag{}, fd);
 }
 

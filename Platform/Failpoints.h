@@ -62,6 +62,8 @@ inline constexpr const char* kFailpointNames[] = {
     "replace.discardFile",
     "replace.recover.restore",
     "replace.recover.discard",
+    // Kernel upcall: one container of an upcall that cannot be made
+    "upcall.createOrLookup",
 };
 
 bool FailpointIsKnown(std::string_view name);

@@ -79,6 +79,22 @@ std::string PersonaAttributes::description() const {
                   typeName, personaID, uniqueString, bundleIDs.size(), layoutPath);
 }
 
+uint32_t PersonaAttributes::kernelPersonaType() const {
+    switch (kind) {
+        case Kind::Personal:
+            return kKernelPersonaTypePersonal;
+        case Kind::Enterprise:
+            return kKernelPersonaTypeEnterprise;
+        case Kind::System:
+            return kKernelPersonaTypeSystem;
+        case Kind::Universal:
+            return kKernelPersonaTypeUniversal;
+        case Kind::Other:
+            return kKernelPersonaTypeOther;
+    }
+    return kKernelPersonaTypeOther;
+}
+
 std::string PersonaListDescription(const std::optional<PersonaAttributesList>& list) {
     if (!list) return "(null)";
     std::string out = "(";
@@ -115,6 +131,15 @@ PersonaAttributesRef PersonaRoster::personaInfoForPersonaID(uint32_t personaID) 
         if (p && p->personaID == personaID) return p;
     }
     return nullptr;
+}
+
+std::optional<KernelPersonaInfo> PersonaRoster::kernelPersonaInfo(uint32_t personaID,
+                                                                  uint32_t version) {
+    if (version != KernelPersonaInfo::kVersion) return std::nullopt;
+    PersonaAttributesRef persona = personaInfoForPersonaID(personaID);
+    if (!persona) return std::nullopt;
+    return KernelPersonaInfo{
+        .version = version, .personaID = personaID, .type = persona->kernelPersonaType()};
 }
 
 PersonaAttributesRef PersonaRoster::currentPersona(const std::optional<std::string>& unique) {

@@ -38,6 +38,25 @@
 
 namespace tarn {
 
+// The kernel's persona type numbers (what its persona information query
+// answers), by kind of persona.
+enum KernelPersonaType : uint32_t {
+    kKernelPersonaTypePersonal = 1,
+    kKernelPersonaTypeEnterprise = 2,
+    kKernelPersonaTypeOther = 3,  // any kind this list does not name
+    kKernelPersonaTypeSystem = 4,
+    kKernelPersonaTypeUniversal = 5,
+};
+
+// The kernel's persona information record; only the version this layer
+// answers exists.
+struct KernelPersonaInfo {
+    static constexpr uint32_t kVersion = 1;
+    uint32_t version = kVersion;
+    uint32_t personaID = 0;
+    uint32_t type = kKernelPersonaTypeOther;
+};
+
 struct PersonaAttributes {
     enum class Kind { Personal, Enterprise, Universal, System, Other };
 
@@ -57,6 +76,7 @@ struct PersonaAttributes {
     const std::vector<std::string>& userPersonaBundleIDList() const { return bundleIDs; }
     const std::optional<FileURL>& personaLayoutPathURL() const { return layoutPath; }
 
+    uint32_t kernelPersonaType() const;
     std::string description() const;
 
     // Parses one entry of the list file; nullopt (reason in *why) when malformed.
@@ -87,6 +107,10 @@ public:
     virtual std::optional<PersonaAttributesList> listAllPersonaWithAttributes() = 0;
     // Kernel persona information by persona id; nullptr when unknown.
     virtual PersonaAttributesRef personaInfoForPersonaID(uint32_t personaID);
+    // The kernel's information record of a persona, as a structure of
+    // `version`; nullopt when the persona is unknown or the version is not
+    // KernelPersonaInfo::kVersion.
+    std::optional<KernelPersonaInfo> kernelPersonaInfo(uint32_t personaID, uint32_t version);
     // The persona a request acts for: the list entry whose unique string is
     // the request's (the peer's, see TarnRequestContext); nullptr when the
     // request names none or the list does not know it.

@@ -5,8 +5,8 @@
 // replace file was left, recovery itself is killed twice (before its restore
 // rename, then before discarding the file) before a clean start. Then either
 // the old container is back at its path with its contents, or the new one is
-// at the destination and the old contents are nowhere but in staging (which
-// the boot clean-up discards), and no replace file is left.
+// at the destination and the old contents are gone once the start's clean-up
+// has run, and no replace file is left.
 #include <gtest/gtest.h>
 
 #include <chrono>

@@ -42,5 +42,6 @@ using SubcommandSetup = void (*)(CLI::App& app, Options& options);
 std::optional<tarn::PlistValue> SendRequest(Options& options, const tarn::PlistValue& request);
 
 void SetupSendCommand(CLI::App& app, Options& options);
+void SetupUpcallCommand(CLI::App& app, Options& options);  // Upcall.cc
 
 }  // namespace tarnctl
