@@ -119,7 +119,9 @@ std::vector<uint8_t> EncodeReplyDatagram(const ReplyMessage& reply) {
 }
 
 std::vector<uint8_t> EncodeRequestDatagram(std::span<const uint8_t> packBuffer, int32_t id) {
-    std::vector<uint8_t> out(kRequestMessageSize, 0);
+    // Sized once: an insert after the header trips a false array-bounds
+    // warning of GCC 12 at -O2.
+    std::vector<uint8_t> out(kRequestMessageSize + packBuffer.size(), 0);
     uint8_t* h = out.data();
     const auto size = static_cast<uint32_t>(packBuffer.size());
     StoreU32(h + kOffsetBits, kComplexBit);
@@ -132,7 +134,7 @@ std::vector<uint8_t> EncodeRequestDatagram(std::span<const uint8_t> packBuffer, 
     StoreU32(h + kOffsetDescriptorSize, size);
     StoreDataRepresentation(h + kOffsetDataRepresentation);
     StoreU32(h + kOffsetDataCount, size);
-    out.insert(out.end(), packBuffer.begin(), packBuffer.end());
+    if (!packBuffer.empty()) std::memcpy(h + kRequestMessageSize, packBuffer.data(), size);
     return out;
 }
 
