@@ -42,5 +42,7 @@ using SubcommandSetup = void (*)(CLI::App& app, Options& options);
 std::optional<tarn::PlistValue> SendRequest(Options& options, const tarn::PlistValue& request);
 
 void SetupSendCommand(CLI::App& app, Options& options);
+// Tools/tarnctl/Verify.cc
+void SetupVerifyCommand(CLI::App& app, Options& options);
 
 }  // namespace tarnctl

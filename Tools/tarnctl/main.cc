@@ -12,12 +12,10 @@ namespace {
 
 // Every subcommand, in the order --help lists them. Add a line per new file.
 constexpr SubcommandSetup kSubcommands[] = {
-    SetupSendCommand,
-    SetupContainerCommands,
-    SetupLockCommands,
-    SetupWaitNotificationCommand,
-    SetupSimulateRebootCommand,
-    SetupSandboxItemsCommand,
+    SetupSendCommand,           SetupContainerCommands,
+    SetupLockCommands,          SetupWaitNotificationCommand,
+    SetupSimulateRebootCommand, SetupSandboxItemsCommand,
+    SetupVerifyCommand,
 };
 
 constexpr const char* kFooter = R"(JSON mapping (both ways):
