@@ -8,25 +8,19 @@
 
 #include "Daemon/TarnConsistencyChecker.h"
 #include "Daemon/TarnError.h"
-#include "Daemon/TarnUserIdentityCache.h"
-#include "Platform/Failpoints.h"
 #include "Platform/RootPrefix.h"
-#include "support/DaemonHarness.h"
+#include "support/CrashTest.h"
 
 namespace tarn {
 namespace {
 
 namespace fs = std::filesystem;
 
-class ConsistencyCheckerTest : public test::ScratchRootTest {
+class ConsistencyCheckerTest : public test::CrashTest {
   protected:
     void SetUp() override {
-        TARN_REQUIRE_DAEMON_BINARIES();
-        TARN_REQUIRE_ROOT();
-        TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
-        FailpointClearAll();
-        daemon_ = std::make_unique<test::DaemonHarness>(root_);
-        admin_ = daemon_->addPrivilegedClient();
+        CrashTest::SetUp();
+        if (IsSkipped()) return;
         daemon_->start();
         for (const char* id : {"com.check.a", "com.check.b"}) {
             auto r = daemon_->send(admin_, std::string(R"({"Command": 0, "ContainerClass": 2, )") +
@@ -38,10 +32,6 @@ class ConsistencyCheckerTest : public test::ScratchRootTest {
         }
         daemon_->stop();
     }
-    void TearDown() override {
-        if (daemon_) daemon_->kill9();
-        TarnUserIdentityCache::TEST_setPersonasAreSupported(std::nullopt);
-    }
     // Whether some violation names `path` (as the report prints it).
     static bool names(const TarnConsistencyReport& r, const std::string& path) {
         for (const auto& v : r.violations)
@@ -49,8 +39,6 @@ class ConsistencyCheckerTest : public test::ScratchRootTest {
         return false;
     }
 
-    std::unique_ptr<test::DaemonHarness> daemon_;
-    std::string admin_;
     std::vector<std::string> paths_;
 };
 

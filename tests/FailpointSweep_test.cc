@@ -15,16 +15,12 @@
 
 #include "Daemon/TarnConsistencyChecker.h"
 #include "Daemon/TarnError.h"
-#include "Daemon/TarnUserIdentityCache.h"
-#include "Platform/Failpoints.h"
-#include "support/DaemonHarness.h"
+#include "support/CrashTest.h"
 
 namespace tarn {
 namespace {
 
 namespace fs = std::filesystem;
-using test::DaemonHarness;
-
 class FailpointSweepTest;
 
 // One mutating operation.
@@ -37,28 +33,12 @@ struct SweepRow {
     void (*check)(FailpointSweepTest& t, const std::string& id, uint64_t reply);
 };
 
-class FailpointSweepTest : public test::ScratchRootTest,
-                           public ::testing::WithParamInterface<SweepRow> {
+class FailpointSweepTest : public test::CrashTest, public ::testing::WithParamInterface<SweepRow> {
   public:
-    void SetUp() override {
-        TARN_REQUIRE_DAEMON_BINARIES();
-        TARN_REQUIRE_ROOT();
-        TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
-        FailpointClearAll();
-        daemon_ = std::make_unique<DaemonHarness>(root_);
-        admin_ = daemon_->addPrivilegedClient();
-    }
-    void TearDown() override {
-        if (daemon_) daemon_->kill9();
-        TarnUserIdentityCache::TEST_setPersonasAreSupported(std::nullopt);
-    }
+    using CrashTest::errorOf;
 
     std::optional<PlistValue> send(const std::string& json) { return daemon_->send(admin_, json); }
     uint64_t ask(const std::string& json) { return daemon_->sendError(admin_, json); }
-    static uint64_t errorOf(const std::optional<PlistValue>& r) {
-        const PlistValue* e = r ? r->find("ReplyError") : nullptr;
-        return e ? e->asUInt64().value_or(0) : 0;
-    }
     static std::string stringOf(const std::optional<PlistValue>& r, const char* key) {
         const PlistValue* v = r ? r->find(key) : nullptr;
         return v && v->asString() ? *v->asString() : std::string();
@@ -162,8 +142,6 @@ class FailpointSweepTest : public test::ScratchRootTest,
                   << " violations\n";
     }
 
-    std::unique_ptr<DaemonHarness> daemon_;
-    std::string admin_;
     int cases_ = 0;
     int recoveryCrashes_ = 0;
     size_t violations_ = 0;

@@ -20,14 +20,10 @@
 
 #include "Daemon/TarnConsistencyChecker.h"
 #include "Daemon/TarnError.h"
-#include "Daemon/TarnUserIdentityCache.h"
-#include "Platform/Failpoints.h"
-#include "support/DaemonHarness.h"
+#include "support/CrashTest.h"
 
 namespace tarn {
 namespace {
-
-using test::DaemonHarness;
 
 constexpr int kClients = 4;
 constexpr int kIdentifiersPerClient = 4;
@@ -35,25 +31,8 @@ constexpr int kIdentifiersPerClient = 4;
 // What the replies said about one identifier.
 enum class Known { Nothing, Created, Deleted };
 
-class KillSoakTest : public test::ScratchRootTest {
+class KillSoakTest : public test::CrashTest {
   protected:
-    void SetUp() override {
-        TARN_REQUIRE_DAEMON_BINARIES();
-        TARN_REQUIRE_ROOT();
-        TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
-        FailpointClearAll();
-        daemon_ = std::make_unique<DaemonHarness>(root_);
-        admin_ = daemon_->addPrivilegedClient();
-    }
-    void TearDown() override {
-        if (daemon_) daemon_->kill9();
-        TarnUserIdentityCache::TEST_setPersonasAreSupported(std::nullopt);
-    }
-
-    static uint64_t errorOf(const std::optional<PlistValue>& r) {
-        const PlistValue* e = r ? r->find("ReplyError") : nullptr;
-        return e ? e->asUInt64().value_or(0) : 0;
-    }
     static std::string identifier(int client, int i) {
         return "com.soak.c" + std::to_string(client) + "." + std::to_string(i);
     }
@@ -103,8 +82,6 @@ class KillSoakTest : public test::ScratchRootTest {
         return ids;
     }
 
-    std::unique_ptr<DaemonHarness> daemon_;
-    std::string admin_;
     std::mutex mu_;
     std::map<std::string, Known> known_;
 };
