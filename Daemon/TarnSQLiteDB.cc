@@ -4,8 +4,10 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 
 #include "Daemon/TarnExceptionFence.h"
+#include "Platform/Failpoints.h"
 #include "Platform/PlatformLog.h"
 
 namespace tarn {
@@ -128,6 +130,27 @@ sqlite3* TarnSQLiteDB::openDBWithURL(const FileURL& url) {
     }
     TarnLog(kLogDebug, "openDBWithURL", "opening %@", url);
     return db;
+}
+
+std::vector<std::string> TarnSQLiteDB::integrityProblemsAtURL(const FileURL& url) {
+    std::vector<std::string> problems;
+    sqlite3* db = nullptr;
+    int rc = sqlite3_open_v2(url.c_str(), &db, SQLITE_OPEN_READONLY, nullptr);
+    sqlite3_stmt* statement = nullptr;
+    if (rc == SQLITE_OK)
+        rc = sqlite3_prepare_v2(db, "PRAGMA integrity_check;", -1, &statement, nullptr);
+    while (rc == SQLITE_OK || rc == SQLITE_ROW) {
+        rc = sqlite3_step(statement);
+        if (rc != SQLITE_ROW) break;
+        const auto* line = reinterpret_cast<const char*>(sqlite3_column_text(statement, 0));
+        if (line && std::strcmp(line, "ok") != 0) problems.emplace_back(line);
+    }
+    if (rc != SQLITE_DONE)
+        problems.emplace_back(std::string("cannot be checked: ") +
+                              (db ? sqlite3_errmsg(db) : sqlite3_errstr(rc)));
+    if (statement) sqlite3_finalize(statement);
+    sqlite3_close(db);
+    return problems;
 }
 
 void TarnSQLiteDB::closeDB() {
@@ -311,6 +334,9 @@ TarnErrorRef TarnSQLiteDB::rollbackAfter(TarnErrorRef cause) {
 }
 
 TarnStatus TarnSQLiteDB::commitTransaction() {
+    // A failed commit (a full or failing disk) must leave the store as before.
+    if (auto err = TARN_FAILPOINT("db.commit"))
+        return rollbackAfter(TARN_POSIX_ERROR(*err, "COMMIT of %@", url_));
     TarnStatus committed = _sqliteExec("COMMIT;");
     if (committed.ok()) return {};
     TarnErrorRef e = TARN_ERROR(TarnErrorDatabase, committed.error(), "failed _sqliteExec commit");

@@ -51,6 +51,10 @@ public:
 
     // Opens and initialises the database at `url`; never returns on failure.
     static sqlite3* openDBWithURL(const FileURL& url);
+    // Opens `url` read-only (nothing is created or initialised) and runs
+    // SQLite's integrity check: the problems it lists, empty when the file is
+    // sound. A file that cannot be opened or read as a database is one problem.
+    static std::vector<std::string> integrityProblemsAtURL(const FileURL& url);
     // Closes the handle; later calls fail with TarnErrorDatabase. Also done on
     // destruction.
     void closeDB();

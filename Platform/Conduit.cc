@@ -35,6 +35,9 @@ namespace {
 constexpr size_t kMaxQueuedMessages = 16;
 // Requests that may wait for their reply at once on one connection.
 constexpr size_t kMaxUnansweredRequests = 1024;
+// Open connections one user id may hold at once; past it new ones are closed
+// at accept, so that one user cannot take every descriptor of the daemon.
+constexpr size_t kMaxConnectionsPerUid = 256;
 // How long a send may wait for a peer that does not read.
 constexpr std::chrono::milliseconds kSendTimeout{5000};
 
@@ -299,12 +302,28 @@ void Listener::IoLoop::acceptAll() {
         Connection::Credentials cc{creds->euid, creds->egid, creds->pid, creds->startTime};
         std::function<void(const ConnectionRef&)> h;
         ConnectionRef c;
+        bool overLimit = false;
         {
             MutexLock l(mu);
-            c = std::make_shared<Connection>(Connection::PrivateTag{}, fd, creds->pidfd,
-                                             creds->exeLinkFd, cc, nextSerial++);
-            connections.emplace(c->serial_, c);
-            h = handler;
+            size_t ofUid = 0;
+            for (const auto& [serial, open] : connections)
+                if (open->euid() == creds->euid) ++ofUid;
+            overLimit = ofUid >= kMaxConnectionsPerUid;
+            if (!overLimit) {
+                c = std::make_shared<Connection>(Connection::PrivateTag{}, fd, creds->pidfd,
+                                                 creds->exeLinkFd, cc, nextSerial++);
+                connections.emplace(c->serial_, c);
+                h = handler;
+            }
+        }
+        if (overLimit) {
+            PlatformLog("conduit", PlatformLogType::Error,
+                        "Refusing connection from pid %d: uid %u has %zu connections open",
+                        creds->pid, creds->euid, kMaxConnectionsPerUid);
+            if (creds->pidfd >= 0) sock::CloseFd(creds->pidfd);
+            if (creds->exeLinkFd >= 0) sock::CloseFd(creds->exeLinkFd);
+            sock::CloseFd(fd);
+            continue;
         }
         {
             MutexLock l(c->mu_);

@@ -1,5 +1,6 @@
 #include "Platform/Failpoints.h"
 
+#include <fcntl.h>
 #include <signal.h>
 #include <unistd.h>
 
@@ -27,13 +28,31 @@ struct Registry {
     Mutex mu;
     std::map<std::string, Action, std::less<>> armed GUARDED_BY(mu);
     std::atomic<bool> any{false};
+    // Constant after construction.
+    bool gated = false;
+    int traceFd = -1;
 };
+
+// Opened by SIGUSR2 in a gated process; a plain flag is all a handler may set.
+std::atomic<bool> gGateOpen{false};
+
+void openGate(int) { gGateOpen.store(true, std::memory_order_release); }
 
 bool configure(Registry& r, std::string_view value);
 
 Registry& registry() {
     static Registry* r = [] {
         auto* reg = new Registry;
+        if (std::getenv("TARN_FAILPOINTS_GATE")) {
+            reg->gated = true;
+            struct sigaction sa = {};
+            sa.sa_handler = openGate;
+            ::sigaction(SIGUSR2, &sa, nullptr);
+        }
+        if (const char* trace = std::getenv("TARN_FAILPOINTS_TRACE")) {
+            reg->traceFd = ::open(trace, O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644);
+            reg->any.store(reg->traceFd >= 0);
+        }
         if (const char* env = std::getenv("TARN_FAILPOINTS")) {
             // A malformed variable is a mistake of the tester, not of a client.
             if (!configure(*reg, env)) (void)!::write(2, "TARN_FAILPOINTS: malformed\n", 27);
@@ -94,6 +113,13 @@ std::optional<int> FailpointHit(std::string_view name) {
     assert(FailpointIsKnown(name) && "failpoint missing from kFailpointNames");
     Registry& r = registry();
     if (!r.any.load(std::memory_order_acquire)) return std::nullopt;
+    if (r.gated && !gGateOpen.load(std::memory_order_acquire)) return std::nullopt;
+    if (r.traceFd >= 0) {
+        std::string line(name);
+        line += '\n';
+        // One append per hit; a lost trace line only makes a sweep shorter.
+        (void)!::write(r.traceFd, line.data(), line.size());
+    }
     Action a;
     {
         MutexLock lock(r.mu);
@@ -127,14 +153,14 @@ void FailpointClear(std::string_view name) {
     Registry& r = registry();
     MutexLock lock(r.mu);
     if (auto it = r.armed.find(name); it != r.armed.end()) r.armed.erase(it);
-    r.any.store(!r.armed.empty(), std::memory_order_release);
+    r.any.store(!r.armed.empty() || r.traceFd >= 0, std::memory_order_release);
 }
 
 void FailpointClearAll() {
     Registry& r = registry();
     MutexLock lock(r.mu);
     r.armed.clear();
-    r.any.store(false, std::memory_order_release);
+    r.any.store(r.traceFd >= 0, std::memory_order_release);
 }
 
 namespace {
@@ -156,7 +182,7 @@ bool configure(Registry& r, std::string_view value) {
     }
     MutexLock lock(r.mu);
     r.armed = std::move(parsed);
-    r.any.store(!r.armed.empty(), std::memory_order_release);
+    r.any.store(!r.armed.empty() || r.traceFd >= 0, std::memory_order_release);
     return true;
 }
 

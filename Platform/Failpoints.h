@@ -9,6 +9,13 @@
 // "sleep:MS" stalls the site, then lets it go on. A trailing "@N" fires only
 // on the Nth hit (1-based), e.g. "errno:5@3".
 //
+// Two more variables serve sweeps that arm a daemon child for one request:
+// TARN_FAILPOINTS_GATE (any value) keeps every failpoint dormant, hit counts
+// included, until the process receives SIGUSR2, so that "@N" counts from the
+// request rather than from start-up; TARN_FAILPOINTS_TRACE=FILE appends the
+// name of every hit (after the gate) to FILE, one per line, which tells a
+// sweep where an operation passes.
+//
 //     if (auto err = TARN_FAILPOINT("fm.move")) return fail(*err);
 //
 // Thread-safe; an unarmed failpoint costs one atomic load.
@@ -41,6 +48,8 @@ inline constexpr const char* kFailpointNames[] = {
     "fm.setOwner",
     // Sandbox state (the durable write of a user's table)
     "sandbox.recordChanges",
+    // Code-signing store: before a transaction's COMMIT
+    "db.commit",
     // Daemon start-up (tests of requests that arrive during start-up)
     "daemon.startup",
     // Boot set-up and clean-up: a start-up step that throws (the Nth hit is

@@ -16,37 +16,20 @@
 #include "Daemon/TarnError.h"
 #include "Daemon/TarnMetadata.h"
 #include "Daemon/TarnUserIdentityCache.h"
-#include "Platform/Failpoints.h"
 #include "Tools/tarnctl/Json.h"
-#include "support/DaemonHarness.h"
+#include "support/CrashTest.h"
 
 namespace tarn {
 namespace {
 
 namespace fs = std::filesystem;
-using test::DaemonHarness;
 
 constexpr int kRounds = 5;
 constexpr int kIdentifiers = 6;
 constexpr int kWorkers = 3;
 
-class CreateDeleteCrashTest : public test::ScratchRootTest {
+class CreateDeleteCrashTest : public test::CrashTest {
   protected:
-    void SetUp() override {
-        TARN_REQUIRE_DAEMON_BINARIES();
-        TARN_REQUIRE_ROOT();
-        TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
-        // Arm this process's failpoints now, so that the variable set for the
-        // daemon below is never read here.
-        FailpointClearAll();
-        daemon_ = std::make_unique<DaemonHarness>(root_);
-        admin_ = daemon_->addPrivilegedClient();
-    }
-    void TearDown() override {
-        if (daemon_) daemon_->kill9();
-        TarnUserIdentityCache::TEST_setPersonasAreSupported(std::nullopt);
-    }
-
     void startSlowed() {
         ::setenv("TARN_FAILPOINTS", "fm.move=sleep:15,fm.createDirectory=sleep:2", 1);
         daemon_->start();
@@ -59,10 +42,6 @@ class CreateDeleteCrashTest : public test::ScratchRootTest {
         if (r.exitCode != 0) return std::nullopt;
         std::string why;
         return tarnctl::JsonToPlist(r.out, &why);
-    }
-    static uint64_t errorOf(const std::optional<PlistValue>& reply) {
-        const PlistValue* e = reply ? reply->find("ReplyError") : nullptr;
-        return e ? e->asUInt64().value_or(0) : 0;
     }
     static std::string pathOf(const std::optional<PlistValue>& reply) {
         const PlistValue* p = reply ? reply->find("ReplyPath") : nullptr;
@@ -145,9 +124,6 @@ class CreateDeleteCrashTest : public test::ScratchRootTest {
             EXPECT_TRUE(fs::is_directory(pathOf(made))) << id;
         }
     }
-
-    std::unique_ptr<DaemonHarness> daemon_;
-    std::string admin_;
 };
 
 TEST_F(CreateDeleteCrashTest, KilledDaemonNeverLeavesAHalfBuiltContainerLive) {

@@ -43,5 +43,7 @@ std::optional<tarn::PlistValue> SendRequest(Options& options, const tarn::PlistV
 
 void SetupSendCommand(CLI::App& app, Options& options);
 void SetupUpcallCommand(CLI::App& app, Options& options);  // Upcall.cc
+// Tools/tarnctl/Verify.cc
+void SetupVerifyCommand(CLI::App& app, Options& options);
 
 }  // namespace tarnctl

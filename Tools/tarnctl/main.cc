@@ -16,6 +16,7 @@ constexpr SubcommandSetup kSubcommands[] = {
     SetupLockCommands,          SetupWaitNotificationCommand,
     SetupSimulateRebootCommand, SetupSandboxItemsCommand,
     SetupUpcallCommand,
+    SetupVerifyCommand,
 };
 
 constexpr const char* kFooter = R"(JSON mapping (both ways):

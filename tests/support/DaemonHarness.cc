@@ -188,6 +188,24 @@ void DaemonHarness::kill9() {
     pid_ = -1;
 }
 
+bool DaemonHarness::waitExit(std::chrono::milliseconds timeout) {
+    if (pid_ <= 0) return true;
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    do {
+        int status = 0;
+        if (::waitpid(pid_, &status, WNOHANG) == pid_) {
+            pid_ = -1;
+            return true;
+        }
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    } while (std::chrono::steady_clock::now() < deadline);
+    return false;
+}
+
+void DaemonHarness::signal(int sig) {
+    if (pid_ > 0) ::kill(pid_, sig);
+}
+
 ProcessResult DaemonHarness::tarnctl(const std::string& client, const std::vector<std::string>& args) {
     std::vector<std::string> argv = {client, "--root", root_.path()};
     argv.insert(argv.end(), args.begin(), args.end());

@@ -51,6 +51,11 @@ public:
     // SIGTERM and wait for exit; returns the exit status (or -1).
     int stop();
     void kill9();
+    // Waits up to `timeout` for the daemon to end by itself (a failpoint's
+    // kill); true when it has ended and was reaped.
+    bool waitExit(std::chrono::milliseconds timeout);
+    // Sends `sig` to the running daemon.
+    void signal(int sig);
     bool running() const { return pid_ > 0; }
     pid_t pid() const { return pid_; }
 

@@ -1,0 +1,43 @@
+// Base fixture of the tests that kill, restart and check the daemon: a
+// scratch root, the daemon harness on it (not started), a fully entitled
+// client, personas off. This process's failpoints are cleared first, so that
+// a TARN_FAILPOINTS set for a daemon child is never read here. Skips (from
+// SetUp) when the binaries are not built or the process is not root.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "Daemon/TarnUserIdentityCache.h"
+#include "Platform/Failpoints.h"
+#include "support/DaemonHarness.h"
+
+namespace tarn::test {
+
+class CrashTest : public ScratchRootTest {
+  protected:
+    void SetUp() override {
+        TARN_REQUIRE_DAEMON_BINARIES();
+        TARN_REQUIRE_ROOT();
+        TarnUserIdentityCache::TEST_setPersonasAreSupported(false);
+        FailpointClearAll();
+        daemon_ = std::make_unique<DaemonHarness>(root_);
+        admin_ = daemon_->addPrivilegedClient();
+    }
+    void TearDown() override {
+        if (daemon_) daemon_->kill9();
+        TarnUserIdentityCache::TEST_setPersonasAreSupported(std::nullopt);
+    }
+
+    // "ReplyError" of a reply, 0 when none arrived.
+    static uint64_t errorOf(const std::optional<PlistValue>& reply) {
+        const PlistValue* e = reply ? reply->find("ReplyError") : nullptr;
+        return e ? e->asUInt64().value_or(0) : 0;
+    }
+
+    std::unique_ptr<DaemonHarness> daemon_;
+    std::string admin_;
+};
+
+}  // namespace tarn::test
