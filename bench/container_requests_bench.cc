@@ -93,26 +93,33 @@ sd_bus* openBus(const std::string& address) {
     return bus;
 }
 
-// Appends the five values of a look-up reply.
-int appendLookup(sd_bus_message* m, uint64_t error, int existed, const char* identifier,
-                 const char* path, const void* uuid, size_t uuidSize) {
-    int r = sd_bus_message_append(m, "tbss", error, existed, identifier, path);
-    return r < 0 ? r : sd_bus_message_append_array(m, 'y', uuid, uuidSize);
-}
-
-int onPeerLookup(sd_bus_message* m, void*, sd_bus_error*) {
-    uint64_t error = 0;
-    int existed = 0;
-    const char* identifier = nullptr;
-    const char* path = nullptr;
+// The five values of a look-up reply, as they travel in a D-Bus message
+// (pointers into the message they were read from).
+struct LookupValues {
+    uint64_t error = 1;
+    int existed = 1;
+    const char* identifier = "";
+    const char* path = "";
     const void* uuid = nullptr;
     size_t uuidSize = 0;
-    int r = sd_bus_message_read(m, "tbss", &error, &existed, &identifier, &path);
-    if (r >= 0) r = sd_bus_message_read_array(m, 'y', &uuid, &uuidSize);
+
+    int read(sd_bus_message* m) {
+        int r = sd_bus_message_read(m, "tbss", &error, &existed, &identifier, &path);
+        return r < 0 ? r : sd_bus_message_read_array(m, 'y', &uuid, &uuidSize);
+    }
+    int append(sd_bus_message* m) const {
+        int r = sd_bus_message_append(m, "tbss", error, existed, identifier, path);
+        return r < 0 ? r : sd_bus_message_append_array(m, 'y', uuid, uuidSize);
+    }
+};
+
+int onPeerLookup(sd_bus_message* m, void*, sd_bus_error*) {
+    LookupValues values;
+    int r = values.read(m);
     if (r < 0) return r;
     sd_bus_message* reply = nullptr;
     r = sd_bus_message_new_method_return(m, &reply);
-    if (r >= 0) r = appendLookup(reply, error, existed, identifier, path, uuid, uuidSize);
+    if (r >= 0) r = values.append(reply);
     if (r >= 0) r = sd_bus_send(nullptr, reply, nullptr);
     sd_bus_message_unref(reply);
     return r < 0 ? r : 1;
@@ -163,20 +170,16 @@ struct DBusPeer {
         sd_bus_error error = SD_BUS_ERROR_NULL;
         int r =
             sd_bus_message_new_method_call(bus, &m, kPeerName, kPeerPath, kPeerInterface, "Lookup");
-        if (r >= 0)
-            r = appendLookup(m, 1, 1, identifier.c_str(), path.c_str(), uuid.bytes.data(),
-                             uuid.bytes.size());
+        const LookupValues sent{.identifier = identifier.c_str(),
+                                .path = path.c_str(),
+                                .uuid = uuid.bytes.data(),
+                                .uuidSize = uuid.bytes.size()};
+        if (r >= 0) r = sent.append(m);
         if (r >= 0) r = sd_bus_call(bus, m, 10 * 1000 * 1000, &error, &reply);
         // Read the reply as a client would: all five values.
-        uint64_t code = 0;
-        int existed = 0;
-        const char* id = nullptr;
-        const char* p = nullptr;
-        const void* u = nullptr;
-        size_t n = 0;
-        if (r >= 0) r = sd_bus_message_read(reply, "tbss", &code, &existed, &id, &p);
-        if (r >= 0) r = sd_bus_message_read_array(reply, 'y', &u, &n);
-        if (r < 0 || n != 16)
+        LookupValues got;
+        if (r >= 0) r = got.read(reply);
+        if (r < 0 || got.uuidSize != 16)
             die(std::string("D-Bus call failed: ") +
                 (error.message ? error.message : std::strerror(-r)));
         sd_bus_error_free(&error);
