@@ -3,8 +3,11 @@
 //
 //   1. look-up of an existing container (command 0, no creation) against the
 //      bare SOCK_SEQPACKET echo of the same request record by another process
-//      (as the daemon is one); rounds alternate back to back, pinned to one
-//      CPU and unpinned; medians and ratio;
+//      (as the daemon is one), and against the peer a Linux system service
+//      would be: a D-Bus method call through a private dbus-daemon to another
+//      process (sd-bus on both sides) that takes and returns the five values
+//      of a look-up reply; rounds alternate back to back, pinned to one CPU
+//      and unpinned; medians and ratios;
 //   2. creation of containers (command 0 with "CreateIfNecessary") against the
 //      same file-system work done directly: staging mkdir, metadata written
 //      to a temporary file with fsync, renamed, staging directory fsynced,
@@ -19,8 +22,10 @@
 //   container_requests_bench [CONTAINERS] [LOOKUP_ROUNDS] [lookup|create]
 //
 // With "lookup" or "create" only that part runs, pinned (for profiling).
+// Without dbus-daemon the D-Bus column is left out with a note.
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <systemd/sd-bus.h>
 #include <unistd.h>
 #include <uuid/uuid.h>
 
@@ -70,6 +75,173 @@ double since(Clock::time_point t0) {
     return std::chrono::duration<double, std::micro>(Clock::now() - t0).count();
 }
 
+// ---- the D-Bus peer ----
+
+constexpr const char* kPeerName = "com.ostrea.tarnkeeperd.BenchPeer";
+constexpr const char* kPeerPath = "/com/ostrea/tarnkeeperd/BenchPeer";
+constexpr const char* kPeerInterface = "com.ostrea.tarnkeeperd.BenchPeer";
+// ReplyError, ReplyExisted, ReplyIdentifier, ReplyPath, ReplyUUID.
+constexpr const char* kLookupSignature = "tbssay";
+
+// A client connection to the bus at `address`, or null.
+sd_bus* openBus(const std::string& address) {
+    sd_bus* bus = nullptr;
+    if (sd_bus_new(&bus) < 0) return nullptr;
+    if (sd_bus_set_address(bus, address.c_str()) < 0 || sd_bus_set_bus_client(bus, 1) < 0 ||
+        sd_bus_start(bus) < 0)
+        return sd_bus_unref(bus);
+    return bus;
+}
+
+// The five values of a look-up reply, as they travel in a D-Bus message
+// (pointers into the message they were read from).
+struct LookupValues {
+    uint64_t error = 1;
+    int existed = 1;
+    const char* identifier = "";
+    const char* path = "";
+    const void* uuid = nullptr;
+    size_t uuidSize = 0;
+
+    int read(sd_bus_message* m) {
+        int r = sd_bus_message_read(m, "tbss", &error, &existed, &identifier, &path);
+        return r < 0 ? r : sd_bus_message_read_array(m, 'y', &uuid, &uuidSize);
+    }
+    int append(sd_bus_message* m) const {
+        int r = sd_bus_message_append(m, "tbss", error, existed, identifier, path);
+        return r < 0 ? r : sd_bus_message_append_array(m, 'y', uuid, uuidSize);
+    }
+};
+
+int onPeerLookup(sd_bus_message* m, void*, sd_bus_error*) {
+    LookupValues values;
+    int r = values.read(m);
+    if (r < 0) return r;
+    sd_bus_message* reply = nullptr;
+    r = sd_bus_message_new_method_return(m, &reply);
+    if (r >= 0) r = values.append(reply);
+    if (r >= 0) r = sd_bus_send(nullptr, reply, nullptr);
+    sd_bus_message_unref(reply);
+    return r < 0 ? r : 1;
+}
+
+const sd_bus_vtable kPeerVtable[] = {
+    SD_BUS_VTABLE_START(0),
+    SD_BUS_METHOD("Lookup", kLookupSignature, kLookupSignature, onPeerLookup, 0),
+    SD_BUS_VTABLE_END,
+};
+
+// The peer process: serves Lookup until the bus goes away.
+int runDBusPeer(const std::string& address) {
+    sd_bus* bus = openBus(address);
+    if (!bus) die("D-Bus peer: cannot connect to " + address);
+    if (sd_bus_add_object_vtable(bus, nullptr, kPeerPath, kPeerInterface, kPeerVtable, nullptr) <
+            0 ||
+        sd_bus_request_name(bus, kPeerName, 0) < 0)
+        die("D-Bus peer: cannot register");
+    for (;;) {
+        int r = sd_bus_process(bus, nullptr);
+        if (r < 0) break;
+        if (r > 0) continue;
+        if (sd_bus_wait(bus, UINT64_MAX) < 0) break;
+    }
+    sd_bus_flush_close_unref(bus);
+    return 0;
+}
+
+// A private dbus-daemon in the scratch root and the peer process on it.
+struct DBusPeer {
+    std::unique_ptr<harness::ChildProcess> busDaemon;
+    std::unique_ptr<harness::ChildProcess> peer;
+    sd_bus* bus = nullptr;
+    std::string identifier = "bench.lookup";
+    std::string path;
+    Uuid uuid;
+
+    ~DBusPeer() {
+        if (bus) sd_bus_flush_close_unref(bus);
+        if (peer) peer->terminate();
+        if (busDaemon) busDaemon->terminate();
+    }
+
+    void call() {
+        sd_bus_message* m = nullptr;
+        sd_bus_message* reply = nullptr;
+        sd_bus_error error = SD_BUS_ERROR_NULL;
+        int r =
+            sd_bus_message_new_method_call(bus, &m, kPeerName, kPeerPath, kPeerInterface, "Lookup");
+        const LookupValues sent{.identifier = identifier.c_str(),
+                                .path = path.c_str(),
+                                .uuid = uuid.bytes.data(),
+                                .uuidSize = uuid.bytes.size()};
+        if (r >= 0) r = sent.append(m);
+        if (r >= 0) r = sd_bus_call(bus, m, 10 * 1000 * 1000, &error, &reply);
+        // Read the reply as a client would: all five values.
+        LookupValues got;
+        if (r >= 0) r = got.read(reply);
+        if (r < 0 || got.uuidSize != 16)
+            die(std::string("D-Bus call failed: ") +
+                (error.message ? error.message : std::strerror(-r)));
+        sd_bus_error_free(&error);
+        sd_bus_message_unref(reply);
+        sd_bus_message_unref(m);
+    }
+};
+
+std::unique_ptr<DBusPeer> startDBusPeer(const std::string& root, const PlistValue& lookupReply) {
+    const char* busBinary = "/usr/bin/dbus-daemon";
+    if (::access(busBinary, X_OK) != 0) {
+        std::printf("D-Bus peer: skipped, %s is missing (scripts/install-deps)\n", busBinary);
+        return nullptr;
+    }
+    auto peer = std::make_unique<DBusPeer>();
+    const std::string socket = root + "/dbus.socket";
+    const std::string config = root + "/dbus.conf";
+    std::ofstream(config)
+        << "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN\"\n"
+           " \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
+           "<busconfig><type>session</type><listen>unix:path="
+        << socket
+        << "</listen><auth>EXTERNAL</auth><policy context=\"default\">"
+           "<allow user=\"*\"/><allow own=\"*\"/><allow send_destination=\"*\"/>"
+           "<allow receive_sender=\"*\"/></policy></busconfig>\n";
+    std::string why;
+    harness::ChildProcess::Options opts;
+    opts.stderrPath = root + "/dbus-daemon.err";
+    peer->busDaemon = harness::ChildProcess::spawn(
+        {busBinary, "--nofork", "--nopidfile", "--config-file=" + config}, opts, &why);
+    // A failure here leaves the D-Bus column out; the destructor stops what started.
+    const auto giveUp = [&](const std::string& what) -> std::unique_ptr<DBusPeer> {
+        std::printf("D-Bus peer: skipped, %s\n", what.c_str());
+        return nullptr;
+    };
+    if (!peer->busDaemon) return giveUp("cannot start dbus-daemon: " + why);
+    const std::string address = "unix:path=" + socket;
+    for (const auto deadline = Clock::now() + 10s; !std::filesystem::exists(socket);) {
+        if (Clock::now() > deadline)
+            return giveUp("dbus-daemon made no socket; see " + opts.stderrPath);
+        std::this_thread::sleep_for(5ms);
+    }
+    opts.stderrPath = root + "/dbus-peer.err";
+    peer->peer = harness::ChildProcess::spawn(
+        {harness::SelfExecutablePath(), "--dbus-peer", address}, opts, &why);
+    if (!peer->peer) return giveUp("cannot start the D-Bus peer: " + why);
+    peer->bus = openBus(address);
+    if (!peer->bus) return giveUp("cannot connect to the private bus at " + address);
+    for (const auto deadline = Clock::now() + 10s;;) {
+        if (sd_bus_get_name_creds(peer->bus, kPeerName, 0, nullptr) >= 0) break;
+        if (Clock::now() > deadline)
+            return giveUp("the D-Bus peer never took its name; see " + opts.stderrPath);
+        std::this_thread::sleep_for(5ms);
+    }
+    // The same values the daemon answers, so both carry the same bytes.
+    if (const PlistValue* p = lookupReply.find("ReplyPath"); p && p->isString())
+        peer->path = *p->asString();
+    if (const PlistValue* u = lookupReply.find("ReplyUUID"); u && u->asUuid())
+        peer->uuid = *u->asUuid();
+    return peer;
+}
+
 // ---- 1. look-up latency ----
 
 // CPU time of every thread of process `pid` so far, from the scheduler's
@@ -92,14 +264,13 @@ double threadCpuUs() {
     return ts.tv_sec * 1e6 + ts.tv_nsec / 1e3;
 }
 
-
 void lookupLatency(const char* config, Client& daemon, pid_t daemonPid,
-                   const std::vector<uint8_t>& record, int rounds, int ops) {
+                   const std::vector<uint8_t>& record, int rounds, int ops, DBusPeer* dbus) {
     std::string why;
     auto echo = harness::SeqpacketEcho::start(&why, /*otherProcess=*/true);
     if (!echo) die("echo: " + why);
     const PlistValue lookup = request0("bench.lookup", false);
-    std::vector<double> echoLat, daemonLat;
+    std::vector<double> echoLat, daemonLat, dbusLat;
     std::vector<uint8_t> back;
     // CPU per round trip on each side, to tell where a difference comes from.
     double echoServerCpu = 0, echoClientCpu = 0, daemonCpu = 0, daemonClientCpu = 0;
@@ -125,6 +296,11 @@ void lookupLatency(const char* config, Client& daemon, pid_t daemonPid,
             daemonCpu += processCpuUs(daemonPid) - server0;
             daemonClientCpu += threadCpuUs() - client0;
         }
+        for (int i = 0; dbus && i < ops; ++i) {
+            const auto t0 = Clock::now();
+            dbus->call();
+            if (r) dbusLat.push_back(since(t0));
+        }
     }
     const double a = medianUs(echoLat), b = medianUs(daemonLat);
     const double n = static_cast<double>(rounds) * ops;
@@ -132,6 +308,11 @@ void lookupLatency(const char* config, Client& daemon, pid_t daemonPid,
                 config, a, b, a > 0 ? b / a : 0.0);
     std::printf("          %-9s CPU: echo %.2f + client %.2f us | daemon %.2f + client %.2f us\n",
                 config, echoServerCpu / n, echoClientCpu / n, daemonCpu / n, daemonClientCpu / n);
+    if (dbus) {
+        const double d = medianUs(dbusLat);
+        std::printf("          %-9s D-Bus call %7.2f us | look-up / D-Bus %.2f (target <= 0.33)\n",
+                    config, d, d > 0 ? b / d : 0.0);
+    }
 }
 
 // ---- 2. creation ----
@@ -248,6 +429,7 @@ void throughput(const std::string& socket, int clients) {
 }  // namespace
 
 int main(int argc, char** argv) {
+    if (argc == 3 && std::string(argv[1]) == "--dbus-peer") return runDBusPeer(argv[2]);
     const int containers = argc > 1 ? std::max(1, std::atoi(argv[1])) : 2000;
     const int rounds = argc > 2 ? std::max(1, std::atoi(argv[2])) : 20;
     const std::string only = argc > 3 ? argv[3] : "";
@@ -276,10 +458,16 @@ int main(int argc, char** argv) {
     h.messageId = 1;
     const std::vector<uint8_t> record = BuildRecords(h, body).front();
 
+    std::unique_ptr<DBusPeer> dbus;
+    if (only != "create")
+        dbus = startDBusPeer(root, send(*client, request0("bench.lookup", false)));
+    // Every process on the road of a request shares the pinned CPU.
+    std::vector<pid_t> pids = {::getpid(), daemon->pid()};
+    if (dbus) pids.insert(pids.end(), {dbus->busDaemon->pid(), dbus->peer->pid()});
     const std::vector<int> all = harness::AllowedCpus();
-    if (!harness::SetProcessCpus(::getpid(), {all.front()}, &why) ||
-        !harness::SetProcessCpus(daemon->pid(), {all.front()}, &why))
-        std::fprintf(stderr, "pinning: %s\n", why.c_str());
+    for (pid_t pid : pids)
+        if (!harness::SetProcessCpus(pid, {all.front()}, &why))
+            std::fprintf(stderr, "pinning: %s\n", why.c_str());
     // The direct side stages in the daemon's own staging directory and moves
     // its containers into a live directory of its own, made fresh for this
     // run and kept for both configurations, as the daemon's are. Staging in
@@ -292,19 +480,20 @@ int main(int argc, char** argv) {
     if (!std::filesystem::is_directory(staging)) die("no daemon staging directory at " + staging);
     std::filesystem::create_directories(live);
     const auto finish = [&] {
+        dbus.reset();
         client.reset();
         daemon->terminate();
         std::error_code ec;
         std::filesystem::remove_all(root, ec);
         return 0;
     };
-    if (only != "create") lookupLatency("pinned", *client, daemon->pid(), record, rounds, 200);
+    if (only != "create")
+        lookupLatency("pinned", *client, daemon->pid(), record, rounds, 200, dbus.get());
     if (only != "lookup")
         creation("pinned", staging, live, *client, daemon->pid(), containers, metadata);
     if (!only.empty()) return finish();
-    (void)harness::SetProcessCpus(::getpid(), all, &why);
-    (void)harness::SetProcessCpus(daemon->pid(), all, &why);
-    lookupLatency("unpinned", *client, daemon->pid(), record, rounds, 200);
+    for (pid_t pid : pids) (void)harness::SetProcessCpus(pid, all, &why);
+    lookupLatency("unpinned", *client, daemon->pid(), record, rounds, 200, dbus.get());
     creation("unpinned", staging, live, *client, daemon->pid(), containers, metadata);
     for (int clients : {1, 2, 4}) throughput(socket, clients);
     return finish();

@@ -7,6 +7,7 @@
 #include "Platform/Conduit.h"
 #include "Platform/ConduitHarness.h"
 #include "Platform/PlatformLog.h"
+#include "Tools/tarnctl/Json.h"
 #include "support/ScratchRoot.h"
 
 namespace tarn::conduit {
@@ -209,6 +210,182 @@ TEST_F(TarnctlTest, AnyReplyExitsZeroAndEveryFailureExitsNonZeroWithAMessage) {
     r = send("{}");
     EXPECT_EQ(r.status, 3);
     EXPECT_NE(r.err.find("cannot reach"), std::string::npos) << r.err;
+}
+
+// Answers every request with ReplyError 1 and the given keys.
+std::function<void(const ConnectionRef&, const MessageRef&)> answering(PlistDict keys,
+                                                                       uint64_t code = 1) {
+    return [keys, code](const ConnectionRef& c, const MessageRef& m) {
+        auto reply = m->createReply();
+        for (const auto& [k, v] : keys) reply->body().set(k, v);
+        reply->body().set("ReplyError", PlistValue(code));
+        c->send(reply);
+    };
+}
+
+TEST_F(TarnctlTest, VerbsSendTheDocumentedRequests) {
+    setHandler(answering({}));
+    const std::string uuid = "0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F9";
+    struct Case {
+        std::vector<std::string> args;
+        const char* request;  // as send would print it
+    };
+    const Case cases[] = {
+        {{"container", "create", "com.example.notes"},
+         R"({"Command": 0, "ContainerClass": 2, "CreateIfNecessary": true, "Identifier": "com.example.notes"})"},
+        {{"container", "lookup", "a.b", "--class", "4", "--transient"},
+         R"({"Command": 0, "ContainerClass": 4, "Identifier": "a.b", "Transient": true})"},
+        {{"container", "wipe", "a.b"}, R"({"Command": 11, "Identifier": "a.b"})"},
+        {{"container", "wipe", "a.b", "--class", "2"},
+         R"({"Command": 12, "ContainerClass": 2, "Identifier": "a.b"})"},
+        {{"container", "info", "set", "a.b", "k", R"({"x": [1, -2]})", "--uuid", uuid, "--persona",
+          "P"},
+         R"({"Command": 5, "ContainerClass": 2, "Identifier": "a.b", "Key": "k", "PersonaUniqueString": "P",)"
+         R"( "UUID": {"$uuid": "0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F9"}, "Value": {"x": [1, -2]}})"},
+        {{"container", "replace", "new.id", "--class", "1", "--old", "old.id", "--old-class", "1"},
+         R"({"Command": 2, "NewContainerClass": 1, "NewIdentifier": "new.id", "OldContainerClass": 1,)"
+         R"( "OldIdentifier": "old.id"})"},
+        {{"groups"}, R"({"Command": 13})"},
+        {{"groups", "a.b", "--ids"}, R"({"Command": 14, "Identifier": "a.b"})"},
+        {{"system-group", "systemgroup.x", "--owner", "a.b"},
+         R"({"Command": 17, "GroupIdentifier": "systemgroup.x", "Identifier": "a.b"})"},
+        {{"protection", "set", "a.b", "3", "--retry-if-locked"},
+         R"({"Command": 21, "ContainerClass": 2, "DataProtectionClass": {"$int64": 3}, "Identifier": "a.b", "RetryIfLocked": true})"},
+        {{"codesign", "set", "a.b", "--info", R"({"k": true})"},
+         R"({"CodeSigningInfo": {"k": true}, "Command": 18, "Identifier": "a.b"})"},
+        {{"assets", "delete", "a.b", "x/y"},
+         R"({"Command": 29, "Identifier": "a.b", "SourcePath": "x/y"})"},
+        {{"migrate", "--per-user"}, R"({"Command": 30})"},
+    };
+    for (const Case& c : cases) {
+        std::vector<std::string> args = {"--root", root_.path()};
+        args.insert(args.end(), c.args.begin(), c.args.end());
+        ToolRun r = tarnctl(args);
+        EXPECT_EQ(r.status, 0) << c.request << ": " << r.err;
+        std::string why;
+        auto expected = tarnctl::JsonToPlist(c.request, &why);
+        ASSERT_TRUE(expected) << why;
+        EXPECT_EQ(tarnctl::PlistToJson(lastReceived()), tarnctl::PlistToJson(*expected));
+    }
+
+    // Arguments that do not parse never reach the daemon.
+    const size_t before = [&] {
+        MutexLock l(state_->mu);
+        return state_->received.size();
+    }();
+    for (std::vector<std::string> bad :
+         {std::vector<std::string>{"container", "du", "a.b", "--class", "two"},
+          {"container", "du", "a.b", "--uuid", "nope"},
+          {"container", "info", "set", "a.b", "k", "{"},
+          {"codesign", "set", "a.b", "--info", "@" + root_.at("/missing.json")}}) {
+        bad.insert(bad.begin(), {"--root", root_.path()});
+        ToolRun r = tarnctl(bad);
+        EXPECT_EQ(r.status, 1) << bad[3];
+        EXPECT_NE(r.err.find("tarnctl:"), std::string::npos) << r.err;
+    }
+    MutexLock l(state_->mu);
+    EXPECT_EQ(state_->received.size(), before);
+}
+
+TEST_F(TarnctlTest, RepliesReadAsTablesAndFailuresByName) {
+    const Uuid u1 = *Uuid::parse("0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F9");
+    setHandler(
+        answering({{"ReplyIdsArray",
+                    PlistValue(PlistArray{PlistValue("com.example.longer"), PlistValue("a.b")})},
+                   {"ReplyUUIDsArray", PlistValue(PlistArray{PlistValue(u1), PlistValue(u1)})},
+                   {"ReplyPersonaUniqueStringsArray",
+                    PlistValue(PlistArray{PlistValue(""), PlistValue("P1")})}}));
+    ToolRun r = send("{}", {});  // keep the listener warm; the verbs follow
+    r = tarnctl({"--root", root_.path(), "container", "list"});
+    ASSERT_EQ(r.status, 0) << r.err;
+    EXPECT_EQ(r.out,
+              "IDENTIFIER          UUID                                  PERSONA\n"
+              "com.example.longer  0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F9\n"
+              "a.b                 0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F9  P1\n");
+    r = tarnctl({"--root", root_.path(), "--json", "container", "list"});
+    EXPECT_EQ(r.out.substr(0, 45), R"({"ReplyError": 1, "ReplyIdsArray": ["com.exam)");
+
+    setHandler(answering(
+        {{"ReplyPath", PlistValue("/p")},
+         {"ReplyUUID", PlistValue(u1)},
+         {"ReplyExisted", PlistValue(false)},
+         {"ReplyGroupContainerDict", PlistValue(PlistDict{{"group.b", PlistValue("/g/b")},
+                                                          {"group.a", PlistValue("/g/a")}})}}));
+    r = tarnctl({"--root", root_.path(), "groups"});
+    EXPECT_EQ(r.out,
+              "existed:  no\n"
+              "path:     /p\n"
+              "UUID:     0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F9\n"
+              "\n"
+              "GROUP    PATH\n"
+              "group.a  /g/a\n"
+              "group.b  /g/b\n");
+
+    // A failed reply: the code's name and meaning on stderr, exit 5; send
+    // names it too but keeps exiting 0.
+    setHandler(answering({}, 55));
+    r = tarnctl({"--root", root_.path(), "container", "delete", "a.b"});
+    EXPECT_EQ(r.status, 5);
+    EXPECT_EQ(r.out, "");
+    EXPECT_EQ(
+        r.err,
+        "tarnctl: 55 not entitled: the client is not entitled for the command or the container\n");
+    r = tarnctl({"--root", root_.path(), "--json", "personas"});
+    EXPECT_EQ(r.status, 5);
+    EXPECT_EQ(r.out, "{\"ReplyError\": 55}\n");
+    setHandler(answering({}, 2));
+    r = send("{}");
+    EXPECT_EQ(r.status, 0);
+    EXPECT_NE(r.err.find("2 unknown error"), std::string::npos) << r.err;
+
+    r = tarnctl({"errors", "76"});
+    EXPECT_EQ(r.status, 0);
+    EXPECT_EQ(r.out.rfind("76 persona mismatch: ", 0), 0u) << r.out;
+    EXPECT_NE(r.out.find("(TarnErrorPersonaMismatch)"), std::string::npos);
+    EXPECT_EQ(tarnctl({"errors", "3"}).status, 1);
+}
+
+TEST_F(TarnctlTest, BashCompletionKnowsEveryVerb) {
+    ToolRun gen = tarnctl({"completion", "bash"});
+    ASSERT_EQ(gen.status, 0) << gen.err;
+    const std::string script = root_.at("/tarnctl.bash");
+    { std::ofstream(script) << gen.out; }
+    // Each line: the words typed so far, then what completion must offer.
+    const std::string probe = root_.at("/probe.sh");
+    {
+        std::ofstream out(probe);
+        out << "source " << script << "\n"
+            << "complete_words() { COMP_WORDS=(\"$@\"); COMP_CWORD=$(($# - 1)); _tarnctl;"
+               " echo \"${COMPREPLY[*]}\"; }\n"
+            << "complete_words tarnctl cont\n"
+            << "complete_words tarnctl --root /x container in\n"
+            << "complete_words tarnctl container info ''\n"
+            << "complete_words tarnctl --timeout 3 codesign ''\n"
+            << "complete_words tarnctl container du a.b --p\n"
+            << "complete_words tarnctl ''\n";
+    }
+    harness::ChildProcess::Options opts;
+    opts.stdoutPath = root_.at("/probe.out");
+    opts.stderrPath = root_.at("/probe.err");
+    std::string why;
+    auto child = harness::ChildProcess::spawn({"/bin/bash", probe}, opts, &why);
+    ASSERT_TRUE(child) << why;
+    ASSERT_EQ(child->wait(20s).value_or(-1), 0) << slurp(opts.stderrPath);
+    std::istringstream lines(slurp(opts.stdoutPath));
+    std::string line;
+    std::vector<std::string> got;
+    while (std::getline(lines, line)) got.push_back(line);
+    ASSERT_EQ(got.size(), 6u);
+    EXPECT_EQ(got[0], "container");
+    EXPECT_EQ(got[1], "info");
+    EXPECT_EQ(got[2], "get set --help");
+    EXPECT_EQ(got[3], "set get invalidate --help");
+    EXPECT_EQ(got[4], "--persona");
+    for (const char* verb :
+         {"send", "container", "groups", "system-group", "codesign", "protection", "assets",
+          "personas", "migrate", "sandbox-items", "lock", "unlock", "errors", "--json", "--root"})
+        EXPECT_NE((" " + got[5] + " ").find(std::string(" ") + verb + " "), std::string::npos)
+            << verb;
 }
 
 TEST_F(TarnctlTest, UsageAndHelp) {

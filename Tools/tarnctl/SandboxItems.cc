@@ -1,6 +1,6 @@
 // Prints the kernel sandbox's per-user container items as the daemon last
-// made them durable (DIR/run/tarnkeeper/sandbox/<uid>.plist): one JSON array
-// of {"identifier", "path", "personaID", "type"} objects.
+// made them durable (DIR/run/tarnkeeper/sandbox/<uid>.plist): a table, or with
+// --json one JSON array of {"identifier", "path", "personaID", "type"} objects.
 #include "Tools/tarnctl/SandboxItems.h"
 
 #include <cstring>
@@ -10,12 +10,12 @@
 #include "Platform/RootPrefix.h"
 #include "Platform/SandboxUserState.h"
 #include "Tools/tarnctl/Json.h"
+#include "Tools/tarnctl/Verbs.h"
 
 namespace tarnctl {
 
 void SetupSandboxItemsCommand(CLI::App& app, Options& options) {
-    auto* cmd =
-        app.add_subcommand("sandbox-items", "Print the sandbox container items of user U as JSON");
+    auto* cmd = app.add_subcommand("sandbox-items", "Print the sandbox container items of user U");
     static uint32_t uid = 0;
     cmd->add_option("--uid", uid, "User id")->required();
     cmd->callback([&options] {
@@ -38,7 +38,16 @@ void SetupSandboxItemsCommand(CLI::App& app, Options& options) {
             options.exitCode = kExitBadInput;
             return;
         }
-        std::cout << PlistToJson(tarn::PlistValue(std::move(items))) << "\n";
+        if (options.json) {
+            std::cout << PlistToJson(tarn::PlistValue(std::move(items))) << "\n";
+            return;
+        }
+        std::vector<std::vector<std::string>> rows{{"TYPE", "PERSONA", "IDENTIFIER", "PATH"}};
+        for (const tarn::PlistValue& item : items)
+            rows.push_back({std::to_string(*item.find("type")->asUInt64()),
+                            std::to_string(*item.find("personaID")->asUInt64()),
+                            *item.find("identifier")->asString(), *item.find("path")->asString()});
+        std::cout << FormatColumns(rows);
     });
 }
 

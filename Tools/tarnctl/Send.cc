@@ -4,6 +4,7 @@
 #include <memory>
 
 #include "Platform/ConduitWire.h"
+#include "Platform/TarnErrorNames.h"
 #include "Tools/tarnctl/Json.h"
 #include "Tools/tarnctl/Subcommands.h"
 
@@ -37,6 +38,10 @@ void runSend(Options& options, const std::string& jsonArgument) {
     if (!reply) return;
     std::cout << PlistToJson(*reply) << "\n" << std::flush;
     options.exitCode = kExitOk;
+    // stdout stays the reply alone; the code's name goes where people look.
+    if (const auto* code = reply->find("ReplyError"); code && code->asUInt64() != 1u)
+        if (auto n = code->asUInt64())
+            std::cerr << "tarnctl: " << tarn::TarnErrorSummary(*n) << "\n";
 }
 
 }  // namespace

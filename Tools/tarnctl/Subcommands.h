@@ -21,6 +21,7 @@ enum ExitCode : int {
     kExitUsage = 2,        // command-line syntax
     kExitUnavailable = 3,  // cannot reach the daemon
     kExitNoReply = 4,      // no reply: timeout, connection closed or a malformed reply
+    kExitReplyError = 5,   // a verb's reply carries an error code (printed on stderr)
 };
 
 // Options every subcommand sees.
@@ -28,6 +29,7 @@ struct Options {
     std::string root;    // --root DIR
     std::string socket;  // --socket PATH
     double timeoutSeconds = 30;
+    bool json = false;  // --json: replies as one JSON object (the send format)
     int exitCode = kExitOk;
 
     // --socket, else the service socket below --root (or below "/").
@@ -45,5 +47,8 @@ void SetupSendCommand(CLI::App& app, Options& options);
 void SetupUpcallCommand(CLI::App& app, Options& options);  // Upcall.cc
 // Tools/tarnctl/Verify.cc
 void SetupVerifyCommand(CLI::App& app, Options& options);
+void SetupErrorsCommand(CLI::App& app, Options& options);
+// Must run last: it describes every subcommand registered before it.
+void SetupCompletionCommand(CLI::App& app, Options& options);
 
 }  // namespace tarnctl
