@@ -213,10 +213,15 @@ ProcessResult DaemonHarness::tarnctl(const std::string& client, const std::vecto
 }
 
 std::optional<PlistValue> DaemonHarness::send(const std::string& client, const std::string& json) {
-    last_ = tarnctl(client, {"send", json});
-    if (last_.exitCode != 0) return std::nullopt;
-    std::string why;
-    return tarnctl::JsonToPlist(last_.out, &why);
+    ProcessResult result = tarnctl(client, {"send", json});
+    std::optional<PlistValue> reply;
+    if (result.exitCode == 0) {
+        std::string why;
+        reply = tarnctl::JsonToPlist(result.out, &why);
+    }
+    std::lock_guard lock(lastMu_);
+    last_ = std::move(result);
+    return reply;
 }
 
 uint64_t DaemonHarness::sendError(const std::string& client, const std::string& json) {

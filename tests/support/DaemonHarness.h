@@ -7,6 +7,7 @@
 
 #include <chrono>
 #include <filesystem>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -76,6 +77,8 @@ private:
     std::string platformLogPath_;
     pid_t pid_ = -1;
     size_t notificationsAtStart_ = 0;  // bytes of the notifications file before the last start
+    // send() may run on several threads at once (the soak's clients).
+    std::mutex lastMu_;
     ProcessResult last_;
 };
 
