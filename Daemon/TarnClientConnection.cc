@@ -430,6 +430,8 @@ TarnResult<TarnMetadataRef> createContainer(TarnClientConnection& connection,
         metadata = TarnMetadata::initWithContainerIdentity(concrete, std::nullopt, stagingURL,
                                                            std::nullopt);
         metadata->setTransient(transient);
+        // While the directory is empty, so that everything made in it joins.
+        metadata->setProjectID(fm.assignProjectToNewContainer(stagingURL, concrete->uuid()));
         TARN_TRY(metadata->writeMetadataToDiskWithError());
         if (TarnContainerClassIsSystem(containerClass))
             TARN_TRY(fm.setTopLevelSystemContainerACLAtURL(stagingURL));

@@ -170,7 +170,8 @@ TarnResult<uint64_t> TarnClientConnection::diskUsageWithContainerIdentity(
     if (remembered) return *remembered;
 
     TarnTestLocks::sharedInstance().waitOnLock(kDiskUsageTestGate);
-    const uint64_t bytes = TarnFileManager::defaultManager().fastDiskUsageForURL(metadata->url());
+    const uint64_t bytes = TarnFileManager::defaultManager().fastDiskUsageForURL(
+        metadata->url(), metadata->projectID());
 
     // With fast sizing the file system keeps the figure current itself;
     // without it a bundle (which never changes in place) is walked once.

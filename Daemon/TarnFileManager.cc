@@ -11,6 +11,7 @@
 #include "Platform/HostConfiguration.h"
 #include "Platform/LockState.h"
 #include "Platform/PlatformLog.h"
+#include "Platform/ProjectQuota.h"
 #include "Platform/RootPrefix.h"
 
 namespace tarn {
@@ -1015,12 +1016,48 @@ uint64_t TarnFileManager::TEST_diskUsageMeasurementCount() {
     return gDiskUsageMeasurementCount.load();
 }
 
-uint64_t TarnFileManager::fastDiskUsageForURL(const FileURL& url) {
+namespace {
+
+// The usage of `projectID` when `url` is the root of that project; nullopt
+// (with a line saying why) when the file system cannot answer for the tree.
+std::optional<ProjectQuotaUsage> projectUsage(const FileURL& url, uint32_t projectID) {
+    uint32_t rootProject = 0;
+    bool inherits = false;
+    int err = ProjectQuotaRead(url, &rootProject, &inherits);
+    // A container restored or copied from elsewhere lost its project: its
+    // usage would be another tree's, or nothing.
+    if (err == 0 && (rootProject != projectID || !inherits)) err = EXDEV;
+    ProjectQuotaUsage usage;
+    if (err == 0) err = ProjectQuotaUsageOf(url, projectID, &usage);
+    // The root itself is always in its project.
+    if (err == 0 && usage.inodes == 0) err = ENODATA;
+    if (err) {
+        PlatformLog(kLogCategory, PlatformLogType::Error,
+                    "Failed to get usage of project %u on %s: (err %d) %s", projectID, url, err,
+                    errText(err));
+        return std::nullopt;
+    }
+    return usage;
+}
+
+}  // namespace
+
+uint64_t TarnFileManager::fastDiskUsageForURL(const FileURL& url,
+                                              std::optional<uint32_t> projectID) {
     gDiskUsageMeasurementCount.fetch_add(1, std::memory_order_relaxed);
     if (!HostConfiguration::shared().featureEnabled("fast_container_sizing")) return diskUsageForURL(url);
     SignpostInterval interval(kLogCategory, "CalculatingDiskUsage");
     int64_t total = 0;
     uint64_t descendants = 0;
+    if (std::optional<ProjectQuotaUsage> usage =
+            projectID ? projectUsage(url, *projectID) : std::nullopt) {
+        descendants = usage->inodes - 1;  // the root is not its own descendant
+        PlatformLog(kLogCategory, PlatformLogType::Default,
+                    "[%s]: descendants: %llu, total size: %llu", url, descendants, usage->bytes);
+        interval.end(
+            {{"descendants", std::to_string(descendants)}, {"size", std::to_string(usage->bytes)}});
+        return usage->bytes;
+    }
     int err = FsDirectoryStatisticsFast(url, &total, &descendants);
     bool fallback = false;
     if (err == ENOTSUP) {
@@ -1051,6 +1088,38 @@ uint64_t TarnFileManager::fastDiskUsageForURL(const FileURL& url) {
                 descendants, static_cast<uint64_t>(total));
     interval.end({{"descendants", std::to_string(descendants)}, {"size", std::to_string(total)}});
     return static_cast<uint64_t>(total);
+}
+
+std::optional<uint32_t> TarnFileManager::assignProjectToNewContainer(const FileURL& url,
+                                                                     const Uuid& uuid) {
+    if (!HostConfiguration::shared().featureEnabled("fast_container_sizing")) return std::nullopt;
+    // Seeded by the container's UUID so that concurrent daemons on one file
+    // system (scratch roots, tests) rarely probe the same ids.
+    uint32_t seed = 0;
+    std::memcpy(&seed, uuid.bytes.data(), sizeof seed);
+    uint32_t projectID = 0;
+    int err = ProjectQuotaChooseID(url, seed, &projectID);
+    if (err == 0) err = ProjectQuotaAssign(url, projectID);
+    if (err) {
+        // Most file systems keep no project usage: an everyday answer, the
+        // container is then sized by walking it.
+        PlatformLog(kLogCategory, PlatformLogType::Debug,
+                    "No project for new container %s: (err %d) %s", url, err, errText(err));
+        return std::nullopt;
+    }
+    PlatformLog(kLogCategory, PlatformLogType::Default, "Container %s sized by project %u", url,
+                projectID);
+    return projectID;
+}
+
+TarnStatus TarnFileManager::moveIntoProject(const FileURL& url, uint32_t projectID) {
+    const int err = ProjectQuotaAssign(url, projectID);
+    // No project ids on this file system: no project to be out of either.
+    if (err == EOPNOTSUPP || err == ENOTTY) return {};
+    if (err)
+        return TARN_POSIX_ERROR(err, "Failed to put %@ into project %u: %s", url, projectID,
+                                errText(err));
+    return {};
 }
 
 uint64_t TarnFileManager::diskUsageForURL(const FileURL& url) {

@@ -40,6 +40,8 @@
 
 namespace tarn {
 
+struct Uuid;
+
 // Name of the container metadata file; the ownership and ACL passes leave any
 // path containing it alone.
 inline constexpr const char* kTarnMetadataFileName = ".com.ostrea.tarn_keeper.metadata.plist";
@@ -299,8 +301,22 @@ public:
     // The other items are still tried after a failure; the last failure is
     // the result.
     TarnStatus standardizeAllSystemContainerACLsAtURL(const FileURL& url);
-    // Bytes allocated to the tree; 0 when no size can be had.
-    uint64_t fastDiskUsageForURL(const FileURL& url);
+    // Bytes allocated to the tree; 0 when no size can be had. With fast
+    // sizing on and the container's `projectID`, the project's quota usage
+    // answers at once; without quotas (or when the tree is not in that
+    // project) the tree is measured as if no id had been given.
+    uint64_t fastDiskUsageForURL(const FileURL& url,
+                                 std::optional<uint32_t> projectID = std::nullopt);
+    // With fast sizing on and project quotas kept by the file system of
+    // `url` (a new container directory, still empty, so that all it will hold
+    // inherits the project): gives it a project of its own and answers the
+    // id. nullopt when there is none to give; the container is then walked.
+    // Callers serialise creations (the global write lock does).
+    std::optional<uint32_t> assignProjectToNewContainer(const FileURL& url, const Uuid& uuid);
+    // Puts the file `url` into project `projectID` before it is renamed into
+    // a container of that project (a rename across projects fails with EXDEV).
+    // Succeeds where the file system has no project ids.
+    TarnStatus moveIntoProject(const FileURL& url, uint32_t projectID);
     uint64_t diskUsageForURL(const FileURL& url);
     // Test-only: fastDiskUsageForURL() calls so far, process-wide.
     static uint64_t TEST_diskUsageMeasurementCount();

@@ -105,6 +105,7 @@ PlistValue TarnMetadata::dictionaryRepresentation() const {
     if (userManagedAssetsDirName_) {
         d[kTarnMetadataUserManagedAssetsDirNameKey] = PlistValue(*userManagedAssetsDirName_);
     }
+    if (projectID_) d[kTarnMetadataProjectIDKey] = PlistValue(uint64_t{*projectID_});
     return PlistValue(std::move(d));
 }
 
@@ -133,6 +134,11 @@ TarnStatus TarnMetadata::writeMetadataToFileURL(const FileURL& fileURL) const {
                           underlying ? underlying->domain() : std::string("(null)"),
                           underlying ? static_cast<long>(underlying->code()) : 0L);
     }
+    // The container's project passes itself on only to what is made inside,
+    // and a rename across projects fails. Where the file system has no
+    // project ids (a container copied elsewhere) there is nothing to join,
+    // and the rename below reports any failure that matters.
+    if (projectID_) (void)TarnFileManager::defaultManager().moveIntoProject(temp, *projectID_);
     if (TarnStatus moved = TarnFileManager::defaultManager().moveItemAtURL(temp, fileURL);
         !moved.ok()) {
         TarnErrorRef e =
@@ -285,6 +291,7 @@ struct TarnMetadata::FieldValidator {
     TarnUserIdentityRef owner;
     std::optional<PlistValue> info;
     std::optional<std::string> userManagedAssetsDirName;
+    std::optional<uint32_t> projectID;
 
     // Only a failure names the file, so only a failure pays for its path.
     FileURL fileURL() const { return where.fileURL(); }
@@ -435,6 +442,21 @@ struct TarnMetadata::FieldValidator {
         return {};
     }
 
+    // Only sizing uses the project id, and it can always walk instead: a bad
+    // value costs the fast answer, never the container.
+    void projectIDField() {
+        const PlistValue* value = fields.find(kTarnMetadataProjectIDKey);
+        if (!value) return;
+        const std::optional<int64_t> number =
+            value->isNumber() ? integralValue(*value) : std::nullopt;
+        if (!number || *number <= 0 || *number > int64_t{UINT32_MAX} - 1) {
+            TarnLog(kLogNotice, kValidateFields, "Ignoring invalid metadata Project ID: %@ at %@",
+                    *value, fileURL());
+            return;
+        }
+        projectID = static_cast<uint32_t>(*number);
+    }
+
     // The container sits in the directory of its class.
     TarnStatus classPath() const {
         const char* relative = TarnContainerClassRelativeDirectory(containerClass);
@@ -469,6 +491,7 @@ TarnResult<TarnMutableMetadataRef> TarnMetadata::validateFields(
     TARN_TRY(check.ownerFields());
     TARN_TRY(check.infoField());
     TARN_TRY(check.userManagedAssetsDirNameField());
+    check.projectIDField();
     if (checkClassPath) TARN_TRY(check.classPath());
     TARN_TRY(check.ownerExists());
 
@@ -476,6 +499,7 @@ TarnResult<TarnMutableMetadataRef> TarnMetadata::validateFields(
         FieldsTag{}, check.containerClass, std::move(check.owner), std::move(check.identifier),
         check.uuid, std::move(check.info), std::move(where.container),
         std::move(check.userManagedAssetsDirName));
+    metadata->setProjectID(check.projectID);
     if (check.showDictionary)
         PlatformLog("metadata", PlatformLogType::Debug, "[%s] Read metadata from [%@]: %@ <= %@",
                     "readAndValidateMetadataAtFileUrl", check.fileURL(), *metadata, *fields.dict);

@@ -42,6 +42,10 @@ inline constexpr const char* kTarnMetadataInfoKey = "TarnMetadataInfo";
 inline constexpr const char* kTarnMetadataUserManagedAssetsDirNameKey =
     "TarnMetadataUserManagedAssetsDirName";
 inline constexpr const char* kTarnMetadataPersonaKey = "TarnMetadataPersona";
+// The file-system project whose quota usage is the container's size (see
+// TarnFileManager::fastDiskUsageForURL). Optional: a value that cannot be an
+// id is ignored on reading, and the container is then sized by walking it.
+inline constexpr const char* kTarnMetadataProjectIDKey = "TarnMetadataProjectID";
 // Known keys of the info dictionary.
 inline constexpr const char* kTarnInfoContentProtectionClassKey =
     "com.ostrea.Pallet.ContentProtectionClass";
@@ -112,6 +116,8 @@ public:
     }
     // A dictionary, or nullopt.
     const std::optional<PlistValue>& info() const { return info_; }
+    // The project id given to the container's tree when it was made, if any.
+    std::optional<uint32_t> projectID() const { return projectID_; }
 
     void setTransient(bool transient) { transient_ = transient; }
     void setExisted(bool existed) { existed_ = existed; }
@@ -121,6 +127,7 @@ public:
         userManagedAssetsDirName_ = std::move(name);
     }
     void setInfo(std::optional<PlistValue> info) { info_ = std::move(info); }
+    void setProjectID(std::optional<uint32_t> projectID) { projectID_ = projectID; }
 
     std::string description() const;
 
@@ -156,6 +163,7 @@ private:
   FileURL url_;
   std::optional<std::string> userManagedAssetsDirName_;
   std::optional<PlistValue> info_;
+  std::optional<uint32_t> projectID_;
 };
 
 }  // namespace tarn

@@ -73,6 +73,8 @@ inline constexpr const char* kFailpointNames[] = {
     "replace.recover.discard",
     // Kernel upcall: one container of an upcall that cannot be made
     "upcall.createOrLookup",
+    // Landlock as if the kernel had none (tarnrun's refusal)
+    "landlock.abi",
 };
 
 bool FailpointIsKnown(std::string_view name);

@@ -4,7 +4,7 @@
 include(GNUInstallDirs)
 
 install(TARGETS tarnkeeperd DESTINATION ${CMAKE_INSTALL_SBINDIR})
-install(TARGETS tarnctl DESTINATION ${CMAKE_INSTALL_BINDIR})
+install(TARGETS tarnctl tarnrun DESTINATION ${CMAKE_INSTALL_BINDIR})
 
 # The units in dist/ name the /usr/local paths of a hand-made install; the
 # installed copies name where this install puts the daemon.
