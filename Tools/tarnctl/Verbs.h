@@ -19,13 +19,13 @@ enum class ArgType { String, UInt, Int, Bool, Uuid, Json };
 
 struct VerbArg {
     std::string name;  // "IDENTIFIER" is positional, "--class" an option
-    std::string key;   // the request key it fills
+    std::string key = {};  // the request key it fills
     ArgType type = ArgType::String;
-    std::string help;
+    std::string help = {};
     bool required = false;
-    std::optional<std::string> defaultValue;  // as it would be typed
+    std::optional<std::string> defaultValue = std::nullopt;  // as it would be typed
     // Giving this argument sends another command (e.g. wipe with --class is 12).
-    std::optional<uint64_t> command;
+    std::optional<uint64_t> command = std::nullopt;
 };
 
 struct VerbColumn {
@@ -38,17 +38,18 @@ struct VerbColumn {
 // dictionaries sharing their keys, one row per key (sorted), the key first.
 struct VerbTable {
     enum class Kind { None, Parallel, Keyed } kind = Kind::None;
-    std::string keyHeading;
-    std::vector<VerbColumn> columns;
+    std::string keyHeading = {};
+    std::vector<VerbColumn> columns = {};
 };
 
 struct VerbDefinition {
     std::vector<std::string> path;  // {"container", "info", "get"}
     uint64_t command = 0;
     std::string help;
-    std::vector<VerbArg> args;
-    std::vector<std::pair<std::string, tarn::PlistValue>> fixed;  // keys every request carries
-    VerbTable table;
+    std::vector<VerbArg> args = {};
+    // Keys every request carries.
+    std::vector<std::pair<std::string, tarn::PlistValue>> fixed = {};
+    VerbTable table = {};
 };
 
 const std::vector<VerbDefinition>& VerbDefinitions();
