@@ -64,16 +64,6 @@ class FailpointSweepTest : public test::CrashTest, public ::testing::WithParamIn
                R"("})";
     }
 
-    // Starts the daemon with `failpoints` dormant until the request begins.
-    void startArmed(const std::string& failpoints, const std::string& trace = "") {
-        ::setenv("TARN_FAILPOINTS_GATE", "1", 1);
-        ::setenv("TARN_FAILPOINTS", failpoints.c_str(), 1);
-        if (!trace.empty()) ::setenv("TARN_FAILPOINTS_TRACE", trace.c_str(), 1);
-        daemon_->start();
-        ::unsetenv("TARN_FAILPOINTS_GATE");
-        ::unsetenv("TARN_FAILPOINTS");
-        ::unsetenv("TARN_FAILPOINTS_TRACE");
-    }
     // The daemon restarts after a kill; when `recoveryCrash` names a
     // failpoint, the first restart dies there if its recovery passes it.
     void restartAfterKill(const std::string& recoveryCrash) {
