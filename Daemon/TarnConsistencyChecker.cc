@@ -142,6 +142,14 @@ class Checker {
     // Both are read with the daemon's own readers, so that a file start-up
     // would refuse is exactly one reported here.
 
+    // The hidden temporary file of an atomic write the process died in; the
+    // readers never list it.
+    bool isInterruptedWrite(const std::string& path, const std::string& name) {
+        if (!name.starts_with(".") || name.find(".plist.tmp.") == std::string::npos) return false;
+        note(path, "temporary file of an interrupted write (never read)");
+        return true;
+    }
+
     bool isRegularFile(const std::string& path, const char* what) {
         FsStat st;
         if (FsLstat(path, &st) == 0 && st.isRegular()) return true;
@@ -160,6 +168,7 @@ class Checker {
         for (const FsDirEntry& entry : entries) {
             const std::string path = PathJoin(dir, entry.name);
             const std::string_view name = entry.name;
+            if (isInterruptedWrite(path, entry.name)) continue;
             if (name.size() <= 6 || name.substr(name.size() - 6) != ".plist" ||
                 !Uuid::parse(name.substr(0, name.size() - 6))) {
                 violation(path, "replace file not named <UUID>.plist");
@@ -189,6 +198,7 @@ class Checker {
         if (FsListDirectory(dir, &entries) != 0) return;
         for (const FsDirEntry& entry : entries) {
             const std::string path = PathJoin(dir, entry.name);
+            if (isInterruptedWrite(path, entry.name)) continue;
             if (!isRegularFile(path, "pending data-protection")) continue;
             const auto read =
                 TarnDataProtectionChangeOperation::_readAndValidateDataProtectionUpdateAtURL(
