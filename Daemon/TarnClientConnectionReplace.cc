@@ -128,6 +128,7 @@ class Replacement {
     // `failpoint` stands before the removal.
     TarnStatus uncache(const TarnMetadataRef& metadata, const char* failpoint);
     TarnStatus recacheNewAtDestination();
+    void recacheOldAfterFailure();
     TarnMutableMetadataRef newMetadataWithPreservedUUID(const FileURL& url) const;
 
     TarnClientConnection& connection_;
@@ -141,6 +142,7 @@ class Replacement {
     ReplaceInfo info_;
     FileURL replaceURL_;  // empty: no replace file
     bool newAtDestination_ = false;
+    bool oldUncached_ = false;
 };
 
 TarnStatus Replacement::findContainers() {
@@ -203,6 +205,7 @@ TarnStatus Replacement::perform() {
     }
 
     TARN_TRY(uncache(oldMetadata_, "replace.uncacheOld"));
+    oldUncached_ = true;
     if (TarnContainerClassIsBundle(oldMetadata_->containerClass())) {
         TarnStatus invalidated = stepFailpoint("replace.invalidate");
         if (invalidated.ok())
@@ -353,13 +356,28 @@ TarnStatus Replacement::restore(bool threw) {
         restoreParkedOldContainer(kReplace, info_,
                                   threw ? "Recovering from exception by moving: %@ to %@"
                                         : "Recovering from failed replace by moving: %@ to %@");
-    if (restored.ok()) return {};
+    if (restored.ok()) {
+        recacheOldAfterFailure();
+        return {};
+    }
     // Only the replace file still knows where the old container is: the
     // next start finishes the restore from it.
     if (threw) std::_Exit(EXIT_FAILURE);
     replaceURL_.clear();
     info_.stagingURL.clear();
     return restored.error();
+}
+
+void Replacement::recacheOldAfterFailure() {
+    // The old container is at its place again (or never left it), but the
+    // cache learns of it otherwise only at the next start: until then its
+    // identifier would look free and a create would make a twin of it.
+    if (!oldUncached_ || newAtDestination_ || !exists(info_.oldURL)) return;
+    if (TarnStatus added = TarnContainerCache::sharedInstance().addContainerMetadata(
+            oldMetadata_, info_.oldURL, oldTransient_, /*updateSandbox=*/true);
+        !added.ok())
+        TarnLog(kLogError, kReplace, "Failed to re-add old container to cache: %@, url: %@ : %@",
+                oldMetadata_, info_.oldURL, added.error());
 }
 
 TarnStatus Replacement::cleanUp(bool startDeletionThread) {

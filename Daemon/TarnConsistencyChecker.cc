@@ -5,12 +5,13 @@
 #include <set>
 #include <tuple>
 
+#include "Daemon/TarnClientConnection.h"
 #include "Daemon/TarnCodeSigningMapping.h"
 #include "Daemon/TarnContainerClass.h"
+#include "Daemon/TarnDataProtectionChangeOperation.h"
 #include "Daemon/TarnFileManager.h"
 #include "Daemon/TarnGlobalConfiguration.h"
 #include "Daemon/TarnMetadata.h"
-#include "Daemon/TarnPropertyListFile.h"
 #include "Daemon/TarnSQLiteDB.h"
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/FileSystem.h"
@@ -138,20 +139,26 @@ class Checker {
 
     // ---- replace and pending-update files ----
 
-    // The file's dictionary, or a violation and nothing.
-    std::optional<PlistValue> readRecord(const std::string& path, const char* what) {
+    // Both are read with the daemon's own readers, so that a file start-up
+    // would refuse is exactly one reported here.
+
+    // The hidden temporary file of an atomic write the process died in; the
+    // readers never list it.
+    bool isInterruptedWrite(const std::string& path, const std::string& name) {
+        if (!name.starts_with(".") || name.find(".plist.tmp.") == std::string::npos) return false;
+        note(path, "temporary file of an interrupted write (never read)");
+        return true;
+    }
+
+    bool isRegularFile(const std::string& path, const char* what) {
         FsStat st;
-        if (FsLstat(path, &st) != 0 || !st.isRegular()) {
-            violation(path, std::string("not a regular file in the ") + what + " directory");
-            return std::nullopt;
-        }
-        auto read = Tarn_dictionaryWithContentsOfURL(path, 0);
-        if (!read.ok()) {
-            violation(path, std::string("unreadable ") + what + " file: " +
-                                (read.error() ? read.error()->description() : std::string()));
-            return std::nullopt;
-        }
-        return std::move(*read);
+        if (FsLstat(path, &st) == 0 && st.isRegular()) return true;
+        violation(path, std::string("not a regular file in the ") + what + " directory");
+        return false;
+    }
+
+    static std::string describeError(const TarnErrorRef& error) {
+        return error ? error->description() : std::string();
     }
 
     void checkReplaceFiles() {
@@ -161,30 +168,22 @@ class Checker {
         for (const FsDirEntry& entry : entries) {
             const std::string path = PathJoin(dir, entry.name);
             const std::string_view name = entry.name;
+            if (isInterruptedWrite(path, entry.name)) continue;
             if (name.size() <= 6 || name.substr(name.size() - 6) != ".plist" ||
                 !Uuid::parse(name.substr(0, name.size() - 6))) {
                 violation(path, "replace file not named <UUID>.plist");
                 continue;
             }
-            std::optional<PlistValue> record = readRecord(path, "replace");
-            if (!record) continue;
-            std::map<std::string, std::string> urls;
-            for (const char* key :
-                 {"TarnReplaceOperationOldURL", "TarnReplaceOperationNewURL",
-                  "TarnReplaceOperationStagingURL", "TarnReplaceOperationDestURL"}) {
-                const PlistValue* v = record->find(key);
-                const std::string* s = v ? v->asString() : nullptr;
-                if (!s || s->empty() || s->front() != '/')
-                    violation(path,
-                              std::string("replace file without an absolute path under ") + key);
-                else
-                    urls[key] = *s;
+            if (!isRegularFile(path, "replace")) continue;
+            const auto info = TarnClientConnection::_readAndValidateReplaceFileAtUrl(path);
+            if (!info.ok()) {
+                violation(path,
+                          "invalid replace file (start-up recovery discards it without "
+                          "restoring anything): " +
+                              describeError(info.error()));
+                continue;
             }
-            if (urls.size() != 4) continue;
-            const bool oldThere = exists(urls["TarnReplaceOperationOldURL"]);
-            const bool destThere = exists(urls["TarnReplaceOperationDestURL"]);
-            const bool parked = exists(urls["TarnReplaceOperationStagingURL"]);
-            if (!oldThere && !destThere && !parked)
+            if (!exists(info->oldURL) && !exists(info->destURL) && !exists(info->stagingURL))
                 violation(path,
                           "replacement lost its container: neither the old place, the "
                           "destination nor the staging directory exists");
@@ -199,37 +198,41 @@ class Checker {
         if (FsListDirectory(dir, &entries) != 0) return;
         for (const FsDirEntry& entry : entries) {
             const std::string path = PathJoin(dir, entry.name);
-            if (entry.name.size() <= 6 || entry.name.substr(entry.name.size() - 6) != ".plist") {
-                violation(path, "pending data-protection file not named <id>-<class>-<user>.plist");
+            if (isInterruptedWrite(path, entry.name)) continue;
+            if (!isRegularFile(path, "pending data-protection")) continue;
+            const auto read =
+                TarnDataProtectionChangeOperation::_readAndValidateDataProtectionUpdateAtURL(
+                    path, TarnUserIdentitySharedCache::sharedInstance());
+            if (!read.ok()) {
+                violation(path,
+                          "invalid pending data-protection file (start-up leaves it and "
+                          "never runs it): " +
+                              describeError(read.error()));
                 continue;
             }
-            std::optional<PlistValue> record = readRecord(path, "pending data-protection");
-            if (!record) continue;
-            auto field = [&](const char* key) { return record->find(key); };
-            auto bad = [&](const char* key) {
-                violation(path, std::string("pending data-protection file with a bad ") + key);
-            };
-            const PlistValue* identifier = field("TarnDataOperationIdentifier");
-            if (!identifier || !identifier->asString()) bad("TarnDataOperationIdentifier");
-            const PlistValue* cls = field("TarnDataOperationContainerClass");
-            const auto classValue = cls ? cls->asUInt64() : std::nullopt;
-            if (!classValue || !TarnContainerClassIsValid(*classValue))
-                bad("TarnDataOperationContainerClass");
-            const PlistValue* protection = field("TarnDataOperationProtectionClass");
-            if (!protection || !protection->isInteger()) bad("TarnDataOperationProtectionClass");
-            const PlistValue* change = field("TarnDataOperationChangeType");
-            if (!change || !change->isInteger() || change->asUInt64().value_or(0) == 0)
-                bad("TarnDataOperationChangeType");
-            const PlistValue* retry = field("TarnDataOperationRetryIfLocked");
-            if (!retry || !retry->isBool()) bad("TarnDataOperationRetryIfLocked");
-            const PlistValue* internalID = field("TarnDataOperationInternalID");
-            if (!internalID || !internalID->asString() || !Uuid::parse(*internalID->asString()))
-                bad("TarnDataOperationInternalID");
-            const PlistValue* user = field("TarnDataOperationUserIdentity");
-            const PlistValue* legacyUser = field("TarnDataOperationUserId");
-            if (classValue && TarnContainerClassIsPerUser(*classValue) &&
-                !(user && user->isDict()) && !(legacyUser && legacyUser->isInteger()))
-                bad("TarnDataOperationUserIdentity");
+            const TarnUserIdentityRef owner = read->userIdentity
+                                                  ? read->userIdentity
+                                                  : TarnUserIdentityCache::defaultUserIdentity();
+            const auto identity = TarnContainerIdentity::containerIdentityWithUserIdentity(
+                owner, read->identifier, read->containerClass);
+            // A newer change of the same container finds its file by name.
+            if (!identity.ok() ||
+                PathLastComponent(TarnDataProtectionChangeOperation::
+                                      urlForProtectionOperationWithContainerIdentity(**identity)) !=
+                    entry.name) {
+                violation(path,
+                          "pending data-protection file not named after the container it "
+                          "changes (" +
+                              read->identifier + ")");
+                continue;
+            }
+            const auto key = std::make_tuple(read->containerClass, owner->identifier(),
+                                             /*transient=*/false, read->identifier);
+            if (byIdentity_.count(key))
+                note(path, "data-protection change in progress (start-up runs it again)");
+            else
+                note(path, "pending data-protection change of " + read->identifier +
+                               ", which is not live (start-up logs it and leaves the file)");
         }
     }
 

@@ -2,12 +2,15 @@
 // clean; each kind of damage is reported with its path, and the command
 // exits 1 on a violation.
 #include <gtest/gtest.h>
+#include <signal.h>
 
 #include <filesystem>
 #include <fstream>
+#include <thread>
 
 #include "Daemon/TarnConsistencyChecker.h"
 #include "Daemon/TarnError.h"
+#include "Platform/LockState.h"
 #include "Platform/RootPrefix.h"
 #include "support/CrashTest.h"
 
@@ -27,8 +30,10 @@ class ConsistencyCheckerTest : public test::CrashTest {
                                                R"("CreateIfNecessary": true, "Identifier": ")" +
                                                id + R"("})");
             const PlistValue* p = r ? r->find("ReplyPath") : nullptr;
-            ASSERT_TRUE(p && p->asString());
+            const PlistValue* u = r ? r->find("ReplyUUID") : nullptr;
+            ASSERT_TRUE(p && p->asString() && u && u->asUuid());
             paths_.push_back(*p->asString());
+            uuids_.push_back(u->asUuid()->string());
         }
         daemon_->stop();
     }
@@ -39,7 +44,42 @@ class ConsistencyCheckerTest : public test::CrashTest {
         return false;
     }
 
+    // Whether some note names `path`.
+    static bool noted(const TarnConsistencyReport& r, const std::string& path) {
+        for (const auto& n : r.notes)
+            if (n.path == StripRootPrefix(path)) return true;
+        return false;
+    }
+    // The only file in `dir` below the root, or "" when it holds none or several.
+    std::string onlyFileIn(const std::string& dir) {
+        std::vector<fs::path> files;
+        std::error_code ec;
+        for (const auto& e : fs::directory_iterator(root_.at(dir), ec)) files.push_back(e.path());
+        return files.size() == 1 ? files[0].string() : std::string();
+    }
+    // Sends `request` after arming `failpoint`=kill; the daemon must die there.
+    void killAt(const std::string& failpoint, const std::string& request,
+                const std::string& before = "") {
+        startArmed(failpoint + "=kill");
+        if (!before.empty()) ASSERT_EQ(daemon_->sendError(admin_, before), TarnSuccess);
+        daemon_->signal(SIGUSR2);
+        EXPECT_FALSE(daemon_->send(admin_, request)) << "answered instead of dying";
+        EXPECT_TRUE(daemon_->waitExit(std::chrono::seconds(10)));
+        daemon_->kill9();
+    }
+    // With `path` holding `damaged`, the checker reports it; then its bytes are back.
+    void expectViolationWhenDamaged(const std::string& path, const std::string& damaged) {
+        std::ifstream in(path, std::ios::binary);
+        const std::string bytes((std::istreambuf_iterator<char>(in)), {});
+        in.close();
+        std::ofstream(path, std::ios::binary | std::ios::trunc) << damaged;
+        const TarnConsistencyReport r = TarnCheckContainerTree();
+        EXPECT_TRUE(names(r, path)) << r.describe();
+        std::ofstream(path, std::ios::binary | std::ios::trunc) << bytes;
+    }
+
     std::vector<std::string> paths_;
+    std::vector<std::string> uuids_;
 };
 
 TEST_F(ConsistencyCheckerTest, ReportsEveryKindOfDamageWithItsPath) {
@@ -95,6 +135,79 @@ TEST_F(ConsistencyCheckerTest, ReportsEveryKindOfDamageWithItsPath) {
     test::ProcessResult r = daemon_->tarnctl(admin_, {"verify"});
     EXPECT_EQ(r.exitCode, 1) << r.out << r.err;
     EXPECT_NE(r.out.find(StripRootPrefix(paths_[1])), std::string::npos) << r.out;
+}
+
+// The record files a killed replacement and a killed data-protection change
+// leave are work start-up finishes, unless damaged; after a restart none is left.
+TEST_F(ConsistencyCheckerTest, RecordFilesOfKilledOperationsAreInProgressUnlessDamaged) {
+    ASSERT_EQ(LockStateSet(0), 0);
+    const char* kReplaceDir = "/private/var/root/Library/TarnKeeper/Replace";
+    const char* kPendingDir = "/private/var/root/Library/TarnKeeper/PendingUpdates";
+
+    // Killed after the replace file is down, before anything moved.
+    const std::string newer =
+        R"({"Command": 0, "ContainerClass": 2, "CreateIfNecessary": true, "Transient": true, )"
+        R"("Identifier": "com.check.a"})";
+    startArmed("");
+    auto made = daemon_->send(admin_, newer);
+    const PlistValue* newUuid = made ? made->find("ReplyUUID") : nullptr;
+    ASSERT_TRUE(newUuid && newUuid->asUuid());
+    daemon_->kill9();
+    killAt("replace.park",
+           R"({"Command": 2, "OldIdentifier": "com.check.a", "OldContainerClass": 2, )"
+           R"("OldContainerUUID": {"$uuid": ")" +
+               uuids_[0] +
+               R"("}, "NewIdentifier": "com.check.a", "NewContainerClass": 2, )"
+               R"("NewContainerUUID": {"$uuid": ")" +
+               newUuid->asUuid()->string() + R"("}})");
+    const std::string replaceFile = onlyFileIn(kReplaceDir);
+    ASSERT_FALSE(replaceFile.empty());
+    TarnConsistencyReport r = TarnCheckContainerTree({.orphansAreViolations = true});
+    EXPECT_TRUE(r.clean()) << r.describe();
+    EXPECT_TRUE(noted(r, replaceFile)) << r.describe();
+    expectViolationWhenDamaged(replaceFile, "torn");
+    PlistValue relative{PlistDict{}};
+    for (const char* key : {"TarnReplaceOperationOldURL", "TarnReplaceOperationNewURL",
+                            "TarnReplaceOperationStagingURL", "TarnReplaceOperationDestURL"})
+        relative.set(key, std::string("relative/path"));
+    expectViolationWhenDamaged(replaceFile, relative.toXml());
+
+    // Killed in the middle of the pass, after the pending file is down (the
+    // start before it finishes the replacement).
+    killAt("fm.setDataProtectionClass",
+           R"({"Command": 21, "Identifier": "com.check.b", "ContainerClass": 2, )"
+           R"("DataProtectionClass": 3, "IsThirdParty": false, "RetryIfLocked": false})");
+    EXPECT_TRUE(onlyFileIn(kReplaceDir).empty()) << "recovery left the replace file";
+    const std::string pendingFile = onlyFileIn(kPendingDir);
+    ASSERT_FALSE(pendingFile.empty());
+    r = TarnCheckContainerTree({.orphansAreViolations = true});
+    EXPECT_TRUE(r.clean()) << r.describe();
+    EXPECT_TRUE(noted(r, pendingFile)) << r.describe();
+    expectViolationWhenDamaged(pendingFile, "torn");
+    {
+        std::ifstream in(pendingFile, std::ios::binary);
+        const std::string bytes((std::istreambuf_iterator<char>(in)), {});
+        auto record = PlistValue::fromBytes(bytes.data(), bytes.size());
+        ASSERT_TRUE(record && record->isDict());
+        record->set("TarnDataOperationInternalID", std::string("not-a-uuid"));
+        expectViolationWhenDamaged(pendingFile, record->toXml());
+    }
+    // Kept under another container's name, a newer change would not find it.
+    const std::string misnamed = pendingFile + ".plist";
+    fs::copy_file(pendingFile, misnamed);
+    r = TarnCheckContainerTree();
+    EXPECT_TRUE(names(r, misnamed)) << r.describe();
+    fs::remove(misnamed);
+
+    // A start runs the pending change again and removes its file.
+    daemon_->start();
+    for (auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+         fs::exists(pendingFile) && std::chrono::steady_clock::now() < deadline;)
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    daemon_->stop();
+    r = TarnCheckContainerTree({.orphansAreViolations = true});
+    EXPECT_TRUE(r.clean()) << r.describe();
+    EXPECT_FALSE(noted(r, pendingFile)) << r.describe();
 }
 
 TEST_F(ConsistencyCheckerTest, VerifyRefusesARunningDaemon) {

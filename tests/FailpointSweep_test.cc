@@ -12,9 +12,13 @@
 #include <cstdlib>
 #include <fstream>
 #include <map>
+#include <thread>
 
 #include "Daemon/TarnConsistencyChecker.h"
 #include "Daemon/TarnError.h"
+#include "Daemon/TarnMetadata.h"
+#include "Platform/FileSystem.h"
+#include "Platform/LockState.h"
 #include "support/CrashTest.h"
 
 namespace tarn {
@@ -36,6 +40,21 @@ struct SweepRow {
 class FailpointSweepTest : public test::CrashTest, public ::testing::WithParamInterface<SweepRow> {
   public:
     using CrashTest::errorOf;
+
+    void SetUp() override {
+        CrashTest::SetUp();
+        if (IsSkipped()) return;
+        // Wiping takes an entitlement of its own.
+        PlistValue entitlements{PlistDict{}};
+        entitlements.set("com.ostrea.private.TarnKeeper.allowed", true);
+        entitlements.set("com.ostrea.private.TarnKeeper.deleteContainerContent", true);
+        admin_ = daemon_->addClient("sweeper", "com.sweep.sweeper", entitlements);
+        ASSERT_EQ(LockStateSet(0), 0);
+        // Every start is a later start in the same boot: a first one would
+        // throw away the transient containers a replacement brings in.
+        // The boot sweeps have their own test, which reboots.
+        ASSERT_EQ(FirstBootMarkerCreate(), 0);
+    }
 
     std::optional<PlistValue> send(const std::string& json) { return daemon_->send(admin_, json); }
     uint64_t ask(const std::string& json) { return daemon_->sendError(admin_, json); }
@@ -64,16 +83,6 @@ class FailpointSweepTest : public test::CrashTest, public ::testing::WithParamIn
                R"("})";
     }
 
-    // Starts the daemon with `failpoints` dormant until the request begins.
-    void startArmed(const std::string& failpoints, const std::string& trace = "") {
-        ::setenv("TARN_FAILPOINTS_GATE", "1", 1);
-        ::setenv("TARN_FAILPOINTS", failpoints.c_str(), 1);
-        if (!trace.empty()) ::setenv("TARN_FAILPOINTS_TRACE", trace.c_str(), 1);
-        daemon_->start();
-        ::unsetenv("TARN_FAILPOINTS_GATE");
-        ::unsetenv("TARN_FAILPOINTS");
-        ::unsetenv("TARN_FAILPOINTS_TRACE");
-    }
     // The daemon restarts after a kill; when `recoveryCrash` names a
     // failpoint, the first restart dies there if its recovery passes it.
     void restartAfterKill(const std::string& recoveryCrash) {
@@ -156,6 +165,48 @@ class FailpointSweepTest : public test::CrashTest, public ::testing::WithParamIn
                   << " crashes inside recovery, " << violations_ << " violations\n";
     }
 
+    // Path and UUID of the live container of `id` ("" when there is none).
+    std::pair<std::string, std::string> placeOf(const std::string& id) {
+        auto r = lookup(id);
+        const PlistValue* uuid = r ? r->find("ReplyUUID") : nullptr;
+        return {stringOf(r, "ReplyPath"),
+                uuid && uuid->asUuid() ? uuid->asUuid()->string() : std::string()};
+    }
+    std::string make(const std::string& id, bool transient, const std::string& marker) {
+        auto r =
+            send(R"({"Command": 0, "ContainerClass": 2, "CreateIfNecessary": true, )"
+                 R"("Transient": )" +
+                 std::string(transient ? "true" : "false") + R"(, "Identifier": ")" + id + R"("})");
+        EXPECT_EQ(errorOf(r), TarnSuccess) << id;
+        const PlistValue* uuid = r ? r->find("ReplyUUID") : nullptr;
+        std::ofstream(stringOf(r, "ReplyPath") + "/Documents/" + marker) << marker;
+        return uuid && uuid->asUuid() ? uuid->asUuid()->string() : std::string();
+    }
+    // Whether `dir` holds no record file (an interrupted atomic write may
+    // leave its hidden temporary file, which nothing reads).
+    bool emptyDirectory(const char* dir) {
+        std::error_code ec;
+        for (const auto& e : fs::directory_iterator(root_.at(dir), ec))
+            if (e.path().filename().string()[0] != '.') return false;
+        return true;
+    }
+    // After a failed replacement the next start finishes what is left: a
+    // replace file the clean-up could not discard, and a cache that lacks
+    // the container which arrived when a cache change after its arrival
+    // failed (the cache is rebuilt from disk).
+    void settleReplacement(uint64_t reply) {
+        if (reply == TarnErrorCacheAddFailed || reply == TarnErrorCacheRemoveFailed ||
+            !emptyDirectory("/private/var/root/Library/TarnKeeper/Replace"))
+            restart();
+    }
+    void restart() {
+        daemon_->stop();
+        daemon_->start();
+    }
+
+    // What the replacement of the current case started from.
+    std::string oldUuid_, newUuid_;
+
     int cases_ = 0;
     int recoveryCrashes_ = 0;
     int notReached_ = 0;
@@ -210,6 +261,71 @@ void checkCodeSigning(FailpointSweepTest& t, const std::string& id, uint64_t rep
         EXPECT_NE(read, TarnSuccess) << "failed record took effect";
 }
 
+// A replacement or wipe whose clean-up fails after the new container has
+// arrived answers with that error although the swap is done, so a failed
+// reply allows either state; only a successful one pins it.
+void checkReplaced(FailpointSweepTest& t, const std::string& id, uint64_t reply) {
+    t.settleReplacement(reply);
+    EXPECT_TRUE(t.emptyDirectory("/private/var/root/Library/TarnKeeper/Replace"))
+        << "recovery left a replace file";
+    const auto [path, uuid] = t.placeOf(id);
+    const bool arrived = uuid == t.newUuid_;
+    if (reply == TarnSuccess) EXPECT_TRUE(arrived) << "reported replaced, old container still live";
+    EXPECT_TRUE(arrived || uuid == t.oldUuid_) << "neither container is live: " << uuid;
+    // Whichever is live has its own contents.
+    EXPECT_TRUE(fs::exists(path + "/Documents/" + (arrived ? "new" : "old"))) << path;
+    // A later request finds it rather than making a twin.
+    EXPECT_EQ(t.placeOf(id).first, path);
+    EXPECT_EQ(t.ask(FailpointSweepTest::container(id, true)), TarnSuccess);
+}
+
+void checkWiped(FailpointSweepTest& t, const std::string& id, uint64_t reply) {
+    t.settleReplacement(reply);
+    EXPECT_TRUE(t.emptyDirectory("/private/var/root/Library/TarnKeeper/Replace"))
+        << "recovery left a replace file";
+    const auto [path, uuid] = t.placeOf(id);
+    EXPECT_EQ(uuid, t.oldUuid_) << "a wipe keeps the container";
+    EXPECT_TRUE(fs::is_directory(path + "/Documents")) << path;
+    if (reply == TarnSuccess)
+        EXPECT_FALSE(fs::exists(path + "/Documents/old")) << "reported wiped, contents still there";
+}
+
+int32_t protectionClassOf(const std::string& path) {
+    FsFd fd;
+    int32_t cls = -1;
+    if (FsOpenItem(-1, path, &fd) == 0) (void)FsGetProtectionClass(fd.get(), &cls);
+    return cls;
+}
+
+void checkProtected(FailpointSweepTest& t, const std::string& id, uint64_t reply) {
+    // A change left pending runs again at start-up and then removes its file.
+    // A failed write may leave a complete one behind (the failure came after
+    // its rename): the next start then makes the change after all.
+    const char* pending = "/private/var/root/Library/TarnKeeper/PendingUpdates";
+    auto drained = [&](std::chrono::seconds limit) {
+        for (auto deadline = std::chrono::steady_clock::now() + limit;
+             !t.emptyDirectory(pending) && std::chrono::steady_clock::now() < deadline;)
+            std::this_thread::sleep_for(std::chrono::milliseconds(10));
+        return t.emptyDirectory(pending);
+    };
+    if (reply != 0 && !drained(std::chrono::seconds(1))) t.restart();
+    EXPECT_TRUE(drained(std::chrono::seconds(10))) << "a pending change never finished";
+    auto read =
+        t.send(R"({"Command": 6, "Key": ")" + std::string(kTarnInfoContentProtectionClassKey) +
+               R"(", )" + t.concrete(id) + "}");
+    const PlistValue* v = read ? read->find("ReplyInfoValue") : nullptr;
+    const int64_t recorded = v ? v->asInt64().value_or(-1) : -1;
+    const std::string documents = t.placeOf(id).first + "/Documents";
+    // Recording the class in the info is best effort: a failure there is
+    // only logged, so a success may have left no record, but never another one.
+    if (reply == TarnSuccess) {
+        EXPECT_TRUE(recorded == 1 || recorded == -1) << recorded;
+        EXPECT_EQ(protectionClassOf(documents), 1) << "reported changed, not applied";
+    } else if (recorded == 1) {
+        EXPECT_EQ(protectionClassOf(documents), 1) << "recorded, not applied";
+    }
+}
+
 const SweepRow kRows[] = {
     {"create",
      [](FailpointSweepTest&, const std::string& id) {
@@ -251,6 +367,30 @@ const SweepRow kRows[] = {
                 R"("OptionsDictionary": {}})";
      },
      checkCodeSigning},
+    {"replace",
+     [](FailpointSweepTest& t, const std::string& id) {
+         t.oldUuid_ = t.make(id, /*transient=*/false, "old");
+         t.newUuid_ = t.make(id, /*transient=*/true, "new");
+         return R"({"Command": 2, "OldIdentifier": ")" + id +
+                R"(", "OldContainerClass": 2, "OldContainerUUID": {"$uuid": ")" + t.oldUuid_ +
+                R"("}, "NewIdentifier": ")" + id +
+                R"(", "NewContainerClass": 2, "NewContainerUUID": {"$uuid": ")" + t.newUuid_ +
+                R"("}})";
+     },
+     checkReplaced},
+    {"wipe",
+     [](FailpointSweepTest& t, const std::string& id) {
+         t.oldUuid_ = t.make(id, /*transient=*/false, "old");
+         return R"({"Command": 12, "ContainerClass": 2, "Identifier": ")" + id + R"("})";
+     },
+     checkWiped},
+    {"data_protection_change",
+     [](FailpointSweepTest& t, const std::string& id) {
+         t.make(id, /*transient=*/false, "file");
+         return R"({"Command": 21, "ContainerClass": 2, "Identifier": ")" + id +
+                R"(", "DataProtectionClass": 1, "IsThirdParty": false, "RetryIfLocked": false})";
+     },
+     checkProtected},
 };
 
 TEST_P(FailpointSweepTest, TreeIsAsBeforeOrAsAfter) { sweep(GetParam()); }

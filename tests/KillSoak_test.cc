@@ -1,7 +1,7 @@
-// Kill soak: four clients create, delete, annotate and empty death row while
-// the daemon is killed with SIGKILL at random moments. After every kill the
-// tree the crash left must pass the consistency checker, and after the
-// restart every container a reply reported as created is still there and
+// Kill soak: four clients create, delete, wipe, replace, list and empty death
+// row while the daemon is killed with SIGKILL at random moments. After every
+// kill the tree the crash left must pass the consistency checker, and after
+// the restart every container a reply reported as created is still there and
 // every one a reply reported as deleted is still gone.
 //
 // TARN_SOAK_CYCLES (default 200) sets the number of cycles; TARN_SOAK_SECONDS,
@@ -33,6 +33,21 @@ enum class Known { Nothing, Created, Deleted };
 
 class KillSoakTest : public test::CrashTest {
   protected:
+    void SetUp() override {
+        CrashTest::SetUp();
+        if (IsSkipped()) return;
+        // Wiping takes an entitlement of its own.
+        PlistValue entitlements{PlistDict{}};
+        entitlements.set("com.ostrea.private.TarnKeeper.allowed", true);
+        entitlements.set("com.ostrea.private.TarnKeeper.deleteContainerContent", true);
+        admin_ = daemon_->addClient("soaker", "com.soak.soaker", entitlements);
+    }
+
+    static std::string uuidOf(const std::optional<PlistValue>& reply) {
+        const PlistValue* u = reply ? reply->find("ReplyUUID") : nullptr;
+        return u && u->asUuid() ? u->asUuid()->string() : std::string();
+    }
+
     static std::string identifier(int client, int i) {
         return "com.soak.c" + std::to_string(client) + "." + std::to_string(i);
     }
@@ -45,7 +60,7 @@ class KillSoakTest : public test::CrashTest {
         while (!stop.load()) {
             const std::string id = identifier(c, static_cast<int>(rng() % kIdentifiersPerClient));
             const std::string ofId = R"("ContainerClass": 2, "Identifier": ")" + id + R"(")";
-            const unsigned pick = rng() % 8;
+            const unsigned pick = rng() % 10;
             if (pick < 4) {
                 const uint64_t e = errorOf(daemon_->send(
                     admin_, R"({"Command": 0, "CreateIfNecessary": true, )" + ofId + "}"));
@@ -63,6 +78,25 @@ class KillSoakTest : public test::CrashTest {
                 else
                     known_[id] = Known::Nothing;
             } else if (pick < 7) {
+                // A wipe keeps the container, whatever its outcome.
+                (void)daemon_->send(admin_, R"({"Command": 12, )" + ofId + "}");
+            } else if (pick < 8) {
+                // A replacement moves a transient container in under the
+                // same identifier: live before, live after, whatever happens.
+                const std::string old =
+                    uuidOf(daemon_->send(admin_, R"({"Command": 0, )" + ofId + "}"));
+                const std::string neu = uuidOf(daemon_->send(
+                    admin_, R"({"Command": 0, "CreateIfNecessary": true, "Transient": true, )" +
+                                ofId + "}"));
+                if (!old.empty() && !neu.empty())
+                    (void)daemon_->send(
+                        admin_,
+                        R"({"Command": 2, "OldIdentifier": ")" + id +
+                            R"(", "OldContainerClass": 2, "OldContainerUUID": {"$uuid": ")" + old +
+                            R"("}, "NewIdentifier": ")" + id +
+                            R"(", "NewContainerClass": 2, "NewContainerUUID": {"$uuid": ")" + neu +
+                            R"("}})");
+            } else if (pick < 9) {
                 (void)daemon_->send(admin_, R"({"Command": 4})");
             } else {
                 (void)daemon_->send(admin_, R"({"Command": 1, "ContainerClass": 2})");

@@ -5,12 +5,14 @@
 // SetUp) when the binaries are not built or the process is not root.
 #pragma once
 
+#include <cstdlib>
 #include <memory>
 #include <optional>
 #include <string>
 
 #include "Daemon/TarnUserIdentityCache.h"
 #include "Platform/Failpoints.h"
+#include "Platform/FirstBootMarker.h"
 #include "support/DaemonHarness.h"
 
 namespace tarn::test {
@@ -27,6 +29,8 @@ class CrashTest : public ScratchRootTest {
     }
     void TearDown() override {
         if (daemon_) daemon_->kill9();
+        // The daemon's first start made it; it must not outlive the scratch root.
+        (void)FirstBootMarkerRemove();
         TarnUserIdentityCache::TEST_setPersonasAreSupported(std::nullopt);
     }
 
@@ -34,6 +38,19 @@ class CrashTest : public ScratchRootTest {
     static uint64_t errorOf(const std::optional<PlistValue>& reply) {
         const PlistValue* e = reply ? reply->find("ReplyError") : nullptr;
         return e ? e->asUInt64().value_or(0) : 0;
+    }
+
+    // Starts the daemon with `failpoints` dormant until it receives SIGUSR2,
+    // so that hit counts start with the request rather than with start-up;
+    // `trace` names a file that gets every failpoint passed.
+    void startArmed(const std::string& failpoints, const std::string& trace = "") {
+        ::setenv("TARN_FAILPOINTS_GATE", "1", 1);
+        ::setenv("TARN_FAILPOINTS", failpoints.c_str(), 1);
+        if (!trace.empty()) ::setenv("TARN_FAILPOINTS_TRACE", trace.c_str(), 1);
+        daemon_->start();
+        ::unsetenv("TARN_FAILPOINTS_GATE");
+        ::unsetenv("TARN_FAILPOINTS");
+        ::unsetenv("TARN_FAILPOINTS_TRACE");
     }
 
     std::unique_ptr<DaemonHarness> daemon_;
