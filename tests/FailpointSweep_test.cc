@@ -44,11 +44,7 @@ class FailpointSweepTest : public test::CrashTest, public ::testing::WithParamIn
     void SetUp() override {
         CrashTest::SetUp();
         if (IsSkipped()) return;
-        // Wiping takes an entitlement of its own.
-        PlistValue entitlements{PlistDict{}};
-        entitlements.set("com.ostrea.private.TarnKeeper.allowed", true);
-        entitlements.set("com.ostrea.private.TarnKeeper.deleteContainerContent", true);
-        admin_ = daemon_->addClient("sweeper", "com.sweep.sweeper", entitlements);
+        useWipingAdmin("sweeper", "com.sweep.sweeper");
         ASSERT_EQ(LockStateSet(0), 0);
         // Every start is a later start in the same boot: a first one would
         // throw away the transient containers a replacement brings in.

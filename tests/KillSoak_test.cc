@@ -36,11 +36,7 @@ class KillSoakTest : public test::CrashTest {
     void SetUp() override {
         CrashTest::SetUp();
         if (IsSkipped()) return;
-        // Wiping takes an entitlement of its own.
-        PlistValue entitlements{PlistDict{}};
-        entitlements.set("com.ostrea.private.TarnKeeper.allowed", true);
-        entitlements.set("com.ostrea.private.TarnKeeper.deleteContainerContent", true);
-        admin_ = daemon_->addClient("soaker", "com.soak.soaker", entitlements);
+        useWipingAdmin("soaker", "com.soak.soaker");
     }
 
     static std::string uuidOf(const std::optional<PlistValue>& reply) {

@@ -53,6 +53,15 @@ class CrashTest : public ScratchRootTest {
         ::unsetenv("TARN_FAILPOINTS_TRACE");
     }
 
+    // Makes admin_ a privileged client that may also wipe, which takes an
+    // entitlement of its own.
+    void useWipingAdmin(const std::string& name, const std::string& identifier) {
+        PlistValue entitlements{PlistDict{}};
+        entitlements.set("com.ostrea.private.TarnKeeper.allowed", true);
+        entitlements.set("com.ostrea.private.TarnKeeper.deleteContainerContent", true);
+        admin_ = daemon_->addClient(name, identifier, entitlements);
+    }
+
     std::unique_ptr<DaemonHarness> daemon_;
     std::string admin_;
 };
