@@ -5,10 +5,10 @@
 // Order matters: the listener queue gets the start-up work before the
 // listener is resumed, so no request is handled before start-up has finished.
 #include <CLI/CLI.hpp>
-
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
+#include <mutex>
 
 #include "Daemon/TarnDaemon.h"
 #include "Daemon/TarnLog.h"
@@ -24,6 +24,9 @@ using namespace tarn;
 namespace {
 
 constexpr auto kShutdownBound = std::chrono::seconds(20);
+// Set up on the main thread, cancelled from the signal thread: the lock orders
+// the two (a stop may arrive while the listener is still being made).
+std::mutex gListenerMu;
 std::shared_ptr<conduit::Listener> gListener;
 
 void newConnection(const conduit::ConnectionRef& peer) {
@@ -54,7 +57,10 @@ int main(int argc, char** argv) {
     // Before any thread exists, so every thread inherits the blocked mask.
     ServiceHandleTerminationSignals([] {
         ServiceNotifyStopping();
-        if (gListener) gListener->cancel();
+        {
+            std::lock_guard lock(gListenerMu);
+            if (gListener) gListener->cancel();
+        }
         // Background work holds transactions; give it a bounded time to finish.
         (void)Transaction::waitForIdle(std::chrono::duration_cast<std::chrono::milliseconds>(kShutdownBound));
         std::_Exit(0);
@@ -67,15 +73,19 @@ int main(int argc, char** argv) {
         Transaction::end();
     });
 
-    std::string why;
-    gListener = conduit::Listener::create("com.ostrea.tarnkeeperd", listenerQueue, &why);
-    if (!gListener) {
-        TarnLog(kLogError, "main", "unable to start conduit service!");
-        PlatformLog("daemon", PlatformLogType::Error, "conduit listener: %s", why);
-    } else {
-        gListener->setNewConnectionHandler(newConnection);
-        gListener->resume();
-        PlatformLog("daemon", PlatformLogType::Default, "listening on %s", gListener->socketPath());
+    {
+        std::lock_guard lock(gListenerMu);
+        std::string why;
+        gListener = conduit::Listener::create("com.ostrea.tarnkeeperd", listenerQueue, &why);
+        if (!gListener) {
+            TarnLog(kLogError, "main", "unable to start conduit service!");
+            PlatformLog("daemon", PlatformLogType::Error, "conduit listener: %s", why);
+        } else {
+            gListener->setNewConnectionHandler(newConnection);
+            gListener->resume();
+            PlatformLog("daemon", PlatformLogType::Default, "listening on %s",
+                        gListener->socketPath());
+        }
     }
     DispatchQueue::runMain();
     return 0;

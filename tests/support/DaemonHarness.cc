@@ -7,6 +7,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <iterator>
@@ -22,6 +23,11 @@ namespace fs = std::filesystem;
 namespace tarn::test {
 
 std::string BuiltBinary(const std::string& name) { return std::string(TARN_BINARY_DIR) + "/" + name; }
+
+std::string DaemonBinary() {
+    const char* other = std::getenv("TARN_TEST_DAEMON");
+    return other && *other ? std::string(other) : BuiltBinary("tarnkeeperd");
+}
 
 ProcessResult RunProcess(const std::vector<std::string>& argv, std::chrono::milliseconds timeout) {
     ProcessResult r;
@@ -127,8 +133,8 @@ void DaemonHarness::start(bool waitReady) {
     std::error_code ec;
     auto size = fs::file_size(root_.at("/run/tarnkeeper/notifications"), ec);
     notificationsAtStart_ = ec ? 0 : static_cast<size_t>(size);
-    std::vector<std::string> argv = {BuiltBinary("tarnkeeperd"), "--root", root_.path(),
-                                     "--platform-log", platformLogPath_};
+    std::vector<std::string> argv = {DaemonBinary(), "--root", root_.path(), "--platform-log",
+                                     platformLogPath_};
     std::vector<char*> args;
     for (auto& a : argv) args.push_back(const_cast<char*>(a.c_str()));
     args.push_back(nullptr);

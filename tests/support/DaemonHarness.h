@@ -28,6 +28,9 @@ ProcessResult RunProcess(const std::vector<std::string>& argv,
                          std::chrono::milliseconds timeout = std::chrono::seconds(30));
 
 std::string BuiltBinary(const std::string& name);  // TARN_BINARY_DIR/name
+// The daemon the harness starts: $TARN_TEST_DAEMON when set (another build of
+// it, e.g. under the thread sanitizer), else the one built with the tests.
+std::string DaemonBinary();
 
 class DaemonHarness {
 public:
@@ -85,10 +88,9 @@ private:
 }  // namespace tarn::test
 
 // Skips the test unless the daemon and tarnctl it drives have been built.
-#define TARN_REQUIRE_DAEMON_BINARIES()                                                    \
-    do {                                                                                  \
-        if (!std::filesystem::exists(::tarn::test::BuiltBinary("tarnkeeperd")) ||          \
-            !std::filesystem::exists(::tarn::test::BuiltBinary("tarnctl")))                \
-            GTEST_SKIP() << "tarnkeeperd and tarnctl are not built";                     \
+#define TARN_REQUIRE_DAEMON_BINARIES()                                      \
+    do {                                                                    \
+        if (!std::filesystem::exists(::tarn::test::DaemonBinary()) ||       \
+            !std::filesystem::exists(::tarn::test::BuiltBinary("tarnctl"))) \
+            GTEST_SKIP() << "tarnkeeperd and tarnctl are not built";        \
     } while (0)
-
