@@ -84,25 +84,32 @@ class SweepHarness : public test::CrashTest {
                R"("})";
     }
 
-    // The daemon restarts after a kill; the first restart dies at
-    // `recoveryCrash` ("name=kill" or "name=kill@N") if its recovery gets there.
-    void restartAfterKill(const std::string& recoveryCrash) {
-        ::setenv("TARN_FAILPOINTS", recoveryCrash.c_str(), 1);
+    // Starts with `failpoints` armed from start-up on, without a gate; with
+    // `trace`, records the hits. Returns once the daemon has died or
+    // start-up's clean-up has been announced; true when it died.
+    bool startWith(const std::string& failpoints, const std::string& trace = "") {
+        ::setenv("TARN_FAILPOINTS", failpoints.c_str(), 1);
+        if (!trace.empty()) ::setenv("TARN_FAILPOINTS_TRACE", trace.c_str(), 1);
         daemon_->start(/*waitReady=*/false);
         ::unsetenv("TARN_FAILPOINTS");
-        // Either start-up dies at the failpoint or it finishes; a finished one
-        // still has the failpoint armed, so it goes too.
+        ::unsetenv("TARN_FAILPOINTS_TRACE");
         const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
         while (std::chrono::steady_clock::now() < deadline) {
-            if (daemon_->waitExit(std::chrono::milliseconds(20))) {
-                ++recoveryCrashes_;
-                break;
-            }
+            if (daemon_->waitExit(std::chrono::milliseconds(20))) return true;
             if (daemon_->waitForNotification("com.ostrea.tarnkeeper.cleanup-complete",
                                              std::chrono::milliseconds(20),
                                              /*sinceLastStart=*/true))
-                break;
+                return false;
         }
+        ADD_FAILURE() << "start-up neither died nor finished";
+        return false;
+    }
+
+    // The daemon restarts after a kill; the first restart dies at
+    // `recoveryCrash` ("name=kill" or "name=kill@N") if its recovery gets
+    // there. A restart that finished still has the failpoint armed, so it goes too.
+    void restartAfterKill(const std::string& recoveryCrash) {
+        if (startWith(recoveryCrash)) ++recoveryCrashes_;
         daemon_->kill9();
         daemon_->start();
     }
@@ -470,27 +477,6 @@ class BootSweepTest : public SweepHarness, public ::testing::WithParamInterface<
         std::error_code ec;
         fs::remove_all(root_.at("/run"), ec);
         ASSERT_FALSE(ec) << ec.message();
-    }
-
-    // Starts with `failpoints` armed from start-up on; with `trace`, records
-    // the hits. Returns once the daemon has died or start-up's clean-up has
-    // been announced; true when it died.
-    bool startWith(const std::string& failpoints, const std::string& trace = "") {
-        ::setenv("TARN_FAILPOINTS", failpoints.c_str(), 1);
-        if (!trace.empty()) ::setenv("TARN_FAILPOINTS_TRACE", trace.c_str(), 1);
-        daemon_->start(/*waitReady=*/false);
-        ::unsetenv("TARN_FAILPOINTS");
-        ::unsetenv("TARN_FAILPOINTS_TRACE");
-        const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
-        while (std::chrono::steady_clock::now() < deadline) {
-            if (daemon_->waitExit(std::chrono::milliseconds(20))) return true;
-            if (daemon_->waitForNotification("com.ostrea.tarnkeeper.cleanup-complete",
-                                             std::chrono::milliseconds(20),
-                                             /*sinceLastStart=*/true))
-                return false;
-        }
-        ADD_FAILURE() << "start-up neither died nor finished";
-        return false;
     }
 
     // The hits of one start of `row`, with or without its leftovers; the
