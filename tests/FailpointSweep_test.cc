@@ -6,6 +6,7 @@
 // the tree must pass the consistency checker (strict: no orphan either) and
 // the operation's own effect must be as before or as after, never between:
 // a request that failed left nothing, one that succeeded left everything.
+// The start-up sweeps of leftovers are rows of their own (see below).
 #include <gtest/gtest.h>
 #include <signal.h>
 
@@ -27,6 +28,8 @@ namespace {
 namespace fs = std::filesystem;
 class FailpointSweepTest;
 
+constexpr const char* kCaches = "/private/var/root/Library/Caches/com.ostrea.tarnkeeperd";
+
 // One mutating operation.
 struct SweepRow {
     const char* name;
@@ -37,7 +40,9 @@ struct SweepRow {
     void (*check)(FailpointSweepTest& t, const std::string& id, uint64_t reply);
 };
 
-class FailpointSweepTest : public test::CrashTest, public ::testing::WithParamInterface<SweepRow> {
+// What the request rows and the start rows share: the daemon, its client,
+// the restart after a kill, the checker and the figures.
+class SweepHarness : public test::CrashTest {
   public:
     using CrashTest::errorOf;
 
@@ -79,25 +84,32 @@ class FailpointSweepTest : public test::CrashTest, public ::testing::WithParamIn
                R"("})";
     }
 
-    // The daemon restarts after a kill; when `recoveryCrash` names a
-    // failpoint, the first restart dies there if its recovery passes it.
-    void restartAfterKill(const std::string& recoveryCrash) {
-        ::setenv("TARN_FAILPOINTS", (recoveryCrash + "=kill").c_str(), 1);
+    // Starts with `failpoints` armed from start-up on, without a gate; with
+    // `trace`, records the hits. Returns once the daemon has died or
+    // start-up's clean-up has been announced; true when it died.
+    bool startWith(const std::string& failpoints, const std::string& trace = "") {
+        ::setenv("TARN_FAILPOINTS", failpoints.c_str(), 1);
+        if (!trace.empty()) ::setenv("TARN_FAILPOINTS_TRACE", trace.c_str(), 1);
         daemon_->start(/*waitReady=*/false);
         ::unsetenv("TARN_FAILPOINTS");
-        // Either start-up dies at the failpoint or it finishes; a finished one
-        // still has the failpoint armed, so it goes too.
+        ::unsetenv("TARN_FAILPOINTS_TRACE");
         const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(30);
         while (std::chrono::steady_clock::now() < deadline) {
-            if (daemon_->waitExit(std::chrono::milliseconds(20))) {
-                ++recoveryCrashes_;
-                break;
-            }
+            if (daemon_->waitExit(std::chrono::milliseconds(20))) return true;
             if (daemon_->waitForNotification("com.ostrea.tarnkeeper.cleanup-complete",
                                              std::chrono::milliseconds(20),
                                              /*sinceLastStart=*/true))
-                break;
+                return false;
         }
+        ADD_FAILURE() << "start-up neither died nor finished";
+        return false;
+    }
+
+    // The daemon restarts after a kill; the first restart dies at
+    // `recoveryCrash` ("name=kill" or "name=kill@N") if its recovery gets
+    // there. A restart that finished still has the failpoint armed, so it goes too.
+    void restartAfterKill(const std::string& recoveryCrash) {
+        if (startWith(recoveryCrash)) ++recoveryCrashes_;
         daemon_->kill9();
         daemon_->start();
     }
@@ -108,57 +120,6 @@ class FailpointSweepTest : public test::CrashTest, public ::testing::WithParamIn
         const TarnConsistencyReport report = TarnCheckContainerTree({.orphansAreViolations = true});
         EXPECT_TRUE(report.clean()) << what << "\n" << report.describe();
         violations_ += report.violations.size();
-    }
-
-    // The failpoints the request of `row` passes, with their hit counts.
-    std::map<std::string, int> trace(const SweepRow& row) {
-        const std::string file = root_.at("/failpoint.trace");
-        startArmed("", file);
-        const std::string request = row.prepare(*this, "com.sweep.traced");
-        daemon_->signal(SIGUSR2);
-        const uint64_t reply = ask(request);
-        EXPECT_EQ(reply, TarnSuccess) << row.name << " fails even without a failpoint";
-        stopAndVerify(std::string(row.name) + " without a failpoint");
-        std::map<std::string, int> hits;
-        std::ifstream in(file);
-        for (std::string line; std::getline(in, line);) ++hits[line];
-        return hits;
-    }
-
-    void sweep(const SweepRow& row) {
-        const std::map<std::string, int> hits = trace(row);
-        ASSERT_FALSE(hits.empty()) << row.name << " passes no failpoint";
-        int n = 0;
-        for (const auto& [name, count] : hits) {
-            std::vector<std::string> actions = {"kill@1", "errno:28@1", "errno:5@1"};
-            if (count > 1) actions.push_back("kill@" + std::to_string(count));
-            if (name.starts_with("fm.move")) actions.push_back("errno:18@1");
-            for (const std::string& action : actions) {
-                const std::string id = "com.sweep.case" + std::to_string(n++);
-                SCOPED_TRACE(std::string(row.name) + " with " + name + "=" + action);
-                startArmed(name + "=" + action);
-                const std::string request = row.prepare(*this, id);
-                daemon_->signal(SIGUSR2);
-                std::optional<PlistValue> reply = send(request);
-                const bool killed = action.starts_with("kill");
-                if (killed) {
-                    // The traced hit may have come from background work that
-                    // this run did not do (yet): then the case is a plain kill.
-                    if (!daemon_->waitExit(std::chrono::seconds(2))) {
-                        daemon_->kill9();
-                        ++notReached_;
-                    }
-                    restartAfterKill(name);
-                }
-                row.check(*this, id, killed ? 0 : errorOf(reply));
-                stopAndVerify(name + "=" + action);
-                ++cases_;
-                if (HasFailure()) return;
-            }
-        }
-        std::cout << "[ sweep    ] " << row.name << ": " << hits.size() << " failpoints, " << cases_
-                  << " cases (" << notReached_ << " kills not reached), " << recoveryCrashes_
-                  << " crashes inside recovery, " << violations_ << " violations\n";
     }
 
     // Path and UUID of the live container of `id` ("" when there is none).
@@ -200,13 +161,77 @@ class FailpointSweepTest : public test::CrashTest, public ::testing::WithParamIn
         daemon_->start();
     }
 
-    // What the replacement of the current case started from.
-    std::string oldUuid_, newUuid_;
+    // The actions a case list runs at a failpoint whose hits of interest are
+    // `first` to `last`: a kill at both ends, ENOSPC, EIO and, for moves, EXDEV.
+    static std::vector<std::string> actionsFor(const std::string& name, int first, int last) {
+        const std::string at = "@" + std::to_string(first);
+        std::vector<std::string> actions = {"kill" + at, "errno:28" + at, "errno:5" + at};
+        if (last > first) actions.push_back("kill@" + std::to_string(last));
+        if (name.starts_with("fm.move")) actions.push_back("errno:18" + at);
+        return actions;
+    }
+    void report(const char* row, size_t failpoints) {
+        std::cout << "[ sweep    ] " << row << ": " << failpoints << " failpoints, " << cases_
+                  << " cases (" << notReached_ << " kills not reached), " << recoveryCrashes_
+                  << " crashes inside recovery, " << violations_ << " violations\n";
+    }
 
     int cases_ = 0;
     int recoveryCrashes_ = 0;
     int notReached_ = 0;
     size_t violations_ = 0;
+};
+
+class FailpointSweepTest : public SweepHarness, public ::testing::WithParamInterface<SweepRow> {
+  public:
+    // The failpoints the request of `row` passes, with their hit counts.
+    std::map<std::string, int> trace(const SweepRow& row) {
+        const std::string file = root_.at("/failpoint.trace");
+        startArmed("", file);
+        const std::string request = row.prepare(*this, "com.sweep.traced");
+        daemon_->signal(SIGUSR2);
+        const uint64_t reply = ask(request);
+        EXPECT_EQ(reply, TarnSuccess) << row.name << " fails even without a failpoint";
+        stopAndVerify(std::string(row.name) + " without a failpoint");
+        std::map<std::string, int> hits;
+        std::ifstream in(file);
+        for (std::string line; std::getline(in, line);) ++hits[line];
+        return hits;
+    }
+
+    void sweep(const SweepRow& row) {
+        const std::map<std::string, int> hits = trace(row);
+        ASSERT_FALSE(hits.empty()) << row.name << " passes no failpoint";
+        int n = 0;
+        for (const auto& [name, count] : hits) {
+            for (const std::string& action : actionsFor(name, 1, count)) {
+                const std::string id = "com.sweep.case" + std::to_string(n++);
+                SCOPED_TRACE(std::string(row.name) + " with " + name + "=" + action);
+                startArmed(name + "=" + action);
+                const std::string request = row.prepare(*this, id);
+                daemon_->signal(SIGUSR2);
+                std::optional<PlistValue> reply = send(request);
+                const bool killed = action.starts_with("kill");
+                if (killed) {
+                    // The traced hit may have come from background work that
+                    // this run did not do (yet): then the case is a plain kill.
+                    if (!daemon_->waitExit(std::chrono::seconds(2))) {
+                        daemon_->kill9();
+                        ++notReached_;
+                    }
+                    restartAfterKill(name + "=kill");
+                }
+                row.check(*this, id, killed ? 0 : errorOf(reply));
+                stopAndVerify(name + "=" + action);
+                ++cases_;
+                if (HasFailure()) return;
+            }
+        }
+        report(row.name, hits.size());
+    }
+
+    // What the replacement of the current case started from.
+    std::string oldUuid_, newUuid_;
 };
 
 // ---- the rows ----
@@ -392,6 +417,204 @@ const SweepRow kRows[] = {
 TEST_P(FailpointSweepTest, TreeIsAsBeforeOrAsAfter) { sweep(GetParam()); }
 
 INSTANTIATE_TEST_SUITE_P(Operations, FailpointSweepTest, ::testing::ValuesIn(kRows),
+                         [](const auto& info) { return std::string(info.param.name); });
+
+// ---- the start rows ----
+//
+// The boot sweeps are work of a start rather than of a request, so their
+// failpoints are armed from the start without a gate and "@N" counts from
+// start-up. The hits a start makes without leftovers are start-up's own; the
+// sweep takes the ones the leftovers add, which come after them (the sweeps
+// run on the background queue once start-up has finished).
+
+struct BootSweepRow {
+    const char* name;
+    // The first start after a boot, which also sweeps orphans and transient data.
+    bool afterBoot;
+};
+
+// A leftover directory and the two files that mark it, one at its top and
+// one below, so that a half-removed leftover shows.
+struct Leftover {
+    std::string dir;
+    std::string files[2];
+};
+
+class BootSweepTest : public SweepHarness, public ::testing::WithParamInterface<BootSweepRow> {
+  public:
+    static constexpr const char* kMark = "tarn-sweep-leftover";
+
+    std::vector<Leftover> leftovers(const BootSweepRow& row) const {
+        std::vector<std::string> dirs = {std::string(kCaches) + "/Staging/half-built",
+                                         "/private/var/mobile/Containers/Staging/half-built"};
+        if (row.afterBoot) {
+            dirs.push_back(
+                "/private/var/mobile/Containers/Data/Application/"
+                "0A0B0C0D-1111-4222-8333-444455556666");
+            dirs.push_back(std::string(kCaches) + "/Temp/leftover");
+            dirs.push_back("/private/var/mobile/Containers/Temp/leftover");
+        }
+        std::vector<Leftover> out;
+        for (size_t i = 0; i < dirs.size(); ++i)
+            out.push_back({dirs[i],
+                           {dirs[i] + "/" + kMark + std::to_string(i) + "a",
+                            dirs[i] + "/Library/" + kMark + std::to_string(i) + "b"}});
+        return out;
+    }
+    static bool inStaging(const std::string& path) {
+        return path.find("/Staging/") != std::string::npos;
+    }
+
+    // Plants the leftovers of `row` in a stopped daemon's tree and, for the
+    // first start after a boot, forgets the boot.
+    void plant(const BootSweepRow& row) {
+        for (const Leftover& l : leftovers(row))
+            for (const std::string& file : l.files) root_.writeFile(file, "x");
+        if (row.afterBoot) forgetBoot();
+    }
+    void forgetBoot() {
+        ASSERT_EQ(FirstBootMarkerRemove(), 0);
+        std::error_code ec;
+        fs::remove_all(root_.at("/run"), ec);
+        ASSERT_FALSE(ec) << ec.message();
+    }
+
+    // The hits of one start of `row`, with or without its leftovers; the
+    // requests of the checks that follow do not count.
+    std::map<std::string, int> traceStart(const BootSweepRow& row, bool withLeftovers) {
+        const std::string file = root_.at("/failpoint.trace");
+        fs::remove(file);
+        if (withLeftovers)
+            plant(row);
+        else if (row.afterBoot)
+            forgetBoot();
+        EXPECT_FALSE(startWith("", file)) << row.name << " died without a failpoint";
+        std::map<std::string, int> hits;
+        std::ifstream in(file);
+        for (std::string line; std::getline(in, line);) ++hits[line];
+        if (withLeftovers) checkAfter(row);
+        stopAndVerify(std::string(row.name) + " without a failpoint");
+        return hits;
+    }
+
+    // Live containers the sweeps must leave alone: identifier -> class.
+    const std::map<std::string, int> kLive = {{"com.sweep.live", 2}, {"com.sweep.plugin", 4}};
+    std::string liveRequest(const std::string& id, int cls) const {
+        return R"({"Command": 0, "CreateIfNecessary": true, "ContainerClass": )" +
+               std::to_string(cls) + R"(, "Identifier": ")" + id + R"("})";
+    }
+    void makeLive(const BootSweepRow& row) {
+        daemon_->start();
+        for (const auto& [id, cls] : kLive) {
+            auto r = send(liveRequest(id, cls));
+            ASSERT_EQ(errorOf(r), TarnSuccess) << id;
+            livePaths_[id] = stringOf(r, "ReplyPath");
+            std::ofstream(livePaths_[id] + "/" + kMark + "-live") << "live";
+        }
+        stopAndVerify("live containers");
+        // The first boot of a tree does one-off work (the build record) that
+        // would blur which hits the leftovers add.
+        if (row.afterBoot) {
+            forgetBoot();
+            daemon_->start();
+            stopAndVerify("first boot");
+        }
+    }
+
+    // With a cleanly started daemon: the live containers are as they were and
+    // every leftover is whole where it was or gone, nowhere in between.
+    void checkAfter(const BootSweepRow& row) {
+        for (const auto& [id, cls] : kLive) {
+            auto r = send(liveRequest(id, cls));
+            EXPECT_EQ(stringOf(r, "ReplyPath"), livePaths_[id]) << id << " moved or was made anew";
+            EXPECT_TRUE(fs::exists(livePaths_[id] + "/" + kMark + "-live"))
+                << id << " lost content";
+        }
+        std::map<std::string, std::string> original;
+        for (const Leftover& l : leftovers(row)) {
+            for (const std::string& file : l.files)
+                original[fs::path(file).filename()] = root_.at(file);
+            EXPECT_EQ(fs::exists(root_.at(l.files[0])), fs::exists(root_.at(l.files[1])))
+                << l.dir << " is half there";
+        }
+        std::error_code ec;
+        for (auto it = fs::recursive_directory_iterator(root_.path(), ec);
+             !ec && it != fs::recursive_directory_iterator(); it.increment(ec)) {
+            const std::string name = it->path().filename();
+            if (!name.starts_with(kMark) || name.ends_with("-live")) continue;
+            // What a deletion pass can neither remove nor leave goes to /tmp.
+            if (it->path().string().starts_with(root_.at("/tmp/"))) continue;
+            EXPECT_EQ(it->path().string(), original[name]) << "a leftover half-moved";
+            // A clean start empties staging whatever the case left there.
+            EXPECT_FALSE(inStaging(it->path().string())) << "a clean start kept " << it->path();
+        }
+        const std::string deathRow = root_.at(std::string(kCaches) + "/Dead");
+        EXPECT_TRUE(!fs::exists(deathRow) || fs::is_empty(deathRow)) << "death row kept something";
+    }
+
+    void sweepStarts(const BootSweepRow& row) {
+        makeLive(row);
+        const std::map<std::string, int> before = traceStart(row, /*withLeftovers=*/false);
+        const std::map<std::string, int> hits = traceStart(row, /*withLeftovers=*/true);
+        size_t failpoints = 0;
+        for (const auto& [name, count] : hits) {
+            const int first = (before.contains(name) ? before.at(name) : 0) + 1;
+            if (count < first) continue;  // start-up's own
+            ++failpoints;
+            // A start is cheap: every hit the leftovers add gets its cases.
+            for (int hit = first; hit <= count; ++hit) {
+                for (const std::string& action : actionsFor(name, hit, hit)) {
+                    runCase(row, name + "=" + action);
+                    if (HasFailure()) return;
+                }
+            }
+        }
+        ASSERT_GT(failpoints, 0u) << row.name << " passes no failpoint";
+        report(row.name, failpoints);
+    }
+    void runCase(const BootSweepRow& row, const std::string& failpoint) {
+        SCOPED_TRACE(std::string(row.name) + " with " + failpoint);
+        plant(row);
+        const bool died = startWith(failpoint);
+        if (failpoint.find("=kill") != std::string::npos) {
+            if (!died) {
+                daemon_->kill9();
+                ++notReached_;
+            }
+            // The next start redoes the sweep and dies at the same hit.
+            restartAfterKill(failpoint);
+        } else {
+            EXPECT_FALSE(died) << "a failed sweep step stopped the daemon";
+            restart();
+        }
+        checkAfter(row);
+        // What a failure left outside staging the next boot takes.
+        if (row.afterBoot && !settled(row)) {
+            daemon_->stop();
+            forgetBoot();
+            daemon_->start();
+            EXPECT_TRUE(settled(row)) << "the next boot left a leftover";
+        }
+        stopAndVerify(failpoint);
+        ++cases_;
+    }
+    bool settled(const BootSweepRow& row) {
+        for (const Leftover& l : leftovers(row))
+            if (fs::exists(root_.at(l.dir))) return false;
+        return true;
+    }
+
+    std::map<std::string, std::string> livePaths_;
+};
+
+const BootSweepRow kStartRows[] = {
+    {"staging_sweep", /*afterBoot=*/false},
+    {"orphan_and_transient_sweeps", /*afterBoot=*/true},
+};
+
+TEST_P(BootSweepTest, LeftoversAreWholeOrGoneAndLiveContainersStay) { sweepStarts(GetParam()); }
+
+INSTANTIATE_TEST_SUITE_P(Starts, BootSweepTest, ::testing::ValuesIn(kStartRows),
                          [](const auto& info) { return std::string(info.param.name); });
 
 }  // namespace
